@@ -1,0 +1,32 @@
+// The interface of every capture device the add-on offers to JavaScript.
+#pragma once
+
+#include <cstdint>
+#include <string>
+
+namespace capture {
+
+enum SourceType : int32_t {
+  Screen = 0,
+  AudioEndpoint = 1,
+  CameraMicrophone = 2,
+  CameraVideo = 3,
+};
+
+class Source {
+ public:
+  virtual ~Source() = default;
+  virtual int32_t type() = 0;
+  virtual bool isAudio() { return type() == AudioEndpoint || type() == CameraMicrophone; }
+  virtual bool isVideo() { return !isAudio(); }
+  virtual std::string name() = 0;
+  virtual void startPreview() = 0;
+  virtual void stopPreview() = 0;
+  virtual void capture() = 0;
+  virtual void stopCapturing() = 0;
+  virtual void startEncode(std::string filename) = 0;
+  virtual void stopEncode() = 0;
+  virtual bool selected() = 0;
+};
+
+}  // namespace capture

@@ -1,0 +1,11 @@
+// UTF-16 (wide) and UTF-8 conversions for device names and file names.
+#pragma once
+
+#include <string>
+
+namespace capture {
+
+std::string toUtf8(std::wstring text);
+std::wstring toWide(std::string text);
+
+}  // namespace capture

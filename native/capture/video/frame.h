@@ -1,0 +1,50 @@
+// One captured picture, and the queue a video source shares with its encoder and preview.
+#pragma once
+
+#include <atomic>
+#include <cstdint>
+#include <deque>
+#include <memory>
+#include <mutex>
+#include <string>
+
+namespace capture::video {
+
+struct Frame {
+  uint64_t size = 0;           // width * height * 4
+  uint64_t bytesPerPixel = 4;
+  uint64_t width = 0;
+  uint64_t height = 0;
+  uint64_t rowPixels = 0;      // equal to width: rows are packed
+  uint32_t channelOrder = 0;   // 0 display, 1 camera
+  std::unique_ptr<uint8_t[]> data;  // top-down rows, bytes B, G, R, A
+  int64_t timestamp = 0;       // ms since 1970 when the frame was built
+
+  // A frame of width x height pixels with uninitialised pixel bytes.
+  static std::unique_ptr<Frame> make(uint64_t width, uint64_t height, uint32_t channelOrder, int64_t timestamp) {
+    auto frame = std::make_unique<Frame>();
+    frame->size = width * height * 4;
+    frame->width = width;
+    frame->height = height;
+    frame->rowPixels = width;
+    frame->channelOrder = channelOrder;
+    frame->data.reset(new uint8_t[frame->size]);
+    frame->timestamp = timestamp;
+    return frame;
+  }
+};
+
+struct FrameQueue {
+  FrameQueue(std::wstring path, uint64_t width, uint64_t height, uint32_t channelOrder)
+      : path(std::move(path)), width(width), height(height), channelOrder(channelOrder) {}
+
+  std::atomic<bool> stopped{true};
+  std::wstring path;  // the source's name until a display's startEncode stores the file name
+  std::mutex mutex;   // guards frames
+  std::deque<std::unique_ptr<Frame>> frames;  // oldest first
+  const uint64_t width;
+  const uint64_t height;
+  const uint32_t channelOrder;
+};
+
+}  // namespace capture::video

@@ -1,0 +1,108 @@
+'use strict';
+// A private virtual desktop for tests and the demo: an Xvfb display (with optional RandR
+// monitors) and a PulseAudio server with null sinks as playback endpoints and a sine source as
+// a microphone. Everything lives in one temporary folder and is gone after stop().
+const { spawn, spawnSync, execFileSync } = require('child_process');
+const fs = require('fs');
+const os = require('os');
+const path = require('path');
+
+function sleep(ms) {
+  return new Promise((resolve) => setTimeout(resolve, ms));
+}
+
+// Starts Xvfb and resolves with its display name (":N"), read from -displayfd.
+function startXvfb(width, height) {
+  return new Promise((resolve, reject) => {
+    const xvfb = spawn('Xvfb', ['-displayfd', '3', '-screen', '0', `${width}x${height}x24`, '-noreset', '-nolisten', 'tcp'], {
+      stdio: ['ignore', 'ignore', 'pipe', 'pipe'],
+    });
+    let text = '';
+    let errors = '';
+    xvfb.stderr.on('data', (d) => { errors += d; });
+    xvfb.stdio[3].on('data', (d) => {
+      text += d;
+      if (text.includes('\n')) resolve({ process: xvfb, display: `:${text.trim()}` });
+    });
+    xvfb.on('error', reject);
+    xvfb.on('exit', (code) => reject(new Error(`Xvfb ended (${code}): ${errors}`)));
+  });
+}
+
+function pulseConfig(dir, sinks, microphone) {
+  const lines = [`load-module module-native-protocol-unix auth-anonymous=1 socket=${dir}/native`];
+  for (const sink of sinks) {
+    lines.push(`load-module module-null-sink sink_name=${sink.name} rate=${sink.rate || 48000} channels=${sink.channels || 2} ` +
+      `sink_properties="device.description='${sink.description}'"`);
+  }
+  if (sinks.length) lines.push(`set-default-sink ${sinks.find((s) => s.default)?.name || sinks[0].name}`);
+  if (microphone) {
+    lines.push(`load-module module-sine-source source_name=${microphone.name} rate=${microphone.rate || 48000} ` +
+      `frequency=${microphone.frequency || 440} source_properties="device.description='${microphone.description}'"`);
+  }
+  return lines.join('\n') + '\n';
+}
+
+async function startPulse(dir, sinks, microphone) {
+  fs.writeFileSync(path.join(dir, 'conf.pa'), pulseConfig(dir, sinks, microphone));
+  const env = { ...process.env, HOME: dir, XDG_RUNTIME_DIR: dir };
+  const r = spawnSync('pulseaudio', ['--daemonize=yes', '--exit-idle-time=-1', '--system=false', '-n',
+    '-F', path.join(dir, 'conf.pa'), '--use-pid-file=yes', '--log-target=stderr'], { env, encoding: 'utf8' });
+  if (r.status !== 0) throw new Error(`pulseaudio did not start: ${r.stderr}`);
+  const server = `unix:${dir}/native`;
+  for (let i = 0; i < 100; i++) {
+    if (spawnSync('pactl', ['info'], { env: { ...process.env, PULSE_SERVER: server } }).status === 0) return server;
+    await sleep(20);
+  }
+  throw new Error('pulseaudio did not answer');
+}
+
+/**
+ * Starts what the environment does not already give (or everything, with `private: true`).
+ * Options: width, height, monitors (xrandr --setmonitor arguments, e.g. ['LEFT 960/254x1080/286+0+0 screen']),
+ * sinks ([{name, description, rate, channels, default}]), microphone ({name, description, frequency}),
+ * display (false: no X server), audio (false: no sound server).
+ * Resolves with { env, dir, stop() }: env holds DISPLAY and PULSE_SERVER for child processes.
+ */
+async function startDesktop(options = {}) {
+  const {
+    width = 1920, height = 1080, monitors = [], display = true, audio = true,
+    sinks = [{ name: 'tavio_speakers', description: 'Tavio Speakers', default: true }],
+    microphone = { name: 'tavio_mic', description: 'Tavio Microphone', frequency: 440 },
+  } = options;
+  const own = options.private !== false;
+  const dir = fs.mkdtempSync(path.join(os.tmpdir(), 'tavio-desktop-'));
+  const env = {};
+  let xvfb = null;
+  try {
+    if (display && (own || !process.env.DISPLAY)) {
+      xvfb = await startXvfb(width, height);
+      env.DISPLAY = xvfb.display;
+      for (const monitor of monitors) {
+        execFileSync('xrandr', ['--setmonitor', ...monitor.split(' ')], { env: { ...process.env, DISPLAY: env.DISPLAY } });
+      }
+    } else if (display) {
+      env.DISPLAY = process.env.DISPLAY;
+    }
+    if (audio && (own || !process.env.PULSE_SERVER)) {
+      env.PULSE_SERVER = await startPulse(dir, sinks, microphone);
+    } else if (audio) {
+      env.PULSE_SERVER = process.env.PULSE_SERVER;
+    }
+  } catch (e) {
+    stopAll(xvfb, dir);
+    throw e;
+  }
+  return { env, dir, stop: () => stopAll(xvfb, dir) };
+}
+
+function stopAll(xvfb, dir) {
+  const pidFile = path.join(dir, 'pulse', 'pid');
+  if (fs.existsSync(pidFile)) {
+    try { process.kill(Number(fs.readFileSync(pidFile, 'utf8')), 'SIGTERM'); } catch (_) { /* already gone */ }
+  }
+  if (xvfb) xvfb.process.kill('SIGTERM');
+  fs.rmSync(dir, { recursive: true, force: true });
+}
+
+module.exports = { startDesktop };
