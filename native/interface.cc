@@ -1,0 +1,258 @@
+// The add-on's face toward Node: the module record, the seven functions, the source list,
+// event delivery and the screen pump.
+#include <nan.h>
+#include <node.h>
+
+#include <iostream>
+#include <memory>
+#include <stdexcept>
+#include <string>
+#include <thread>
+#include <vector>
+
+#include "capture/audio/source.h"
+#include "capture/audio/wasapi/capturemethod.h"
+#include "capture/check.h"
+#include "capture/clock.h"
+#include "capture/log.h"
+#include "capture/video/camera/mfce/mfcecapturemethod.h"
+#include "capture/video/screen/dxgi/capturemethod.h"
+#include "capture/video/screen/dxgi/source.h"
+#include "capture/video/source.h"
+#include "descriptor.h"
+#include "platform/com.h"
+#include "platform/user32.h"
+
+namespace {
+
+constexpr const char* kFile = "native/interface";
+constexpr WPARAM kTransferCommand = 0x7F8F;
+
+using SourceList = std::vector<std::shared_ptr<capture::Source>>;
+
+// Process-wide state. The list and the callback are never destroyed: detached threads use the
+// list until the process ends, and tearing down a V8 handle after V8 is gone would crash at exit.
+v8::Isolate* isolate = nullptr;
+SourceList& sources = *new SourceList;
+Nan::Persistent<v8::Function>& callback = *new Nan::Persistent<v8::Function>;
+
+v8::Isolate* currentIsolate(const Nan::FunctionCallbackInfo<v8::Value>& info) {
+  return isolate ? isolate : info.GetIsolate();
+}
+
+// An argument counts only when it is a 32-bit integer; anything else is 0.
+int32_t intArgument(const Nan::FunctionCallbackInfo<v8::Value>& info, int index) {
+  if (index >= info.Length() || !info[index]->IsInt32()) return 0;
+  v8::Local<v8::Context> context = currentIsolate(info)->GetCurrentContext();
+  return static_cast<int32_t>(info[index]->IntegerValue(context).FromMaybe(0));
+}
+
+void set(v8::Local<v8::Object> object, const char* key, v8::Local<v8::Value> value) {
+  Nan::Set(object, Nan::New(key).ToLocalChecked(), value);
+}
+
+// Delivers one event to the stored callback, synchronously, inside its own async context.
+void emitEvent(v8::Local<v8::Object> event) {
+  v8::Isolate* js = isolate ? isolate : v8::Isolate::GetCurrent();
+  v8::HandleScope scope(js);
+  v8::Local<v8::Context> context = js->GetCurrentContext();
+  v8::Local<v8::Object> resource = v8::Object::New(js);
+  node::async_context asyncContext = node::EmitAsyncInit(js, resource, "nan:Callback:operator()", -1);
+  v8::Local<v8::Value> argv[] = {event};
+  node::MakeCallback(js, context->Global(), Nan::New(callback), 1, argv, asyncContext);
+  node::EmitAsyncDestroy(js, asyncContext);
+}
+
+v8::Local<v8::Object> newSourceEvent(int32_t uid, capture::Source& source) {
+  v8::Local<v8::Object> descriptor = Nan::New<v8::Object>();
+  for (const auto& [key, value] : capture::describeSource(uid, source)) {
+    if (const auto* number = std::get_if<int32_t>(&value))
+      set(descriptor, key.c_str(), Nan::New(*number));
+    else
+      set(descriptor, key.c_str(), Nan::New(std::get<std::string>(value)).ToLocalChecked());
+  }
+  v8::Local<v8::Object> event = Nan::New<v8::Object>();
+  set(event, "type", Nan::New("new source").ToLocalChecked());
+  set(event, "source", descriptor);
+  return event;
+}
+
+void append(SourceList found) {
+  for (auto& source : found) sources.push_back(std::move(source));
+}
+
+// Keeps every display capturing; its pace is the displays' own acquisition time-out.
+void screenPump() {
+  for (;;) {
+    try {
+      for (size_t i = 0; i < sources.size(); ++i) {
+        std::shared_ptr<capture::Source> source = sources[i];
+        if (source->type() == capture::Screen) source->capture();
+      }
+    } catch (const std::runtime_error& e) {
+      capture::logWarning(e.what());
+    }
+  }
+}
+
+NAN_METHOD(initialize) {
+  isolate = info.GetIsolate();
+  try {
+    const size_t firstNew = sources.size();
+    {
+      capture::video::camera::mfce::MFCECaptureMethod cameras;
+      append(cameras.sources());
+      for (auto& microphone : cameras.audioSources()) sources.push_back(microphone);
+    }
+
+    try {
+      capture::checkResult(kFile, 47, CoInitializeEx(nullptr, COINIT_APARTMENTTHREADED | COINIT_SPEED_OVER_MEMORY),
+                           "Failed to initialize the COM library.");
+    } catch (const std::runtime_error&) {
+      CoUninitialize();
+    }
+
+    append(capture::audio::wasapi::CaptureMethod().sources());
+
+    // Sources of an earlier initialize already run; starting them again from here would race
+    // the screen pump on displays, so only this call's sources are started.
+    for (size_t i = firstNew; i < sources.size(); ++i) {
+      std::shared_ptr<capture::Source> source = sources[i];
+      try {
+        source->capture();
+      } catch (const std::runtime_error& e) {
+        capture::logWarning(e.what());
+      }
+      try {
+        source->startPreview();
+      } catch (const std::runtime_error& e) {
+        capture::logWarning(e.what());
+      }
+    }
+
+    append(capture::video::screen::dxgi::CaptureMethod().sources());
+
+    std::thread(screenPump).detach();
+
+    for (size_t i = 0; i < sources.size(); ++i) {
+      std::shared_ptr<capture::Source> source = sources[i];
+      emitEvent(newSourceEvent(static_cast<int32_t>(i), *source));
+    }
+  } catch (const std::runtime_error& e) {
+    std::cout << e.what() << std::endl;
+  }
+}
+
+NAN_METHOD(getPreview) {
+  const int32_t uid = intArgument(info, 0);
+  std::shared_ptr<capture::Source> source = capture::at(sources, static_cast<size_t>(uid));
+
+  if (source->isAudio()) {
+    auto& audio = dynamic_cast<capture::audio::Source&>(*source);
+    const uint16_t channels = audio.channels();
+    v8::Local<v8::Object> peaks = Nan::New<v8::Object>();
+    set(peaks, "left", Nan::New(audio.peak(0)));
+    set(peaks, "right", Nan::New(channels == 2 ? audio.peak(1) : audio.peak(0)));
+    for (uint16_t channel = 0; channel < channels; ++channel)
+      set(peaks, std::to_string(channel).c_str(), Nan::New(audio.peak(channel)));
+    info.GetReturnValue().Set(peaks);
+    return;
+  }
+
+  try {
+    const int32_t width = intArgument(info, 1);
+    const int32_t height = intArgument(info, 2);
+    if (width < 0 || height < 0) throw std::invalid_argument("preview size must not be negative");
+    auto& video = dynamic_cast<capture::video::Source&>(*capture::at(sources, static_cast<size_t>(uid)));
+    const size_t bytes = static_cast<size_t>(video.pixelWidth()) * static_cast<size_t>(height) * static_cast<size_t>(width);
+    v8::Local<v8::ArrayBuffer> buffer = v8::ArrayBuffer::New(currentIsolate(info), bytes);
+    if (video.preview(static_cast<uint8_t*>(buffer->Data()), 1, width, height))
+      info.GetReturnValue().Set(v8::Uint8ClampedArray::New(buffer, 0, buffer->ByteLength()));
+  } catch (const std::exception& e) {
+    capture::logWarning(e.what());
+  }
+}
+
+NAN_METHOD(transfer) {
+  HWND window = reinterpret_cast<HWND>(static_cast<intptr_t>(intArgument(info, 0)));
+  const BOOL posted = PostMessageA(window, WM_COMMAND, kTransferCommand, 0);
+  SetForegroundWindow(window);
+  info.GetReturnValue().Set(static_cast<uint32_t>(static_cast<uint8_t>(posted)));
+}
+
+NAN_METHOD(setCallback) {
+  // Anything but a function is a programming error of the host: the engine's checked
+  // conversion ends the process, as it always has.
+  v8::MaybeLocal<v8::Function> function;
+  if (info.Length() > 0 && info[0]->IsFunction()) function = info[0].As<v8::Function>();
+  callback.Reset(function.ToLocalChecked());
+}
+
+NAN_METHOD(startCapture) {
+  const int32_t uid = intArgument(info, 0);
+  std::string filename;
+  if (info.Length() >= 2 && info[1]->IsString()) filename = *Nan::Utf8String(info[1]);
+  if (filename.empty()) return;
+
+  try {
+    capture::at(sources, static_cast<size_t>(uid))->startEncode(filename);
+  } catch (const std::exception& e) {
+    capture::logWarning(e.what());
+  }
+
+  v8::Local<v8::Object> event = Nan::New<v8::Object>();
+  set(event, "type", Nan::New("new-clip").ToLocalChecked());
+  set(event, "uid", Nan::New(uid));
+  set(event, "filename", Nan::New(filename).ToLocalChecked());
+  set(event, "start", Nan::New(static_cast<double>(capture::currentTimeMillis())));
+  emitEvent(event);
+}
+
+NAN_METHOD(stopCapture) {
+  const int32_t uid = intArgument(info, 0);
+  try {
+    capture::at(sources, static_cast<size_t>(uid))->stopEncode();
+  } catch (const std::exception& e) {
+    capture::logWarning(e.what());
+  }
+}
+
+NAN_METHOD(mouseCapture) {
+  const int32_t uid = intArgument(info, 0);
+  const int32_t enabled = intArgument(info, 1);
+  try {
+    std::shared_ptr<capture::Source> source = capture::at(sources, static_cast<size_t>(uid));
+    auto* screen = dynamic_cast<capture::video::screen::dxgi::Source*>(source.get());
+    if (!screen) throw std::invalid_argument("mouseCapture: source " + std::to_string(uid) + " is not a display");
+    screen->captureMouse = enabled != 0;
+  } catch (const std::exception& e) {
+    capture::logWarning(e.what());
+  }
+}
+
+void initModule(v8::Local<v8::Object> exports, v8::Local<v8::Value>, void*) {
+  Nan::SetMethod(exports, "initialize", initialize);
+  Nan::SetMethod(exports, "getPreview", getPreview);
+  Nan::SetMethod(exports, "transfer", transfer);
+  Nan::SetMethod(exports, "setCallback", setCallback);
+  Nan::SetMethod(exports, "startCapture", startCapture);
+  Nan::SetMethod(exports, "stopCapture", stopCapture);
+  Nan::SetMethod(exports, "mouseCapture", mouseCapture);
+}
+
+}  // namespace
+
+extern "C" {
+static node::node_module moduleRecord = {
+    NODE_MODULE_VERSION,  // the ABI of the Node that builds the add-on
+    0,
+    nullptr,
+    __FILE__,
+    initModule,
+    nullptr,
+    "tavio_capture",
+    nullptr,
+    nullptr,
+};
+NODE_C_CTOR(_register_tavio_capture_) { node_module_register(&moduleRecord); }
+}

@@ -1,0 +1,54 @@
+'use strict';
+// Runs a piece of JavaScript against the add-on in a child Node process. The add-on starts
+// threads that never end, so every case that calls initialize gets a process of its own.
+const { spawn } = require('child_process');
+const path = require('path');
+
+const root = path.resolve(__dirname, '..', '..');
+const MARK = '@@tavio-report ';
+
+function prelude() {
+  return `
+const addon = require(${JSON.stringify(root)});
+const events = [];
+addon.setCallback((event) => events.push(event));
+const report = (value) => process.stdout.write(${JSON.stringify(MARK)} + JSON.stringify(value) + '\\n');
+const sleep = (ms) => new Promise((resolve) => setTimeout(resolve, ms));
+`;
+}
+
+/**
+ * Runs `script` (may use await) with `addon`, `events`, `report(value)` and `sleep(ms)` defined.
+ * Resolves { reports, stdout, stderr, code, signal }: stdout without the report lines. The child is
+ * ended when the script finishes, or killed after timeoutMs.
+ */
+function runAddon(script, { env = {}, timeoutMs = 60000 } = {}) {
+  const source = `${prelude()}
+(async () => {
+${script}
+})().then(() => process.exit(0), (error) => { console.error(error); process.exit(3); });
+`;
+  return new Promise((resolve) => {
+    const child = spawn(process.execPath, ['-e', source], {
+      env: { ...process.env, ...env },
+      stdio: ['ignore', 'pipe', 'pipe'],
+    });
+    let stdout = '';
+    let stderr = '';
+    child.stdout.on('data', (d) => { stdout += d; });
+    child.stderr.on('data', (d) => { stderr += d; });
+    const timer = setTimeout(() => child.kill('SIGKILL'), timeoutMs);
+    child.on('close', (code, signal) => {
+      clearTimeout(timer);
+      const reports = [];
+      const lines = [];
+      for (const line of stdout.split('\n')) {
+        if (line.startsWith(MARK)) reports.push(JSON.parse(line.slice(MARK.length)));
+        else if (line) lines.push(line);
+      }
+      resolve({ reports, stdout: lines.join('\n'), stderr, code, signal });
+    });
+  });
+}
+
+module.exports = { runAddon, root };
