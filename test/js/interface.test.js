@@ -1,0 +1,99 @@
+'use strict';
+// The add-on's seven functions, argument rules and events, from JavaScript.
+const test = require('node:test');
+const assert = require('node:assert');
+const { runAddon } = require('./addon');
+const { startDesktop } = require('../../scripts/desktop');
+
+const WARNING = /^\d{13}: Warning: (.*)$/;
+const warnings = (stdout) => stdout.split('\n').map((l) => l.match(WARNING)).filter(Boolean).map((m) => m[1]);
+
+test('exports the seven functions in order', async () => {
+  const { reports, code } = await runAddon('report(Object.keys(addon)); report(typeof addon.initialize);');
+  assert.strictEqual(code, 0);
+  assert.deepStrictEqual(reports[0], ['initialize', 'getPreview', 'transfer', 'setCallback', 'startCapture',
+    'stopCapture', 'mouseCapture']);
+  assert.strictEqual(reports[1], 'function');
+});
+
+test('setCallback without a function ends the process', async () => {
+  const { code, signal, stderr } = await runAddon('addon.setCallback(42); report("survived");');
+  assert.ok(code !== 0 || signal, 'the process must not go on');
+  assert.match(stderr, /Empty MaybeLocal/);
+});
+
+test('with a desktop', async (t) => {
+  const desktop = await startDesktop();
+  t.after(() => desktop.stop());
+  const env = desktop.env;
+
+  await t.test('initialize announces every source synchronously, in uid order, with ordered keys', async () => {
+    const { reports, code } = await runAddon(`
+      addon.initialize();
+      report(events);`, { env });
+    assert.strictEqual(code, 0);
+    const events = reports[0];
+    events.forEach((event, i) => {
+      assert.deepStrictEqual(Object.keys(event), ['type', 'source']);
+      assert.strictEqual(event.type, 'new source');
+      const s = event.source;
+      assert.strictEqual(s.id, i);
+      assert.ok(s.selected === 0 || s.selected === 1);
+      const video = s.type === 'dxgi' || s.type === 'mfce_video';
+      assert.deepStrictEqual(Object.keys(s), ['id', 'name', 'selected', 'type',
+        ...(video ? ['pixelWidth', 'width', 'height', 'size'] : [])]);
+      if (video) assert.strictEqual(s.size, s.pixelWidth * s.width * s.height);
+    });
+    // Cameras, then camera microphones, then endpoints, then displays.
+    const order = ['mfce_video', 'mfce_audio', 'wasapi', 'dxgi'];
+    const ranks = events.map((e) => order.indexOf(e.source.type));
+    assert.deepStrictEqual(ranks, [...ranks].sort((a, b) => a - b));
+  });
+
+  await t.test('clips: no name sends nothing, a bad uid warns and still sends new-clip', async () => {
+    const { reports, stdout, code } = await runAddon(`
+      addon.initialize();
+      const count = events.length;
+      addon.startCapture(0);
+      addon.startCapture(0, 42);
+      addon.startCapture(0, '');
+      report(events.length - count);
+      const before = Date.now();
+      addon.startCapture(999, '/tmp/never-written.mp4');
+      const after = Date.now();
+      report({ clip: events[events.length - 1], before, after, delivered: events.length - count });
+      addon.stopCapture(999);
+      addon.mouseCapture(999, 1);
+      addon.stopCapture(-1);`, { env });
+    assert.strictEqual(code, 0);
+    assert.strictEqual(reports[0], 0);
+    const { clip, before, after, delivered } = reports[1];
+    assert.strictEqual(delivered, 1);
+    assert.deepStrictEqual(Object.keys(clip), ['type', 'uid', 'filename', 'start']);
+    assert.strictEqual(clip.type, 'new-clip');
+    assert.strictEqual(clip.uid, 999);
+    assert.strictEqual(clip.filename, '/tmp/never-written.mp4');
+    assert.ok(clip.start >= before && clip.start <= after, `${clip.start} not in [${before}, ${after}]`);
+    assert.deepStrictEqual(warnings(stdout), Array(4).fill('invalid vector<T> subscript'));
+  });
+
+  await t.test('a uid that is not a 32-bit integer counts as 0', async () => {
+    const { reports, code } = await runAddon(`
+      addon.initialize();
+      const sources = events.length;
+      addon.startCapture('2', '/nonexistent-folder/a.mp4');
+      addon.startCapture(2.5, '/nonexistent-folder/b.mp4');
+      addon.startCapture(2 ** 40, '/nonexistent-folder/c.mp4');
+      report({ sources, uids: events.slice(sources).map((e) => e.uid) });
+      for (let i = 0; i < sources; i++) addon.stopCapture(i);`, { env });
+    assert.strictEqual(code, 0);
+    assert.deepStrictEqual(reports[0].uids, [0, 0, 0]);
+  });
+
+  await t.test('transfer answers 1 for the null window and 0 for a window that does not exist', async () => {
+    const { reports, code } = await runAddon(`
+      report([addon.transfer(0), addon.transfer(), addon.transfer(0x7ffffff0), addon.transfer('x')]);`, { env });
+    assert.strictEqual(code, 0);
+    assert.deepStrictEqual(reports[0], [1, 1, 0, 1]);
+  });
+});
