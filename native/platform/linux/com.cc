@@ -57,6 +57,8 @@ HRESULT PropVariantClear(PROPVARIANT* value) {
   if (!value) return E_INVALIDARG;
   if (value->vt == VT_LPWSTR) CoTaskMemFree(value->pwszVal);
   if (value->vt == VT_CLSID) CoTaskMemFree(value->puuid);
+  if (value->vt == VT_UNKNOWN && value->punkVal) value->punkVal->Release();
+  if (value->vt == (VT_VECTOR | VT_UI1)) CoTaskMemFree(value->caub.pElems);
   PropVariantInit(value);
   return S_OK;
 }

@@ -198,7 +198,22 @@ LPVOID CoTaskMemAlloc(SIZE_T size);
 void CoTaskMemFree(LPVOID memory);
 
 // Property values (only the kinds the layer hands out).
-enum VARENUM : VARTYPE { VT_EMPTY = 0, VT_I4 = 3, VT_UI4 = 19, VT_UI8 = 21, VT_LPWSTR = 31, VT_CLSID = 72 };
+enum VARENUM : VARTYPE {
+  VT_EMPTY = 0,
+  VT_I4 = 3,
+  VT_R8 = 5,
+  VT_UNKNOWN = 13,
+  VT_UI1 = 17,
+  VT_UI4 = 19,
+  VT_UI8 = 21,
+  VT_LPWSTR = 31,
+  VT_CLSID = 72,
+  VT_VECTOR = 0x1000,
+};
+struct CAUB {  // counted bytes (VT_VECTOR | VT_UI1), CoTaskMemAlloc'ed
+  ULONG cElems;
+  BYTE* pElems;
+};
 struct PROPVARIANT {
   VARTYPE vt;
   WORD wReserved1, wReserved2, wReserved3;
@@ -206,8 +221,11 @@ struct PROPVARIANT {
     LONG lVal;
     ULONG ulVal;
     ULONGLONG uhVal;
+    double dblVal;
     LPWSTR pwszVal;
     GUID* puuid;
+    IUnknown* punkVal;
+    CAUB caub;
   };
 };
 struct PROPERTYKEY {
