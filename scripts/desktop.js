@@ -105,4 +105,20 @@ function stopAll(xvfb, dir) {
   fs.rmSync(dir, { recursive: true, force: true });
 }
 
-module.exports = { startDesktop };
+// A moving test picture in a borderless window at (x, y); returns the child process.
+function startAnimation(env, { x = 100, y = 100, width = 640, height = 360, rate = 30 } = {}) {
+  return spawn('ffmpeg', ['-loglevel', 'error', '-re', '-f', 'lavfi', '-i', `testsrc2=size=${width}x${height}:rate=${rate}`,
+    '-f', 'sdl2', '-window_x', String(x), '-window_y', String(y), '-window_borderless', '1', 'tavio animation'],
+  { env: { ...process.env, ...env }, stdio: 'ignore' });
+}
+
+// A sine tone played into a sink (the default one when none is named); returns the child process.
+function playTone(env, { frequency = 440, amplitude = 0.5, sink } = {}) {
+  const args = ['-loglevel', 'error', '-re', '-f', 'lavfi', '-i',
+    `sine=frequency=${frequency}:sample_rate=48000,volume=${amplitude * 8}`, '-ac', '2', '-f', 'pulse'];
+  if (sink) args.push('-device', sink);
+  args.push('tavio tone');
+  return spawn('ffmpeg', args, { env: { ...process.env, ...env }, stdio: 'ignore' });
+}
+
+module.exports = { startDesktop, startAnimation, playTone };
