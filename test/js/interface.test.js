@@ -3,7 +3,8 @@
 const test = require('node:test');
 const assert = require('node:assert');
 const { runAddon } = require('./addon');
-const { startDesktop } = require('../../scripts/desktop');
+const { execFileSync } = require('child_process');
+const { startDesktop, startAnimation } = require('../../scripts/desktop');
 
 const WARNING = /^\d{13}: Warning: (.*)$/;
 const warnings = (stdout) => stdout.split('\n').map((l) => l.match(WARNING)).filter(Boolean).map((m) => m[1]);
@@ -90,10 +91,23 @@ test('with a desktop', async (t) => {
     assert.deepStrictEqual(reports[0].uids, [0, 0, 0]);
   });
 
-  await t.test('transfer answers 1 for the null window and 0 for a window that does not exist', async () => {
+  await t.test('transfer answers 1 for the null window and an existing one, 0 for one that does not exist', async () => {
+    const animation = startAnimation(env);
+    t.after(() => animation.kill());
+    let window = 0;
+    for (let i = 0; i < 50 && !window; i++) {
+      try {
+        window = Number(execFileSync('xdotool', ['search', '--name', 'tavio animation'],
+          { env: { ...process.env, ...env }, encoding: 'utf8' }).split('\n')[0]);
+      } catch (_) {
+        await new Promise((resolve) => setTimeout(resolve, 100));
+      }
+    }
+    assert.ok(window > 0, 'the animation window must exist');
     const { reports, code } = await runAddon(`
-      report([addon.transfer(0), addon.transfer(), addon.transfer(0x7ffffff0), addon.transfer('x')]);`, { env });
+      report([addon.transfer(0), addon.transfer(), addon.transfer(0x7ffffff0), addon.transfer('x'),
+              addon.transfer(${window})]);`, { env });
     assert.strictEqual(code, 0);
-    assert.deepStrictEqual(reports[0], [1, 1, 0, 1]);
+    assert.deepStrictEqual(reports[0], [1, 1, 0, 1, 1]);
   });
 });
