@@ -2,6 +2,8 @@
 
 #include <iterator>
 
+#include "platform/linux/wasapi.h"
+
 namespace platform {
 
 namespace {
@@ -15,6 +17,7 @@ HRESULT noClass(REFIID, void** object) {
 // One row per class a family provides (see the family's header for its factory).
 const ClassEntry classes[] = {
     {GUID_NULL, noClass},
+    {CLSID_MMDeviceEnumerator, wasapi::createDeviceEnumerator},
 };
 
 }  // namespace

@@ -1,0 +1,370 @@
+#include "platform/linux/audioclient.h"
+
+#include <algorithm>
+#include <cstring>
+#include <ctime>
+#include <vector>
+
+#include "platform/linux/pulseformat.h"
+
+namespace platform::wasapi {
+
+namespace {
+
+using pulse::Connection;
+using pulse::Lock;
+
+constexpr int64_t kUnitsPerSecond = 10000000;
+// Small server buffers keep loopback packets within milliseconds of what the sink plays; an idle
+// null sink otherwise holds its monitor data back for up to two seconds.
+constexpr int64_t kPlaybackTarget = 200000;   // 20 ms queued ahead of the sink
+constexpr int64_t kRecordFragment = 100000;   // 10 ms fragments from the monitor
+constexpr int64_t kShortestBuffer = 100000;
+// Packet times follow the sample count; when they drift this far from the clock, samples were lost
+// (or the sink stalled) and the next packet starts a new time line with a discontinuity.
+constexpr int64_t kDriftLimit = 2000000;
+
+// Everything the audio client and its services share; it outlives whichever of them goes last.
+struct Stream {
+  std::shared_ptr<Connection> connection;
+  pa_stream* stream = nullptr;
+  bool loopback = false;
+  pa_sample_spec spec{};
+  uint32_t frameBytes = 0;
+  uint32_t bufferFrames = 0;
+  bool started = false;
+  // A packet handed out by GetBuffer and not yet released.
+  bool holding = false;
+  uint32_t heldFrames = 0;
+  std::vector<uint8_t> bytes;
+  // Capture timing: frames released so far, and the time line they lie on.
+  UINT64 position = 0;
+  bool anchored = false;
+  UINT64 anchorTime = 0;
+  UINT64 anchorPosition = 0;
+
+  ~Stream() {
+    if (!stream) return;
+    Lock lock(*connection);
+    pa_stream_set_state_callback(stream, nullptr, nullptr);
+    pa_stream_disconnect(stream);
+    pa_stream_unref(stream);
+  }
+
+  // The sink or the server went away.
+  bool invalid() {
+    return pa_context_get_state(connection->context()) != PA_CONTEXT_READY ||
+           !PA_STREAM_IS_GOOD(pa_stream_get_state(stream));
+  }
+
+  uint32_t bytesOf(int64_t units) const {
+    return static_cast<uint32_t>(units * spec.rate / kUnitsPerSecond) * frameBytes;
+  }
+};
+
+void signalStream(pa_stream*, void* loop) { pa_threaded_mainloop_signal(static_cast<pa_threaded_mainloop*>(loop), 0); }
+
+class CaptureClient : public ComObject<IAudioCaptureClient, IID_IAudioCaptureClient> {
+ public:
+  explicit CaptureClient(std::shared_ptr<Stream> stream) : s_(std::move(stream)) {}
+
+  HRESULT GetBuffer(BYTE** data, UINT32* frames, DWORD* flags, UINT64* devicePosition, UINT64* qpcPosition) override {
+    if (!data || !frames || !flags) return E_POINTER;
+    *data = nullptr;
+    *frames = 0;
+    *flags = 0;
+    Lock lock(*s_->connection);
+    if (s_->invalid()) return AUDCLNT_E_DEVICE_INVALIDATED;
+    if (s_->holding) return AUDCLNT_E_OUT_OF_ORDER;
+    const void* bytes = nullptr;
+    size_t size = 0;
+    if (pa_stream_peek(s_->stream, &bytes, &size) < 0) return AUDCLNT_E_DEVICE_INVALIDATED;
+    const UINT64 now = performanceCounterPosition();
+    if (devicePosition) *devicePosition = s_->position;
+    if (size == 0) {
+      if (qpcPosition) *qpcPosition = now;
+      return AUDCLNT_S_BUFFER_EMPTY;
+    }
+    const uint32_t count = static_cast<uint32_t>(size / s_->frameBytes);
+    if (bytes) {
+      *data = static_cast<BYTE*>(const_cast<void*>(bytes));
+    } else {
+      // A hole in the stream: the sink played nothing there.
+      *flags |= AUDCLNT_BUFFERFLAGS_SILENT;
+      s_->bytes.assign(size, 0);
+      *data = s_->bytes.data();
+    }
+    // The first frame of this packet arrived as long ago as everything queued behind it lasts.
+    const size_t queued = pa_stream_readable_size(s_->stream);
+    const int64_t queuedUnits = static_cast<int64_t>(queued / s_->frameBytes) * kUnitsPerSecond / s_->spec.rate;
+    const UINT64 measured = now - static_cast<UINT64>(std::max<int64_t>(queuedUnits, 0));
+    UINT64 time = s_->anchorTime + (s_->position - s_->anchorPosition) * kUnitsPerSecond / s_->spec.rate;
+    const int64_t drift = static_cast<int64_t>(measured - time);
+    if (!s_->anchored || drift > kDriftLimit || drift < -kDriftLimit) {
+      if (s_->anchored) *flags |= AUDCLNT_BUFFERFLAGS_DATA_DISCONTINUITY;
+      s_->anchored = true;
+      s_->anchorTime = time = measured;
+      s_->anchorPosition = s_->position;
+    }
+    if (qpcPosition) *qpcPosition = time;
+    *frames = count;
+    s_->holding = true;
+    s_->heldFrames = count;
+    return S_OK;
+  }
+
+  HRESULT ReleaseBuffer(UINT32 framesRead) override {
+    Lock lock(*s_->connection);
+    // Releasing nothing keeps the packet for the next GetBuffer.
+    if (framesRead == 0) {
+      s_->holding = false;
+      return S_OK;
+    }
+    if (!s_->holding) return AUDCLNT_E_OUT_OF_ORDER;
+    if (framesRead != s_->heldFrames) return AUDCLNT_E_INVALID_SIZE;
+    s_->holding = false;
+    if (s_->invalid()) return AUDCLNT_E_DEVICE_INVALIDATED;
+    pa_stream_drop(s_->stream);
+    s_->position += framesRead;
+    return S_OK;
+  }
+
+  HRESULT GetNextPacketSize(UINT32* frames) override {
+    if (!frames) return E_POINTER;
+    Lock lock(*s_->connection);
+    if (s_->invalid()) return AUDCLNT_E_DEVICE_INVALIDATED;
+    const void* bytes = nullptr;
+    size_t size = 0;
+    if (pa_stream_peek(s_->stream, &bytes, &size) < 0) return AUDCLNT_E_DEVICE_INVALIDATED;
+    *frames = static_cast<UINT32>(size / s_->frameBytes);
+    return S_OK;
+  }
+
+ private:
+  std::shared_ptr<Stream> s_;
+};
+
+class RenderClient : public ComObject<IAudioRenderClient, IID_IAudioRenderClient> {
+ public:
+  explicit RenderClient(std::shared_ptr<Stream> stream) : s_(std::move(stream)) {}
+
+  HRESULT GetBuffer(UINT32 framesRequested, BYTE** data) override {
+    if (!data) return E_POINTER;
+    *data = nullptr;
+    Lock lock(*s_->connection);
+    if (s_->invalid()) return AUDCLNT_E_DEVICE_INVALIDATED;
+    if (s_->holding) return AUDCLNT_E_OUT_OF_ORDER;
+    const size_t writable = pa_stream_writable_size(s_->stream) / s_->frameBytes;
+    if (framesRequested > std::min<size_t>(writable, s_->bufferFrames)) return AUDCLNT_E_BUFFER_TOO_LARGE;
+    if (s_->bytes.size() < static_cast<size_t>(framesRequested) * s_->frameBytes)
+      s_->bytes.resize(static_cast<size_t>(framesRequested) * s_->frameBytes);
+    *data = s_->bytes.data();
+    s_->holding = true;
+    s_->heldFrames = framesRequested;
+    return S_OK;
+  }
+
+  HRESULT ReleaseBuffer(UINT32 framesWritten, DWORD flags) override {
+    Lock lock(*s_->connection);
+    if (!s_->holding) return framesWritten == 0 ? S_OK : AUDCLNT_E_OUT_OF_ORDER;
+    if (framesWritten > s_->heldFrames) return AUDCLNT_E_INVALID_SIZE;
+    s_->holding = false;
+    if (framesWritten == 0) return S_OK;
+    if (s_->invalid()) return AUDCLNT_E_DEVICE_INVALIDATED;
+    const size_t size = static_cast<size_t>(framesWritten) * s_->frameBytes;
+    if (flags & AUDCLNT_BUFFERFLAGS_SILENT) std::memset(s_->bytes.data(), 0, size);
+    if (pa_stream_write(s_->stream, s_->bytes.data(), size, nullptr, 0, PA_SEEK_RELATIVE) < 0)
+      return AUDCLNT_E_DEVICE_INVALIDATED;
+    return S_OK;
+  }
+
+ private:
+  std::shared_ptr<Stream> s_;
+};
+
+class AudioClient : public ComObject<IAudioClient, IID_IAudioClient> {
+ public:
+  AudioClient(std::shared_ptr<Connection> connection, const pulse::Sink& sink) : sink_(sink) {
+    s_ = std::make_shared<Stream>();
+    s_->connection = std::move(connection);
+  }
+
+  HRESULT Initialize(AUDCLNT_SHAREMODE shareMode, DWORD streamFlags, REFERENCE_TIME bufferDuration, REFERENCE_TIME,
+                     const WAVEFORMATEX* format, LPCGUID) override {
+    if (!format) return E_POINTER;
+    if (s_->stream) return AUDCLNT_E_ALREADY_INITIALIZED;
+    if (shareMode != AUDCLNT_SHAREMODE_SHARED) return AUDCLNT_E_EXCLUSIVE_MODE_NOT_ALLOWED;
+    // Event-driven clients are not offered: nothing here waits on events.
+    if (streamFlags & AUDCLNT_STREAMFLAGS_EVENTCALLBACK) return E_NOTIMPL;
+    if (streamFlags & ~(AUDCLNT_STREAMFLAGS_LOOPBACK | AUDCLNT_STREAMFLAGS_CROSSPROCESS | AUDCLNT_STREAMFLAGS_NOPERSIST))
+      return E_INVALIDARG;
+    pa_sample_spec spec;
+    pa_channel_map map;
+    if (!pulse::specOf(format, spec, map) || spec.rate != sink_.spec.rate || spec.channels != sink_.spec.channels)
+      return AUDCLNT_E_UNSUPPORTED_FORMAT;
+
+    Stream& s = *s_;
+    s.loopback = (streamFlags & AUDCLNT_STREAMFLAGS_LOOPBACK) != 0;
+    s.spec = spec;
+    s.frameBytes = static_cast<uint32_t>(pa_frame_size(&spec));
+    s.bufferFrames = static_cast<uint32_t>(std::max<int64_t>(bufferDuration, kShortestBuffer) * spec.rate / kUnitsPerSecond);
+
+    Lock lock(*s.connection);
+    if (pa_context_get_state(s.connection->context()) != PA_CONTEXT_READY) return AUDCLNT_E_DEVICE_INVALIDATED;
+    pa_stream* stream = pa_stream_new(s.connection->context(), s.loopback ? "Loopback" : "Playback", &spec, &map);
+    if (!stream) return AUDCLNT_E_UNSUPPORTED_FORMAT;
+    pa_stream_set_state_callback(stream, signalStream, s.connection->loop());
+    pa_buffer_attr attr;
+    attr.maxlength = static_cast<uint32_t>(-1);
+    attr.prebuf = static_cast<uint32_t>(-1);
+    attr.minreq = static_cast<uint32_t>(-1);
+    attr.tlength = s.bytesOf(kPlaybackTarget);
+    attr.fragsize = s.bytesOf(kRecordFragment);
+    // A vanished sink ends the stream instead of moving it elsewhere, so capture sees it.
+    const auto flags = static_cast<pa_stream_flags_t>(PA_STREAM_START_CORKED | PA_STREAM_ADJUST_LATENCY |
+                                                      PA_STREAM_DONT_MOVE);
+    const int connected = s.loopback ? pa_stream_connect_record(stream, sink_.monitor.c_str(), &attr, flags)
+                                     : pa_stream_connect_playback(stream, sink_.name.c_str(), &attr, flags, nullptr,
+                                                                  nullptr);
+    pa_stream_state_t state = connected < 0 ? PA_STREAM_FAILED : pa_stream_get_state(stream);
+    while (state == PA_STREAM_CREATING || state == PA_STREAM_UNCONNECTED) {
+      pa_threaded_mainloop_wait(s.connection->loop());
+      state = pa_stream_get_state(stream);
+    }
+    if (state != PA_STREAM_READY) {
+      pa_stream_set_state_callback(stream, nullptr, nullptr);
+      pa_stream_disconnect(stream);
+      pa_stream_unref(stream);
+      return AUDCLNT_E_DEVICE_INVALIDATED;
+    }
+    s.stream = stream;
+    return S_OK;
+  }
+
+  HRESULT GetBufferSize(UINT32* frames) override {
+    if (!frames) return E_POINTER;
+    if (!s_->stream) return AUDCLNT_E_NOT_INITIALIZED;
+    *frames = s_->bufferFrames;
+    return S_OK;
+  }
+
+  HRESULT GetStreamLatency(REFERENCE_TIME* latency) override {
+    if (!latency) return E_POINTER;
+    if (!s_->stream) return AUDCLNT_E_NOT_INITIALIZED;
+    *latency = s_->loopback ? kRecordFragment : kPlaybackTarget;
+    return S_OK;
+  }
+
+  // Playback: what is queued beyond what the server asks for now. Capture: the next packet.
+  HRESULT GetCurrentPadding(UINT32* frames) override {
+    if (!frames) return E_POINTER;
+    *frames = 0;
+    if (!s_->stream) return AUDCLNT_E_NOT_INITIALIZED;
+    Lock lock(*s_->connection);
+    if (s_->invalid()) return AUDCLNT_E_DEVICE_INVALIDATED;
+    if (s_->loopback) {
+      *frames = static_cast<UINT32>(pa_stream_readable_size(s_->stream) / s_->frameBytes);
+    } else {
+      const size_t writable = pa_stream_writable_size(s_->stream) / s_->frameBytes;
+      *frames = s_->bufferFrames - static_cast<UINT32>(std::min<size_t>(writable, s_->bufferFrames));
+    }
+    return S_OK;
+  }
+
+  HRESULT IsFormatSupported(AUDCLNT_SHAREMODE shareMode, const WAVEFORMATEX* format,
+                            WAVEFORMATEX** closestMatch) override {
+    if (closestMatch) *closestMatch = nullptr;
+    if (!format || (shareMode == AUDCLNT_SHAREMODE_SHARED && !closestMatch)) return E_POINTER;
+    if (shareMode != AUDCLNT_SHAREMODE_SHARED) return AUDCLNT_E_UNSUPPORTED_FORMAT;
+    pa_sample_spec spec;
+    pa_channel_map map;
+    if (!pulse::specOf(format, spec, map)) return AUDCLNT_E_UNSUPPORTED_FORMAT;
+    if (spec.rate == sink_.spec.rate && spec.channels == sink_.spec.channels) return S_OK;
+    *closestMatch = pulse::mixFormat(sink_.spec, sink_.map);
+    return S_FALSE;
+  }
+
+  HRESULT GetMixFormat(WAVEFORMATEX** format) override {
+    if (!format) return E_POINTER;
+    *format = pulse::mixFormat(sink_.spec, sink_.map);
+    return S_OK;
+  }
+
+  HRESULT GetDevicePeriod(REFERENCE_TIME* defaultPeriod, REFERENCE_TIME* minimumPeriod) override {
+    if (!defaultPeriod && !minimumPeriod) return E_POINTER;
+    if (defaultPeriod) *defaultPeriod = kRecordFragment;
+    if (minimumPeriod) *minimumPeriod = kRecordFragment / 2;
+    return S_OK;
+  }
+
+  HRESULT Start() override { return cork(false); }
+  HRESULT Stop() override { return cork(true); }
+
+  HRESULT Reset() override {
+    if (!s_->stream) return AUDCLNT_E_NOT_INITIALIZED;
+    Lock lock(*s_->connection);
+    if (s_->started) return AUDCLNT_E_NOT_STOPPED;
+    if (s_->holding) return AUDCLNT_E_BUFFER_OPERATION_PENDING;
+    if (s_->invalid()) return AUDCLNT_E_DEVICE_INVALIDATED;
+    s_->connection->wait(pa_stream_flush(s_->stream, nullptr, nullptr));
+    s_->position = 0;
+    s_->anchored = false;
+    return S_OK;
+  }
+
+  HRESULT SetEventHandle(HANDLE) override {
+    return s_->stream ? AUDCLNT_E_EVENTHANDLE_NOT_EXPECTED : AUDCLNT_E_NOT_INITIALIZED;
+  }
+
+  HRESULT GetService(REFIID riid, void** object) override {
+    if (!object) return E_POINTER;
+    *object = nullptr;
+    if (!s_->stream) return AUDCLNT_E_NOT_INITIALIZED;
+    if (riid == IID_IAudioCaptureClient) {
+      if (!s_->loopback) return AUDCLNT_E_WRONG_ENDPOINT_TYPE;
+      *object = static_cast<IAudioCaptureClient*>(new CaptureClient(s_));
+      return S_OK;
+    }
+    if (riid == IID_IAudioRenderClient) {
+      if (s_->loopback) return AUDCLNT_E_WRONG_ENDPOINT_TYPE;
+      *object = static_cast<IAudioRenderClient*>(new RenderClient(s_));
+      return S_OK;
+    }
+    return E_NOINTERFACE;
+  }
+
+ private:
+  HRESULT cork(bool stop) {
+    if (!s_->stream) return AUDCLNT_E_NOT_INITIALIZED;
+    Lock lock(*s_->connection);
+    if (s_->invalid()) return AUDCLNT_E_DEVICE_INVALIDATED;
+    if (s_->started != stop) return stop ? S_FALSE : AUDCLNT_E_NOT_STOPPED;
+    if (!s_->connection->wait(pa_stream_cork(s_->stream, stop ? 1 : 0, nullptr, nullptr)))
+      return AUDCLNT_E_DEVICE_INVALIDATED;
+    s_->started = !stop;
+    return S_OK;
+  }
+
+  pulse::Sink sink_;
+  std::shared_ptr<Stream> s_;
+};
+
+}  // namespace
+
+UINT64 performanceCounterPosition() {
+  timespec now{};
+  clock_gettime(CLOCK_MONOTONIC, &now);
+  return static_cast<UINT64>(now.tv_sec) * kUnitsPerSecond + static_cast<UINT64>(now.tv_nsec) / 100;
+}
+
+HRESULT createAudioClient(std::shared_ptr<Connection> connection, const std::string& sink, REFIID riid,
+                          void** object) {
+  pulse::Sink info;
+  if (!connection->findSink(sink, info)) return AUDCLNT_E_DEVICE_INVALIDATED;
+  auto* client = new AudioClient(std::move(connection), info);
+  HRESULT hr = client->QueryInterface(riid, object);
+  client->Release();
+  return hr;
+}
+
+}  // namespace platform::wasapi

@@ -1,0 +1,163 @@
+// Endpoint enumeration over PulseAudio: every sink is an active playback endpoint, identified by
+// the sink's name, called by its description.
+#include "platform/linux/wasapi.h"
+
+#include <memory>
+#include <string>
+#include <vector>
+
+#include "platform/linux/audioclient.h"
+#include "platform/linux/pulse.h"
+
+namespace platform::wasapi {
+
+namespace {
+
+using pulse::Connection;
+using pulse::Sink;
+
+class PropertyStore : public ComObject<IPropertyStore, IID_IPropertyStore> {
+ public:
+  explicit PropertyStore(std::wstring friendlyName) : friendlyName_(std::move(friendlyName)) {}
+
+  HRESULT GetCount(DWORD* count) override {
+    if (!count) return E_POINTER;
+    *count = 1;
+    return S_OK;
+  }
+  HRESULT GetAt(DWORD index, PROPERTYKEY* key) override {
+    if (!key) return E_POINTER;
+    if (index != 0) return E_INVALIDARG;
+    *key = PKEY_Device_FriendlyName;
+    return S_OK;
+  }
+  HRESULT GetValue(REFPROPERTYKEY key, PROPVARIANT* value) override {
+    if (!value) return E_POINTER;
+    PropVariantInit(value);
+    // A key the store does not hold reads as an empty value, not as a failure.
+    if (key.pid == PKEY_Device_FriendlyName.pid && key.fmtid == PKEY_Device_FriendlyName.fmtid) {
+      value->vt = VT_LPWSTR;
+      value->pwszVal = taskString(friendlyName_);
+    }
+    return S_OK;
+  }
+  HRESULT SetValue(REFPROPERTYKEY, REFPROPVARIANT) override { return STG_E_ACCESSDENIED; }
+  HRESULT Commit() override { return STG_E_ACCESSDENIED; }
+
+ private:
+  static constexpr HRESULT STG_E_ACCESSDENIED = hresult(0x80030005);
+  std::wstring friendlyName_;
+};
+
+class Device : public ComObject<IMMDevice, IID_IMMDevice> {
+ public:
+  Device(std::shared_ptr<Connection> connection, const Sink& sink)
+      : connection_(std::move(connection)), name_(sink.name), description_(sink.description) {}
+
+  HRESULT Activate(REFIID iid, DWORD, PROPVARIANT*, void** object) override {
+    if (!object) return E_POINTER;
+    *object = nullptr;
+    if (!(iid == IID_IAudioClient)) return E_NOINTERFACE;
+    return createAudioClient(connection_, name_, iid, object);
+  }
+  HRESULT OpenPropertyStore(DWORD, IPropertyStore** properties) override {
+    if (!properties) return E_POINTER;
+    *properties = new PropertyStore(widen(description_));
+    return S_OK;
+  }
+  HRESULT GetId(LPWSTR* id) override {
+    if (!id) return E_POINTER;
+    *id = taskString(widen(name_));
+    return S_OK;
+  }
+  HRESULT GetState(DWORD* state) override {
+    if (!state) return E_POINTER;
+    Sink sink;
+    *state = connection_->findSink(name_, sink) ? DEVICE_STATE_ACTIVE : DEVICE_STATE_NOTPRESENT;
+    return S_OK;
+  }
+
+ private:
+  std::shared_ptr<Connection> connection_;
+  std::string name_;
+  std::string description_;
+};
+
+class Collection : public ComObject<IMMDeviceCollection, IID_IMMDeviceCollection> {
+ public:
+  explicit Collection(std::vector<IMMDevice*> devices) : devices_(std::move(devices)) {}
+  ~Collection() override {
+    for (IMMDevice* device : devices_) device->Release();
+  }
+
+  HRESULT GetCount(UINT* count) override {
+    if (!count) return E_POINTER;
+    *count = static_cast<UINT>(devices_.size());
+    return S_OK;
+  }
+  HRESULT Item(UINT index, IMMDevice** device) override {
+    if (!device) return E_POINTER;
+    *device = nullptr;
+    if (index >= devices_.size()) return E_INVALIDARG;
+    devices_[index]->AddRef();
+    *device = devices_[index];
+    return S_OK;
+  }
+
+ private:
+  std::vector<IMMDevice*> devices_;
+};
+
+// Endpoints of the capture direction (microphones) are not offered: the add-on reaches those
+// through the capture engine.
+class Enumerator : public ComObject<IMMDeviceEnumerator, IID_IMMDeviceEnumerator> {
+ public:
+  Enumerator() : connection_(std::make_shared<Connection>()) {}
+
+  HRESULT EnumAudioEndpoints(EDataFlow dataFlow, DWORD stateMask, IMMDeviceCollection** devices) override {
+    if (!devices) return E_POINTER;
+    *devices = nullptr;
+    if (dataFlow != eRender) return dataFlow == eCapture || dataFlow == eAll ? E_NOTIMPL : E_INVALIDARG;
+    if (stateMask == 0 || (stateMask & ~DEVICE_STATEMASK_ALL)) return E_INVALIDARG;
+    std::vector<IMMDevice*> found;
+    if (stateMask & DEVICE_STATE_ACTIVE)
+      for (const Sink& sink : connection_->sinks()) found.push_back(new Device(connection_, sink));
+    *devices = new Collection(std::move(found));
+    return S_OK;
+  }
+  HRESULT GetDefaultAudioEndpoint(EDataFlow dataFlow, ERole role, IMMDevice** endpoint) override {
+    if (!endpoint) return E_POINTER;
+    *endpoint = nullptr;
+    if (dataFlow != eRender) return dataFlow == eCapture ? E_NOTIMPL : E_INVALIDARG;
+    if (role < eConsole || role >= ERole_enum_count) return E_INVALIDARG;
+    // No server, or a server without a default sink: a machine without a playback endpoint.
+    Sink sink;
+    if (!connection_->defaultSink(sink)) return HRESULT_FROM_WIN32(ERROR_NOT_FOUND);
+    *endpoint = new Device(connection_, sink);
+    return S_OK;
+  }
+  HRESULT GetDevice(LPCWSTR id, IMMDevice** device) override {
+    if (!id || !device) return E_POINTER;
+    *device = nullptr;
+    Sink sink;
+    if (!connection_->findSink(narrow(id), sink)) return HRESULT_FROM_WIN32(ERROR_NOT_FOUND);
+    *device = new Device(connection_, sink);
+    return S_OK;
+  }
+  HRESULT RegisterEndpointNotificationCallback(IMMNotificationClient*) override { return E_NOTIMPL; }
+  HRESULT UnregisterEndpointNotificationCallback(IMMNotificationClient*) override { return E_NOTIMPL; }
+
+ private:
+  std::shared_ptr<Connection> connection_;
+};
+
+}  // namespace
+
+HRESULT createDeviceEnumerator(REFIID riid, void** object) {
+  auto* enumerator = new Enumerator();
+  HRESULT hr = enumerator->QueryInterface(riid, object);
+  enumerator->Release();
+  return hr;
+}
+
+}  // namespace platform::wasapi
