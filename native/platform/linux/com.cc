@@ -63,6 +63,43 @@ HRESULT PropVariantClear(PROPVARIANT* value) {
   return S_OK;
 }
 
+HRESULT PropVariantCopy(PROPVARIANT* destination, const PROPVARIANT* source) {
+  if (!destination || !source) return E_INVALIDARG;
+  PROPVARIANT copy = *source;
+  switch (source->vt) {
+    case VT_EMPTY:
+    case VT_I4:
+    case VT_R8:
+    case VT_UI4:
+    case VT_UI8:
+      break;
+    case VT_LPWSTR:
+      if (source->pwszVal) {
+        size_t units = 0;
+        while (source->pwszVal[units]) ++units;
+        copy.pwszVal = platform::taskString(std::wstring(source->pwszVal, units));
+      }
+      break;
+    case VT_CLSID:
+      if (source->puuid) {
+        copy.puuid = static_cast<GUID*>(CoTaskMemAlloc(sizeof(GUID)));
+        *copy.puuid = *source->puuid;
+      }
+      break;
+    case VT_UNKNOWN:
+      if (source->punkVal) source->punkVal->AddRef();
+      break;
+    case VT_VECTOR | VT_UI1:
+      copy.caub.pElems = static_cast<BYTE*>(CoTaskMemAlloc(source->caub.cElems));
+      if (source->caub.cElems) std::memcpy(copy.caub.pElems, source->caub.pElems, source->caub.cElems);
+      break;
+    default:
+      return hresult(0x80030001);  // STG_E_INVALIDFUNCTION: a type this layer does not hand out
+  }
+  *destination = copy;
+  return S_OK;
+}
+
 HLOCAL LocalAlloc(UINT flags, SIZE_T bytes) {
   return (flags & LMEM_ZEROINIT) ? std::calloc(bytes ? bytes : 1, 1) : std::malloc(bytes ? bytes : 1);
 }

@@ -235,6 +235,8 @@ struct PROPERTYKEY {
 using REFPROPERTYKEY = const PROPERTYKEY&;
 inline void PropVariantInit(PROPVARIANT* value) { std::memset(value, 0, sizeof(PROPVARIANT)); }
 HRESULT PropVariantClear(PROPVARIANT* value);
+// A deep copy: strings, GUIDs and byte blobs are duplicated, objects get a reference.
+HRESULT PropVariantCopy(PROPVARIANT* destination, const PROPVARIANT* source);
 
 // System message texts.
 constexpr DWORD FORMAT_MESSAGE_ALLOCATE_BUFFER = 0x100;

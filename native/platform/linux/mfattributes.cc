@@ -1,0 +1,502 @@
+// Attribute stores and media types on Linux, answering with Media Foundation's codes: a missing
+// key is MF_E_ATTRIBUTENOTFOUND, a key of another type MF_E_INVALIDTYPE.
+#include "platform/linux/mfattributes.h"
+
+#include <algorithm>
+#include <cstddef>
+#include <cstring>
+
+namespace platform {
+
+namespace {
+
+constexpr HRESULT insufficientBuffer = HRESULT_FROM_WIN32(122);  // ERROR_INSUFFICIENT_BUFFER
+
+bool storable(VARTYPE vt) {
+  return vt == VT_UI4 || vt == VT_UI8 || vt == VT_R8 || vt == VT_CLSID || vt == VT_LPWSTR ||
+         vt == (VT_VECTOR | VT_UI1) || vt == VT_UNKNOWN;
+}
+
+size_t units(const wchar_t* text) {
+  size_t n = 0;
+  while (text[n]) ++n;
+  return n;
+}
+
+}  // namespace
+
+bool equalValues(const PROPVARIANT& a, const PROPVARIANT& b) {
+  if (a.vt != b.vt) return false;
+  switch (a.vt) {
+    case VT_EMPTY:
+      return true;
+    case VT_I4:
+    case VT_UI4:
+      return a.ulVal == b.ulVal;
+    case VT_UI8:
+      return a.uhVal == b.uhVal;
+    case VT_R8:
+      return a.dblVal == b.dblVal;
+    case VT_CLSID:
+      return a.puuid && b.puuid && *a.puuid == *b.puuid;
+    case VT_LPWSTR:
+      return a.pwszVal && b.pwszVal && std::wcscmp(a.pwszVal, b.pwszVal) == 0;
+    case VT_UNKNOWN:
+      return a.punkVal == b.punkVal;
+    case VT_VECTOR | VT_UI1:
+      return a.caub.cElems == b.caub.cElems &&
+             (a.caub.cElems == 0 || std::memcmp(a.caub.pElems, b.caub.pElems, a.caub.cElems) == 0);
+    default:
+      return false;
+  }
+}
+
+AttributeStore::~AttributeStore() { deleteAllItems(); }
+
+const PROPVARIANT* AttributeStore::find(REFGUID key) const {
+  for (const auto& item : items_)
+    if (item.first == key) return &item.second;
+  return nullptr;
+}
+
+HRESULT AttributeStore::typed(REFGUID key, VARTYPE vt, const PROPVARIANT** value) const {
+  const PROPVARIANT* found = find(key);
+  if (!found) return MF_E_ATTRIBUTENOTFOUND;
+  if (found->vt != vt) return MF_E_INVALIDTYPE;
+  *value = found;
+  return S_OK;
+}
+
+HRESULT AttributeStore::store(REFGUID key, const PROPVARIANT& value) {
+  if (!storable(value.vt)) return MF_E_INVALIDTYPE;
+  PROPVARIANT copy;
+  PropVariantInit(&copy);
+  HRESULT hr = PropVariantCopy(&copy, &value);
+  if (FAILED(hr)) return hr;
+  std::lock_guard<std::recursive_mutex> lock(mutex_);
+  for (auto& item : items_) {
+    if (item.first == key) {
+      PropVariantClear(&item.second);
+      item.second = copy;
+      return S_OK;
+    }
+  }
+  items_.emplace_back(key, copy);
+  return S_OK;
+}
+
+HRESULT AttributeStore::getItem(REFGUID key, PROPVARIANT* value) {
+  std::lock_guard<std::recursive_mutex> lock(mutex_);
+  const PROPVARIANT* found = find(key);
+  if (!found) return MF_E_ATTRIBUTENOTFOUND;
+  if (!value) return S_OK;  // a null value only asks whether the key is there
+  return PropVariantCopy(value, found);
+}
+
+HRESULT AttributeStore::getItemType(REFGUID key, MF_ATTRIBUTE_TYPE* type) {
+  if (!type) return E_POINTER;
+  std::lock_guard<std::recursive_mutex> lock(mutex_);
+  const PROPVARIANT* found = find(key);
+  if (!found) return MF_E_ATTRIBUTENOTFOUND;
+  *type = static_cast<MF_ATTRIBUTE_TYPE>(found->vt);
+  return S_OK;
+}
+
+HRESULT AttributeStore::compareItem(REFGUID key, REFPROPVARIANT value, BOOL* result) {
+  if (!result) return E_POINTER;
+  std::lock_guard<std::recursive_mutex> lock(mutex_);
+  const PROPVARIANT* found = find(key);
+  *result = found && equalValues(*found, value);
+  return S_OK;
+}
+
+HRESULT AttributeStore::compare(IMFAttributes* self, IMFAttributes* theirs, MF_ATTRIBUTES_MATCH_TYPE matchType,
+                                BOOL* result) {
+  if (!theirs || !result) return E_POINTER;
+  if (matchType > MF_ATTRIBUTES_MATCH_SMALLER) return E_INVALIDARG;
+  *result = FALSE;
+  if (theirs == self) {
+    *result = TRUE;
+    return S_OK;
+  }
+  // Every item of `from` must be in `to` with an equal value.
+  auto contained = [](IMFAttributes* from, IMFAttributes* to, bool onlyShared) {
+    UINT32 count = 0;
+    from->GetCount(&count);
+    for (UINT32 i = 0; i < count; ++i) {
+      GUID key;
+      PROPVARIANT value;
+      PropVariantInit(&value);
+      if (FAILED(from->GetItemByIndex(i, &key, &value))) return false;
+      BOOL same = FALSE;
+      bool present = SUCCEEDED(to->GetItem(key, nullptr));
+      if (present) to->CompareItem(key, value, &same);
+      PropVariantClear(&value);
+      if (onlyShared ? (present && !same) : !same) return false;
+    }
+    return true;
+  };
+  std::lock_guard<std::recursive_mutex> lock(mutex_);
+  UINT32 ours = static_cast<UINT32>(items_.size()), theirCount = 0;
+  theirs->GetCount(&theirCount);
+  switch (matchType) {
+    case MF_ATTRIBUTES_MATCH_OUR_ITEMS:
+      *result = contained(self, theirs, false);
+      break;
+    case MF_ATTRIBUTES_MATCH_THEIR_ITEMS:
+      *result = contained(theirs, self, false);
+      break;
+    case MF_ATTRIBUTES_MATCH_ALL_ITEMS:
+      *result = ours == theirCount && contained(self, theirs, false);
+      break;
+    case MF_ATTRIBUTES_MATCH_INTERSECTION:
+      *result = contained(self, theirs, true);
+      break;
+    case MF_ATTRIBUTES_MATCH_SMALLER:
+      *result = ours <= theirCount ? contained(self, theirs, false) : contained(theirs, self, false);
+      break;
+  }
+  return S_OK;
+}
+
+HRESULT AttributeStore::getUINT32(REFGUID key, UINT32* value) {
+  if (!value) return E_POINTER;
+  std::lock_guard<std::recursive_mutex> lock(mutex_);
+  const PROPVARIANT* found;
+  HRESULT hr = typed(key, VT_UI4, &found);
+  if (SUCCEEDED(hr)) *value = found->ulVal;
+  return hr;
+}
+
+HRESULT AttributeStore::getUINT64(REFGUID key, UINT64* value) {
+  if (!value) return E_POINTER;
+  std::lock_guard<std::recursive_mutex> lock(mutex_);
+  const PROPVARIANT* found;
+  HRESULT hr = typed(key, VT_UI8, &found);
+  if (SUCCEEDED(hr)) *value = found->uhVal;
+  return hr;
+}
+
+HRESULT AttributeStore::getDouble(REFGUID key, double* value) {
+  if (!value) return E_POINTER;
+  std::lock_guard<std::recursive_mutex> lock(mutex_);
+  const PROPVARIANT* found;
+  HRESULT hr = typed(key, VT_R8, &found);
+  if (SUCCEEDED(hr)) *value = found->dblVal;
+  return hr;
+}
+
+HRESULT AttributeStore::getGUID(REFGUID key, GUID* value) {
+  if (!value) return E_POINTER;
+  std::lock_guard<std::recursive_mutex> lock(mutex_);
+  const PROPVARIANT* found;
+  HRESULT hr = typed(key, VT_CLSID, &found);
+  if (SUCCEEDED(hr)) *value = *found->puuid;
+  return hr;
+}
+
+HRESULT AttributeStore::getStringLength(REFGUID key, UINT32* length) {
+  if (!length) return E_POINTER;
+  std::lock_guard<std::recursive_mutex> lock(mutex_);
+  const PROPVARIANT* found;
+  HRESULT hr = typed(key, VT_LPWSTR, &found);
+  if (SUCCEEDED(hr)) *length = static_cast<UINT32>(units(found->pwszVal));
+  return hr;
+}
+
+HRESULT AttributeStore::getString(REFGUID key, LPWSTR value, UINT32 bufferSize, UINT32* length) {
+  if (!value) return E_POINTER;
+  std::lock_guard<std::recursive_mutex> lock(mutex_);
+  const PROPVARIANT* found;
+  HRESULT hr = typed(key, VT_LPWSTR, &found);
+  if (FAILED(hr)) return hr;
+  const size_t n = units(found->pwszVal);
+  if (n + 1 > bufferSize) return insufficientBuffer;
+  std::memcpy(value, found->pwszVal, (n + 1) * sizeof(wchar_t));
+  if (length) *length = static_cast<UINT32>(n);
+  return S_OK;
+}
+
+HRESULT AttributeStore::getAllocatedString(REFGUID key, LPWSTR* value, UINT32* length) {
+  if (!value || !length) return E_POINTER;
+  std::lock_guard<std::recursive_mutex> lock(mutex_);
+  const PROPVARIANT* found;
+  HRESULT hr = typed(key, VT_LPWSTR, &found);
+  if (FAILED(hr)) return hr;
+  const size_t n = units(found->pwszVal);
+  *value = taskString(std::wstring(found->pwszVal, n));
+  *length = static_cast<UINT32>(n);
+  return S_OK;
+}
+
+HRESULT AttributeStore::getBlobSize(REFGUID key, UINT32* size) {
+  if (!size) return E_POINTER;
+  std::lock_guard<std::recursive_mutex> lock(mutex_);
+  const PROPVARIANT* found;
+  HRESULT hr = typed(key, VT_VECTOR | VT_UI1, &found);
+  if (SUCCEEDED(hr)) *size = found->caub.cElems;
+  return hr;
+}
+
+HRESULT AttributeStore::getBlob(REFGUID key, UINT8* buffer, UINT32 bufferSize, UINT32* size) {
+  if (!buffer) return E_POINTER;
+  std::lock_guard<std::recursive_mutex> lock(mutex_);
+  const PROPVARIANT* found;
+  HRESULT hr = typed(key, VT_VECTOR | VT_UI1, &found);
+  if (FAILED(hr)) return hr;
+  if (found->caub.cElems > bufferSize) return insufficientBuffer;
+  if (found->caub.cElems) std::memcpy(buffer, found->caub.pElems, found->caub.cElems);
+  if (size) *size = found->caub.cElems;
+  return S_OK;
+}
+
+HRESULT AttributeStore::getAllocatedBlob(REFGUID key, UINT8** buffer, UINT32* size) {
+  if (!buffer || !size) return E_POINTER;
+  std::lock_guard<std::recursive_mutex> lock(mutex_);
+  const PROPVARIANT* found;
+  HRESULT hr = typed(key, VT_VECTOR | VT_UI1, &found);
+  if (FAILED(hr)) return hr;
+  *buffer = static_cast<UINT8*>(CoTaskMemAlloc(found->caub.cElems));
+  if (found->caub.cElems) std::memcpy(*buffer, found->caub.pElems, found->caub.cElems);
+  *size = found->caub.cElems;
+  return S_OK;
+}
+
+HRESULT AttributeStore::getUnknown(REFGUID key, REFIID riid, LPVOID* object) {
+  if (!object) return E_POINTER;
+  *object = nullptr;
+  std::lock_guard<std::recursive_mutex> lock(mutex_);
+  const PROPVARIANT* found;
+  HRESULT hr = typed(key, VT_UNKNOWN, &found);
+  if (FAILED(hr)) return hr;
+  if (!found->punkVal) return E_NOINTERFACE;
+  return found->punkVal->QueryInterface(riid, object);
+}
+
+HRESULT AttributeStore::setItem(REFGUID key, REFPROPVARIANT value) { return store(key, value); }
+
+HRESULT AttributeStore::deleteItem(REFGUID key) {
+  std::lock_guard<std::recursive_mutex> lock(mutex_);
+  auto it = std::find_if(items_.begin(), items_.end(), [&](const auto& item) { return item.first == key; });
+  if (it != items_.end()) {
+    PropVariantClear(&it->second);
+    items_.erase(it);
+  }
+  return S_OK;  // deleting a missing key is no failure
+}
+
+HRESULT AttributeStore::deleteAllItems() {
+  std::lock_guard<std::recursive_mutex> lock(mutex_);
+  for (auto& item : items_) PropVariantClear(&item.second);
+  items_.clear();
+  return S_OK;
+}
+
+HRESULT AttributeStore::setUINT32(REFGUID key, UINT32 value) {
+  PROPVARIANT v;
+  PropVariantInit(&v);
+  v.vt = VT_UI4;
+  v.ulVal = value;
+  return store(key, v);
+}
+
+HRESULT AttributeStore::setUINT64(REFGUID key, UINT64 value) {
+  PROPVARIANT v;
+  PropVariantInit(&v);
+  v.vt = VT_UI8;
+  v.uhVal = value;
+  return store(key, v);
+}
+
+HRESULT AttributeStore::setDouble(REFGUID key, double value) {
+  PROPVARIANT v;
+  PropVariantInit(&v);
+  v.vt = VT_R8;
+  v.dblVal = value;
+  return store(key, v);
+}
+
+HRESULT AttributeStore::setGUID(REFGUID key, REFGUID value) {
+  GUID copy = value;
+  PROPVARIANT v;
+  PropVariantInit(&v);
+  v.vt = VT_CLSID;
+  v.puuid = &copy;
+  return store(key, v);
+}
+
+HRESULT AttributeStore::setString(REFGUID key, LPCWSTR value) {
+  if (!value) return E_INVALIDARG;
+  PROPVARIANT v;
+  PropVariantInit(&v);
+  v.vt = VT_LPWSTR;
+  v.pwszVal = const_cast<LPWSTR>(value);
+  return store(key, v);
+}
+
+HRESULT AttributeStore::setBlob(REFGUID key, const UINT8* buffer, UINT32 size) {
+  if (!buffer && size) return E_INVALIDARG;
+  PROPVARIANT v;
+  PropVariantInit(&v);
+  v.vt = VT_VECTOR | VT_UI1;
+  v.caub.cElems = size;
+  v.caub.pElems = const_cast<UINT8*>(buffer);
+  return store(key, v);
+}
+
+HRESULT AttributeStore::setUnknown(REFGUID key, IUnknown* value) {
+  PROPVARIANT v;
+  PropVariantInit(&v);
+  v.vt = VT_UNKNOWN;
+  v.punkVal = value;
+  return store(key, v);
+}
+
+HRESULT AttributeStore::lockStore() {
+  mutex_.lock();
+  return S_OK;
+}
+
+HRESULT AttributeStore::unlockStore() {
+  mutex_.unlock();
+  return S_OK;
+}
+
+HRESULT AttributeStore::getCount(UINT32* count) {
+  if (!count) return E_POINTER;
+  std::lock_guard<std::recursive_mutex> lock(mutex_);
+  *count = static_cast<UINT32>(items_.size());
+  return S_OK;
+}
+
+HRESULT AttributeStore::getItemByIndex(UINT32 index, GUID* key, PROPVARIANT* value) {
+  if (!key) return E_POINTER;
+  std::lock_guard<std::recursive_mutex> lock(mutex_);
+  if (index >= items_.size()) return E_INVALIDARG;
+  *key = items_[index].first;
+  return value ? PropVariantCopy(value, &items_[index].second) : S_OK;
+}
+
+HRESULT AttributeStore::copyAllItems(IMFAttributes* destination) {
+  if (!destination) return E_POINTER;
+  std::lock_guard<std::recursive_mutex> lock(mutex_);
+  HRESULT hr = destination->DeleteAllItems();
+  for (size_t i = 0; SUCCEEDED(hr) && i < items_.size(); ++i) hr = destination->SetItem(items_[i].first, items_[i].second);
+  return hr;
+}
+
+namespace {
+
+class AttributeObject : public Attributes<IMFAttributes> {};
+
+class MediaType : public Attributes<IMFMediaType, IID_IMFMediaType> {
+ public:
+  HRESULT GetMajorType(GUID* majorType) override {
+    if (!majorType) return E_POINTER;
+    return GetGUID(MF_MT_MAJOR_TYPE, majorType);
+  }
+
+  // Media Foundation calls a type compressed unless it says all its samples are independent.
+  HRESULT IsCompressedFormat(BOOL* compressed) override {
+    if (!compressed) return E_POINTER;
+    UINT32 independent = 0;
+    if (FAILED(GetUINT32(MF_MT_ALL_SAMPLES_INDEPENDENT, &independent))) independent = 0;
+    *compressed = independent ? FALSE : TRUE;
+    return S_OK;
+  }
+
+  HRESULT IsEqual(IMFMediaType* other, DWORD* flags) override {
+    if (!other || !flags) return E_INVALIDARG;
+    *flags = 0;
+    GUID ours, theirs;
+    if (FAILED(GetMajorType(&ours)) || FAILED(other->GetMajorType(&theirs))) return E_INVALIDARG;
+    if (ours == theirs) *flags |= MF_MEDIATYPE_EQUAL_MAJOR_TYPES;
+    GUID ourSubtype = GUID_NULL, theirSubtype = GUID_NULL;
+    GetGUID(MF_MT_SUBTYPE, &ourSubtype);
+    other->GetGUID(MF_MT_SUBTYPE, &theirSubtype);
+    if (ourSubtype == theirSubtype) *flags |= MF_MEDIATYPE_EQUAL_FORMAT_TYPES;
+    // Format data: every item but the user data is the same in both.
+    IMFAttributes *a = nullptr, *b = nullptr;
+    MFCreateAttributes(&a, 0);
+    MFCreateAttributes(&b, 0);
+    CopyAllItems(a);
+    other->CopyAllItems(b);
+    a->DeleteItem(MF_MT_USER_DATA);
+    b->DeleteItem(MF_MT_USER_DATA);
+    BOOL same = FALSE;
+    a->Compare(b, MF_ATTRIBUTES_MATCH_ALL_ITEMS, &same);
+    if (same) *flags |= MF_MEDIATYPE_EQUAL_FORMAT_DATA;
+    a->Release();
+    b->Release();
+    PROPVARIANT ourData, theirData;
+    PropVariantInit(&ourData);
+    PropVariantInit(&theirData);
+    GetItem(MF_MT_USER_DATA, &ourData);
+    other->GetItem(MF_MT_USER_DATA, &theirData);
+    if (equalValues(ourData, theirData)) *flags |= MF_MEDIATYPE_EQUAL_FORMAT_USER_DATA;
+    PropVariantClear(&ourData);
+    PropVariantClear(&theirData);
+    return *flags == 0xF ? S_OK : S_FALSE;
+  }
+
+  // No other representations (AM_MEDIA_TYPE, wave formats) are offered here.
+  HRESULT GetRepresentation(GUID, LPVOID* value) override {
+    if (value) *value = nullptr;
+    return MF_E_UNSUPPORTED_REPRESENTATION;
+  }
+  HRESULT FreeRepresentation(GUID, LPVOID) override { return MF_E_UNSUPPORTED_REPRESENTATION; }
+};
+
+}  // namespace
+
+}  // namespace platform
+
+HRESULT MFCreateAttributes(IMFAttributes** attributes, UINT32) {
+  if (!attributes) return E_POINTER;
+  *attributes = new platform::AttributeObject();
+  return S_OK;
+}
+
+HRESULT MFCreateMediaType(IMFMediaType** mediaType) {
+  if (!mediaType) return E_POINTER;
+  *mediaType = new platform::MediaType();
+  return S_OK;
+}
+
+// Sets what Media Foundation derives from a wave format: major type, subtype (from the tag, or
+// from SubFormat for the extensible layout), the five numbers, independence of samples, and for
+// the extensible layout the channel mask and valid bits.
+HRESULT MFInitMediaTypeFromWaveFormatEx(IMFMediaType* mediaType, const WAVEFORMATEX* format, UINT32 size) {
+  if (!mediaType || !format) return E_POINTER;
+  if (size < sizeof(WAVEFORMATEX)) return E_INVALIDARG;
+  const bool extensible = format->wFormatTag == WAVE_FORMAT_EXTENSIBLE;
+  if (extensible && (size < sizeof(WAVEFORMATEXTENSIBLE) || format->cbSize < 22)) return E_INVALIDARG;
+  const auto* bytes = reinterpret_cast<const uint8_t*>(format);  // fields read by offset: the layout is packed
+  HRESULT hr = mediaType->DeleteAllItems();
+  auto set32 = [&](REFGUID key, UINT32 value) {
+    if (SUCCEEDED(hr)) hr = mediaType->SetUINT32(key, value);
+  };
+  if (SUCCEEDED(hr)) hr = mediaType->SetGUID(MF_MT_MAJOR_TYPE, MFMediaType_Audio);
+  if (SUCCEEDED(hr)) {
+    GUID subtype = platform::mediaSubtype(format->wFormatTag);
+    if (extensible) std::memcpy(&subtype, bytes + offsetof(WAVEFORMATEXTENSIBLE, SubFormat), sizeof subtype);
+    hr = mediaType->SetGUID(MF_MT_SUBTYPE, subtype);
+  }
+  set32(MF_MT_AUDIO_NUM_CHANNELS, format->nChannels);
+  set32(MF_MT_AUDIO_SAMPLES_PER_SECOND, format->nSamplesPerSec);
+  set32(MF_MT_AUDIO_AVG_BYTES_PER_SECOND, format->nAvgBytesPerSec);
+  set32(MF_MT_AUDIO_BLOCK_ALIGNMENT, format->nBlockAlign);
+  if (format->wBitsPerSample) set32(MF_MT_AUDIO_BITS_PER_SAMPLE, format->wBitsPerSample);
+  set32(MF_MT_ALL_SAMPLES_INDEPENDENT, TRUE);
+  if (extensible) {
+    DWORD mask;
+    WORD validBits;
+    std::memcpy(&mask, bytes + offsetof(WAVEFORMATEXTENSIBLE, dwChannelMask), sizeof mask);
+    std::memcpy(&validBits, bytes + offsetof(WAVEFORMATEXTENSIBLE, Samples), sizeof validBits);
+    set32(MF_MT_AUDIO_CHANNEL_MASK, mask);
+    if (validBits) set32(MF_MT_AUDIO_VALID_BITS_PER_SAMPLE, validBits);
+  } else {
+    set32(MF_MT_AUDIO_PREFER_WAVEFORMATEX, TRUE);
+  }
+  return hr;
+}

@@ -1,0 +1,255 @@
+// Memory buffers, samples and collections on Linux.
+#include <cstdlib>
+#include <cstring>
+#include <vector>
+
+#include "platform/linux/mfattributes.h"
+
+namespace platform {
+
+namespace {
+
+// A block of system memory, aligned as Media Foundation aligns its memory buffers (at least
+// 16 bytes; 64 here, which also suits the SIMD paths of the converters that read it).
+class MemoryBuffer : public ComObject<IMFMediaBuffer, IID_IMFMediaBuffer> {
+ public:
+  explicit MemoryBuffer(DWORD maxLength)
+      : data_(static_cast<BYTE*>(std::aligned_alloc(64, (static_cast<size_t>(maxLength) + 63) / 64 * 64 + 64))),
+        maxLength_(maxLength) {}
+  ~MemoryBuffer() override { std::free(data_); }
+
+  bool valid() const { return data_ != nullptr; }
+
+  HRESULT Lock(BYTE** buffer, DWORD* maxLength, DWORD* currentLength) override {
+    if (!buffer) return E_POINTER;
+    *buffer = data_;
+    if (maxLength) *maxLength = maxLength_;
+    if (currentLength) *currentLength = currentLength_;
+    return S_OK;
+  }
+  HRESULT Unlock() override { return S_OK; }
+  HRESULT GetCurrentLength(DWORD* length) override {
+    if (!length) return E_POINTER;
+    *length = currentLength_;
+    return S_OK;
+  }
+  HRESULT SetCurrentLength(DWORD length) override {
+    if (length > maxLength_) return E_INVALIDARG;
+    currentLength_ = length;
+    return S_OK;
+  }
+  HRESULT GetMaxLength(DWORD* length) override {
+    if (!length) return E_POINTER;
+    *length = maxLength_;
+    return S_OK;
+  }
+
+ private:
+  BYTE* data_;
+  const DWORD maxLength_;
+  DWORD currentLength_ = 0;
+};
+
+class Sample : public Attributes<IMFSample, IID_IMFSample> {
+ public:
+  ~Sample() override { RemoveAllBuffers(); }
+
+  HRESULT GetSampleFlags(DWORD* flags) override {
+    if (!flags) return E_POINTER;
+    *flags = flags_;
+    return S_OK;
+  }
+  HRESULT SetSampleFlags(DWORD flags) override {
+    flags_ = flags;
+    return S_OK;
+  }
+  HRESULT GetSampleTime(LONGLONG* time) override {
+    if (!time) return E_POINTER;
+    if (!hasTime_) return MF_E_NO_SAMPLE_TIMESTAMP;
+    *time = time_;
+    return S_OK;
+  }
+  HRESULT SetSampleTime(LONGLONG time) override {
+    time_ = time;
+    hasTime_ = true;
+    return S_OK;
+  }
+  HRESULT GetSampleDuration(LONGLONG* duration) override {
+    if (!duration) return E_POINTER;
+    if (!hasDuration_) return MF_E_NO_SAMPLE_DURATION;
+    *duration = duration_;
+    return S_OK;
+  }
+  HRESULT SetSampleDuration(LONGLONG duration) override {
+    duration_ = duration;
+    hasDuration_ = true;
+    return S_OK;
+  }
+  HRESULT GetBufferCount(DWORD* count) override {
+    if (!count) return E_POINTER;
+    *count = static_cast<DWORD>(buffers_.size());
+    return S_OK;
+  }
+  HRESULT GetBufferByIndex(DWORD index, IMFMediaBuffer** buffer) override {
+    if (!buffer) return E_POINTER;
+    if (index >= buffers_.size()) return E_INVALIDARG;
+    *buffer = buffers_[index];
+    (*buffer)->AddRef();
+    return S_OK;
+  }
+  // One buffer is handed out as it is; several are joined into a new buffer that then replaces
+  // them in the sample, as Media Foundation does.
+  HRESULT ConvertToContiguousBuffer(IMFMediaBuffer** buffer) override {
+    if (!buffer) return E_POINTER;
+    if (buffers_.empty()) return E_UNEXPECTED;
+    if (buffers_.size() == 1) {
+      *buffer = buffers_[0];
+      (*buffer)->AddRef();
+      return S_OK;
+    }
+    DWORD total = 0;
+    GetTotalLength(&total);
+    IMFMediaBuffer* joined = nullptr;
+    HRESULT hr = MFCreateMemoryBuffer(total, &joined);
+    if (FAILED(hr)) return hr;
+    hr = CopyToBuffer(joined);
+    if (FAILED(hr)) {
+      joined->Release();
+      return hr;
+    }
+    RemoveAllBuffers();
+    buffers_.push_back(joined);
+    joined->AddRef();
+    *buffer = joined;
+    return S_OK;
+  }
+  HRESULT AddBuffer(IMFMediaBuffer* buffer) override {
+    if (!buffer) return E_INVALIDARG;
+    buffer->AddRef();
+    buffers_.push_back(buffer);
+    return S_OK;
+  }
+  HRESULT RemoveBufferByIndex(DWORD index) override {
+    if (index >= buffers_.size()) return E_INVALIDARG;
+    buffers_[index]->Release();
+    buffers_.erase(buffers_.begin() + index);
+    return S_OK;
+  }
+  HRESULT RemoveAllBuffers() override {
+    for (IMFMediaBuffer* buffer : buffers_) buffer->Release();
+    buffers_.clear();
+    return S_OK;
+  }
+  HRESULT GetTotalLength(DWORD* length) override {
+    if (!length) return E_POINTER;
+    DWORD total = 0;
+    for (IMFMediaBuffer* buffer : buffers_) {
+      DWORD current = 0;
+      buffer->GetCurrentLength(&current);
+      total += current;
+    }
+    *length = total;
+    return S_OK;
+  }
+  HRESULT CopyToBuffer(IMFMediaBuffer* destination) override {
+    if (!destination) return E_POINTER;
+    DWORD total = 0, maxLength = 0;
+    GetTotalLength(&total);
+    BYTE* out = nullptr;
+    HRESULT hr = destination->Lock(&out, &maxLength, nullptr);
+    if (FAILED(hr)) return hr;
+    if (maxLength < total) {
+      destination->Unlock();
+      return MF_E_BUFFERTOOSMALL;
+    }
+    DWORD offset = 0;
+    for (IMFMediaBuffer* buffer : buffers_) {
+      BYTE* in = nullptr;
+      DWORD current = 0;
+      if (SUCCEEDED(buffer->Lock(&in, nullptr, &current))) {
+        if (current) std::memcpy(out + offset, in, current);
+        offset += current;
+        buffer->Unlock();
+      }
+    }
+    destination->Unlock();
+    return destination->SetCurrentLength(offset);
+  }
+
+ private:
+  std::vector<IMFMediaBuffer*> buffers_;
+  DWORD flags_ = 0;
+  LONGLONG time_ = 0;
+  LONGLONG duration_ = 0;
+  bool hasTime_ = false;
+  bool hasDuration_ = false;
+};
+
+class Collection : public ComObject<IMFCollection, IID_IMFCollection> {
+ public:
+  ~Collection() override { RemoveAllElements(); }
+
+  HRESULT GetElementCount(DWORD* count) override {
+    if (!count) return E_POINTER;
+    *count = static_cast<DWORD>(elements_.size());
+    return S_OK;
+  }
+  HRESULT GetElement(DWORD index, IUnknown** element) override {
+    if (!element) return E_POINTER;
+    if (index >= elements_.size()) return E_INVALIDARG;
+    *element = elements_[index];
+    if (*element) (*element)->AddRef();
+    return S_OK;
+  }
+  HRESULT AddElement(IUnknown* element) override { return InsertElementAt(static_cast<DWORD>(elements_.size()), element); }
+  HRESULT RemoveElement(DWORD index, IUnknown** element) override {
+    if (!element) return E_POINTER;
+    if (index >= elements_.size()) return E_INVALIDARG;
+    *element = elements_[index];  // the collection's reference passes to the caller
+    elements_.erase(elements_.begin() + index);
+    return S_OK;
+  }
+  HRESULT InsertElementAt(DWORD index, IUnknown* element) override {
+    if (index > elements_.size()) return E_INVALIDARG;
+    if (element) element->AddRef();
+    elements_.insert(elements_.begin() + index, element);
+    return S_OK;
+  }
+  HRESULT RemoveAllElements() override {
+    for (IUnknown* element : elements_)
+      if (element) element->Release();
+    elements_.clear();
+    return S_OK;
+  }
+
+ private:
+  std::vector<IUnknown*> elements_;
+};
+
+}  // namespace
+
+}  // namespace platform
+
+HRESULT MFCreateMemoryBuffer(DWORD maxLength, IMFMediaBuffer** buffer) {
+  if (!buffer) return E_POINTER;
+  *buffer = nullptr;
+  auto* created = new platform::MemoryBuffer(maxLength);
+  if (!created->valid()) {
+    created->Release();
+    return E_OUTOFMEMORY;
+  }
+  *buffer = created;
+  return S_OK;
+}
+
+HRESULT MFCreateSample(IMFSample** sample) {
+  if (!sample) return E_POINTER;
+  *sample = new platform::Sample();
+  return S_OK;
+}
+
+HRESULT MFCreateCollection(IMFCollection** collection) {
+  if (!collection) return E_POINTER;
+  *collection = new platform::Collection();
+  return S_OK;
+}
