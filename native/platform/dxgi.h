@@ -1,0 +1,12 @@
+// DXGI and Direct3D 11: factory, adapters, outputs, desktop duplication, devices, staging
+// textures, and ID3D10Multithread.
+#pragma once
+
+#ifdef _WIN32
+#include "platform/com.h"
+#include <d3d10.h>
+#include <d3d11.h>
+#include <dxgi1_2.h>
+#else
+#include "platform/linux/dxgi.h"
+#endif

@@ -1,0 +1,344 @@
+#include "platform/linux/duplication.h"
+
+#include <poll.h>
+#include <unistd.h>
+#include <xcb/damage.h>
+#include <xcb/randr.h>
+#include <xcb/shm.h>
+#include <xcb/xfixes.h>
+
+#include <algorithm>
+#include <chrono>
+#include <cstdlib>
+#include <cstring>
+
+namespace platform::dxgi {
+
+namespace {
+
+template <class T>
+std::unique_ptr<T, decltype(&std::free)> own(T* value) {
+  return {value, &std::free};
+}
+
+// Frame and pointer times in 100 ns units of a steady clock, as QueryPerformanceCounter gives them.
+int64_t ticks() {
+  using Ticks = std::chrono::duration<int64_t, std::ratio<1, 10000000>>;
+  return std::chrono::duration_cast<Ticks>(std::chrono::steady_clock::now().time_since_epoch()).count();
+}
+
+// The desktop image of an acquired frame: copying it grabs the monitor.
+class DesktopTexture : public d3d11::Texture {
+ public:
+  DesktopTexture(const D3D11_TEXTURE2D_DESC& desc, Duplication* duplication)
+      : Texture(desc), duplication_(duplication) {
+    duplication_->AddRef();
+  }
+  ~DesktopTexture() override { duplication_->Release(); }
+  HRESULT QueryInterface(REFIID riid, void** object) override {
+    if (riid == IID_IDXGIResource || riid == IID_IDXGIObject) {
+      AddRef();
+      *object = &resource_;
+      return S_OK;
+    }
+    return Texture::QueryInterface(riid, object);
+  }
+  void copyTo(d3d11::Texture& destination) override { duplication_->grab(destination); }
+  IDXGIResource* resource() {
+    AddRef();
+    return &resource_;
+  }
+
+ private:
+  // The IDXGIResource face of the same object.
+  struct Resource : IDXGIResource {
+    explicit Resource(DesktopTexture* owner) : owner(owner) {}
+    HRESULT QueryInterface(REFIID riid, void** object) override { return owner->QueryInterface(riid, object); }
+    ULONG AddRef() override { return owner->AddRef(); }
+    ULONG Release() override { return owner->Release(); }
+    DesktopTexture* owner;
+  };
+  Duplication* duplication_;
+  Resource resource_{this};
+};
+
+bool overlaps(const xcb_rectangle_t& a, const x11::Monitor& m) {
+  return a.x < m.x + m.width && m.x < a.x + a.width && a.y < m.y + m.height && m.y < a.y + a.height;
+}
+
+}  // namespace
+
+HRESULT Duplication::open(const std::string& display, int screen, xcb_atom_t name, IDXGIOutputDuplication** result) {
+  if (!result) return E_INVALIDARG;
+  *result = nullptr;
+  x11::Connection connection = x11::connect(display);
+  if (!connection) return DXGI_ERROR_SESSION_DISCONNECTED;
+  auto* duplication = new Duplication(std::move(connection), screen, name);
+  if (!duplication->setUp()) {
+    duplication->Release();
+    return DXGI_ERROR_UNSUPPORTED;
+  }
+  *result = duplication;
+  return S_OK;
+}
+
+Duplication::Duplication(x11::Connection connection, int screen, xcb_atom_t name)
+    : connection_(std::move(connection)), screen_(screen), name_(name) {}
+
+bool Duplication::setUp() {
+  xcb_connection_t* c = connection_.get();
+  xcb_screen_t* screen = x11::screenOf(c, screen_);
+  if (!screen || !x11::findMonitor(c, screen_, name_, &monitor_)) return false;
+  root_ = screen->root;
+
+  // The grab hands on 4 bytes a pixel: the root must be 24 or 32 bits deep at 32 bits a pixel.
+  bool fourBytes = false;
+  const xcb_setup_t* setup = xcb_get_setup(c);
+  for (auto it = xcb_setup_pixmap_formats_iterator(setup); it.rem; xcb_format_next(&it)) {
+    if (it.data->depth == screen->root_depth) fourBytes = it.data->bits_per_pixel == 32;
+  }
+  if (!fourBytes || (screen->root_depth != 24 && screen->root_depth != 32)) return false;
+
+  const xcb_query_extension_reply_t* damage = xcb_get_extension_data(c, &xcb_damage_id);
+  const xcb_query_extension_reply_t* xfixes = xcb_get_extension_data(c, &xcb_xfixes_id);
+  const xcb_query_extension_reply_t* randr = xcb_get_extension_data(c, &xcb_randr_id);
+  if (!damage || !damage->present || !xfixes || !xfixes->present || !randr || !randr->present) return false;
+  damageEvent_ = damage->first_event;
+  xfixesEvent_ = xfixes->first_event;
+  randrEvent_ = randr->first_event;
+
+  // Extensions answer only once their versions are agreed.
+  free(xcb_xfixes_query_version_reply(c, xcb_xfixes_query_version(c, 5, 0), nullptr));
+  free(xcb_damage_query_version_reply(c, xcb_damage_query_version(c, 1, 1), nullptr));
+  free(xcb_randr_query_version_reply(c, xcb_randr_query_version(c, 1, 5), nullptr));
+
+  damage_ = xcb_generate_id(c);
+  xcb_damage_create(c, damage_, root_, XCB_DAMAGE_REPORT_LEVEL_DELTA_RECTANGLES);
+  xcb_xfixes_select_cursor_input(c, root_, XCB_XFIXES_CURSOR_NOTIFY_MASK_DISPLAY_CURSOR);
+  xcb_randr_select_input(c, root_,
+                         XCB_RANDR_NOTIFY_MASK_SCREEN_CHANGE | XCB_RANDR_NOTIFY_MASK_CRTC_CHANGE |
+                             XCB_RANDR_NOTIFY_MASK_OUTPUT_CHANGE | XCB_RANDR_NOTIFY_MASK_RESOURCE_CHANGE);
+
+  // Version 1.2 passes file descriptors, so the texture's memfd can be shared.
+  auto shm = own(xcb_shm_query_version_reply(c, xcb_shm_query_version(c), nullptr));
+  shm_ = shm && (shm->major_version > 1 || (shm->major_version == 1 && shm->minor_version >= 2));
+  xcb_flush(c);
+  return !xcb_connection_has_error(c);
+}
+
+void Duplication::GetDesc(DXGI_OUTDUPL_DESC* desc) {
+  if (!desc) return;
+  std::memset(desc, 0, sizeof(*desc));
+  desc->ModeDesc.Width = monitor_.width;
+  desc->ModeDesc.Height = monitor_.height;
+  desc->ModeDesc.Format = DXGI_FORMAT_B8G8R8A8_UNORM;
+  desc->Rotation = DXGI_MODE_ROTATION_IDENTITY;
+  desc->DesktopImageInSystemMemory = TRUE;
+}
+
+void Duplication::handle(xcb_generic_event_t* event) {
+  uint8_t type = event->response_type & 0x7F;
+  if (type == damageEvent_ + XCB_DAMAGE_NOTIFY) {
+    auto* notify = reinterpret_cast<xcb_damage_notify_event_t*>(event);
+    if (overlaps(notify->area, monitor_)) drawn_ = true;
+  } else if (type == xfixesEvent_ + XCB_XFIXES_CURSOR_NOTIFY) {
+    shapeChanged_ = true;
+  } else if (type == randrEvent_ + XCB_RANDR_SCREEN_CHANGE_NOTIFY || type == randrEvent_ + XCB_RANDR_NOTIFY) {
+    checkGeometry();
+  }
+}
+
+void Duplication::handleEvents() {
+  while (xcb_generic_event_t* event = xcb_poll_for_event(connection_.get())) {
+    handle(event);
+    free(event);
+  }
+  if (xcb_connection_has_error(connection_.get())) lost_ = true;
+}
+
+// A monitor that moved, changed size or went away ends this duplication, as a mode change does.
+void Duplication::checkGeometry() {
+  x11::Monitor now;
+  if (!x11::findMonitor(connection_.get(), screen_, name_, &now) || now.x != monitor_.x || now.y != monitor_.y ||
+      now.width != monitor_.width || now.height != monitor_.height) {
+    lost_ = true;
+  }
+}
+
+// DAMAGE does not report pointer motion, so the pointer is asked for.
+bool Duplication::pointerMoved() {
+  auto pointer = own(xcb_query_pointer_reply(connection_.get(), xcb_query_pointer(connection_.get(), root_), nullptr));
+  if (!pointer) return false;
+  bool onScreen = pointer->same_screen != 0;
+  bool moved = pointer->root_x != pointerX_ || pointer->root_y != pointerY_ || onScreen != pointerOnScreen_;
+  pointerX_ = pointer->root_x;
+  pointerY_ = pointer->root_y;
+  pointerOnScreen_ = onScreen;
+  return moved;
+}
+
+// XFIXES gives premultiplied ARGB words; shapes are handed on as B, G, R, A with straight alpha.
+void Duplication::fetchCursor() {
+  auto image = own(xcb_xfixes_get_cursor_image_reply(connection_.get(),
+                                                     xcb_xfixes_get_cursor_image(connection_.get()), nullptr));
+  if (!image) return;
+  cursorWidth_ = image->width;
+  cursorHeight_ = image->height;
+  hotX_ = image->xhot;
+  hotY_ = image->yhot;
+  const uint32_t* pixels = xcb_xfixes_get_cursor_image_cursor_image(image.get());
+  size_t count = static_cast<size_t>(cursorWidth_) * cursorHeight_;
+  cursor_.resize(count * 4);
+  for (size_t i = 0; i < count; ++i) {
+    uint32_t p = pixels[i];
+    uint32_t a = p >> 24;
+    uint8_t* out = &cursor_[i * 4];
+    for (int channel = 0; channel < 3; ++channel) {
+      uint32_t c = (p >> (8 * channel)) & 0xFF;
+      out[channel] = a == 0 ? 0 : static_cast<uint8_t>(std::min<uint32_t>(255, (c * 255 + a / 2) / a));
+    }
+    out[3] = static_cast<uint8_t>(a);
+  }
+}
+
+HRESULT Duplication::AcquireNextFrame(UINT timeoutMilliseconds, DXGI_OUTDUPL_FRAME_INFO* frameInfo,
+                                      IDXGIResource** desktopResource) {
+  if (!frameInfo || !desktopResource) return E_INVALIDARG;
+  *desktopResource = nullptr;
+  if (held_) return DXGI_ERROR_INVALID_CALL;
+  handleEvents();
+  if (lost_) return DXGI_ERROR_ACCESS_LOST;
+
+  bool moved = pointerMoved();
+  handleEvents();  // events that came in with the reply
+  if (!first_ && !drawn_ && !shapeChanged_ && !moved) {
+    auto deadline = std::chrono::steady_clock::now() + std::chrono::milliseconds(timeoutMilliseconds);
+    int fd = xcb_get_file_descriptor(connection_.get());
+    for (;;) {
+      auto left = std::chrono::duration_cast<std::chrono::milliseconds>(deadline - std::chrono::steady_clock::now());
+      if (left.count() <= 0) break;
+      pollfd waiting{fd, POLLIN, 0};
+      xcb_flush(connection_.get());
+      poll(&waiting, 1, static_cast<int>(left.count()));
+      handleEvents();
+      if (lost_) return DXGI_ERROR_ACCESS_LOST;
+      if (drawn_ || shapeChanged_) break;
+    }
+    if (!drawn_ && !shapeChanged_) {
+      moved = pointerMoved();
+      handleEvents();
+      if (lost_) return DXGI_ERROR_ACCESS_LOST;
+      if (!drawn_ && !shapeChanged_ && !moved) return DXGI_ERROR_WAIT_TIMEOUT;
+    }
+  }
+
+  std::memset(frameInfo, 0, sizeof(*frameInfo));
+  int64_t now = ticks();
+  if (first_ || drawn_) {
+    // Drawing after this point is reported again and makes the next frame.
+    xcb_damage_subtract(connection_.get(), damage_, XCB_NONE, XCB_NONE);
+    frameInfo->LastPresentTime.QuadPart = now;
+    frameInfo->AccumulatedFrames = 1;
+  }
+  bool shape = first_ || shapeChanged_;
+  if (shape) {
+    fetchCursor();
+    frameInfo->PointerShapeBufferSize = static_cast<UINT>(cursor_.size());
+  }
+  if (shape || moved) {
+    // Windows reports the shape's top-left corner, and a pointer off this output as invisible.
+    int32_t x = pointerX_ - monitor_.x;
+    int32_t y = pointerY_ - monitor_.y;
+    frameInfo->LastMouseUpdateTime.QuadPart = now;
+    frameInfo->PointerPosition.Position.x = x - hotX_;
+    frameInfo->PointerPosition.Position.y = y - hotY_;
+    frameInfo->PointerPosition.Visible =
+        pointerOnScreen_ && x >= 0 && y >= 0 && x < monitor_.width && y < monitor_.height ? TRUE : FALSE;
+  }
+  first_ = drawn_ = shapeChanged_ = false;
+  held_ = true;
+
+  D3D11_TEXTURE2D_DESC desc{};
+  desc.Width = monitor_.width;
+  desc.Height = monitor_.height;
+  desc.MipLevels = 1;
+  desc.ArraySize = 1;
+  desc.Format = DXGI_FORMAT_B8G8R8A8_UNORM;
+  desc.SampleDesc.Count = 1;
+  desc.Usage = D3D11_USAGE_DEFAULT;
+  auto* texture = new DesktopTexture(desc, this);
+  *desktopResource = texture->resource();
+  texture->Release();
+  return S_OK;
+}
+
+HRESULT Duplication::GetFramePointerShape(UINT bufferSize, void* buffer, UINT* requiredSize,
+                                          DXGI_OUTDUPL_POINTER_SHAPE_INFO* shapeInfo) {
+  if (!requiredSize || !shapeInfo) return E_INVALIDARG;
+  if (!held_) return DXGI_ERROR_INVALID_CALL;
+  *requiredSize = static_cast<UINT>(cursor_.size());
+  if (bufferSize < cursor_.size()) return DXGI_ERROR_MORE_DATA;
+  if (!cursor_.empty()) {
+    if (!buffer) return E_INVALIDARG;
+    std::memcpy(buffer, cursor_.data(), cursor_.size());
+  }
+  shapeInfo->Type = DXGI_OUTDUPL_POINTER_SHAPE_TYPE_COLOR;
+  shapeInfo->Width = cursorWidth_;
+  shapeInfo->Height = cursorHeight_;
+  shapeInfo->Pitch = cursorWidth_ * 4;
+  shapeInfo->HotSpot.x = hotX_;
+  shapeInfo->HotSpot.y = hotY_;
+  return S_OK;
+}
+
+HRESULT Duplication::ReleaseFrame() {
+  if (!held_) return DXGI_ERROR_INVALID_CALL;
+  held_ = false;
+  return S_OK;
+}
+
+bool Duplication::attach(const std::shared_ptr<d3d11::TextureMemory>& memory) {
+  if (attached_ == memory) return true;
+  xcb_connection_t* c = connection_.get();
+  if (attached_) xcb_shm_detach(c, segment_);
+  attached_.reset();
+  int fd = dup(memory->fd());  // xcb closes the descriptor it sends
+  if (fd < 0) return false;
+  segment_ = xcb_generate_id(c);
+  xcb_generic_error_t* error = xcb_request_check(c, xcb_shm_attach_fd_checked(c, segment_, fd, 0));
+  if (error) {
+    free(error);
+    return false;
+  }
+  attached_ = memory;
+  return true;
+}
+
+void Duplication::grab(d3d11::Texture& destination) {
+  const auto& memory = destination.memory();
+  size_t bytes = static_cast<size_t>(monitor_.width) * monitor_.height * 4;
+  if (!memory || memory->size() < bytes) return;
+  xcb_connection_t* c = connection_.get();
+  if (shm_ && !attach(memory)) shm_ = false;
+  if (shm_) {
+    auto image = own(xcb_shm_get_image_reply(
+        c,
+        xcb_shm_get_image(c, root_, monitor_.x, monitor_.y, monitor_.width, monitor_.height, ~0u,
+                          XCB_IMAGE_FORMAT_Z_PIXMAP, segment_, 0),
+        nullptr));
+    if (!image) return;
+  } else {
+    auto image = own(xcb_get_image_reply(c,
+                                         xcb_get_image(c, XCB_IMAGE_FORMAT_Z_PIXMAP, root_, monitor_.x, monitor_.y,
+                                                       monitor_.width, monitor_.height, ~0u),
+                                         nullptr));
+    if (!image || static_cast<size_t>(xcb_get_image_data_length(image.get())) < bytes) return;
+    std::memcpy(memory->data(), xcb_get_image_data(image.get()), bytes);
+  }
+  // The server leaves the padding byte of a 24-bit pixel at 0; the format promises opaque alpha.
+  auto* pixels = reinterpret_cast<uint32_t*>(memory->data());
+  size_t count = bytes / 4;
+  for (size_t i = 0; i < count; ++i) pixels[i] |= 0xFF000000u;
+}
+
+}  // namespace platform::dxgi

@@ -1,0 +1,72 @@
+// Desktop duplication of one RandR monitor. The duplication has an X connection of its own,
+// used only by the thread that acquires frames: DAMAGE tells it about drawing, XFIXES about
+// cursor shapes, RandR about geometry changes, and MIT-SHM writes the monitor's rectangle
+// straight into the staging texture's memory.
+#pragma once
+
+#include <xcb/xcb.h>
+
+#include <cstdint>
+#include <memory>
+#include <string>
+#include <vector>
+
+#include "platform/linux/d3d11objects.h"
+#include "platform/linux/display.h"
+
+namespace platform::dxgi {
+
+class Duplication : public platform::ComObject<IDXGIOutputDuplication, IID_IDXGIObject, IID_IDXGIOutputDuplication> {
+ public:
+  // Opens a duplication of monitor `name` of `screen` on display `display`.
+  static HRESULT open(const std::string& display, int screen, xcb_atom_t name, IDXGIOutputDuplication** result);
+
+  void GetDesc(DXGI_OUTDUPL_DESC* desc) override;
+  HRESULT AcquireNextFrame(UINT timeoutMilliseconds, DXGI_OUTDUPL_FRAME_INFO* frameInfo,
+                           IDXGIResource** desktopResource) override;
+  HRESULT GetFramePointerShape(UINT bufferSize, void* buffer, UINT* requiredSize,
+                               DXGI_OUTDUPL_POINTER_SHAPE_INFO* shapeInfo) override;
+  HRESULT ReleaseFrame() override;
+
+  // Grabs the monitor's rectangle into `destination` (same size, CPU memory), alpha set to 255.
+  void grab(d3d11::Texture& destination);
+
+ private:
+  Duplication(x11::Connection connection, int screen, xcb_atom_t name);
+  ~Duplication() override = default;
+  bool setUp();
+  void handleEvents();
+  void handle(xcb_generic_event_t* event);
+  void checkGeometry();
+  bool pointerMoved();
+  void fetchCursor();
+  bool attach(const std::shared_ptr<d3d11::TextureMemory>& memory);
+
+  x11::Connection connection_;
+  int screen_;
+  xcb_atom_t name_;
+  xcb_window_t root_ = 0;
+  x11::Monitor monitor_;
+  uint32_t damage_ = 0;
+  uint8_t damageEvent_ = 0, xfixesEvent_ = 0, randrEvent_ = 0;
+
+  bool held_ = false;
+  bool first_ = true;
+  bool lost_ = false;
+  bool drawn_ = false;
+  bool shapeChanged_ = false;
+
+  // Pointer in root coordinates as last handed on.
+  int32_t pointerX_ = 0, pointerY_ = 0;
+  bool pointerOnScreen_ = false;
+  // The cursor image in B, G, R, A with straight alpha.
+  std::vector<uint8_t> cursor_;
+  uint32_t cursorWidth_ = 0, cursorHeight_ = 0;
+  int32_t hotX_ = 0, hotY_ = 0;
+
+  bool shm_ = false;
+  uint32_t segment_ = 0;
+  std::shared_ptr<d3d11::TextureMemory> attached_;
+};
+
+}  // namespace platform::dxgi

@@ -1,0 +1,106 @@
+// DXGI factory, adapters and outputs: an adapter is an X screen of $DISPLAY, an output one of
+// its RandR monitors, in the server's order.
+#include <algorithm>
+#include <vector>
+
+#include "platform/linux/display.h"
+#include "platform/linux/duplication.h"
+#include "platform/linux/dxgi.h"
+
+namespace platform::dxgi {
+
+namespace {
+
+class Output : public platform::ComObject<IDXGIOutput1, IID_IDXGIObject, IID_IDXGIOutput, IID_IDXGIOutput1> {
+ public:
+  Output(std::string display, int screen, const DXGI_OUTPUT_DESC& desc, xcb_atom_t name)
+      : display_(std::move(display)), screen_(screen), desc_(desc), name_(name) {}
+
+  HRESULT GetDesc(DXGI_OUTPUT_DESC* desc) override {
+    if (!desc) return E_INVALIDARG;
+    *desc = desc_;
+    return S_OK;
+  }
+
+  HRESULT DuplicateOutput(IUnknown* device, IDXGIOutputDuplication** duplication) override {
+    if (!device || !duplication) return E_INVALIDARG;
+    ID3D11Device* d3d = nullptr;
+    if (FAILED(device->QueryInterface(IID_ID3D11Device, reinterpret_cast<void**>(&d3d)))) return E_INVALIDARG;
+    d3d->Release();
+    return Duplication::open(display_, screen_, name_, duplication);
+  }
+
+ private:
+  std::string display_;
+  int screen_;
+  DXGI_OUTPUT_DESC desc_;
+  xcb_atom_t name_;
+};
+
+class Adapter : public platform::ComObject<IDXGIAdapter1, IID_IDXGIObject, IID_IDXGIAdapter, IID_IDXGIAdapter1> {
+ public:
+  Adapter(std::string display, x11::Connection connection, int screen)
+      : display_(std::move(display)), connection_(std::move(connection)), screen_(screen) {}
+
+  HRESULT EnumOutputs(UINT index, IDXGIOutput** output) override {
+    if (!output) return E_INVALIDARG;
+    *output = nullptr;
+    std::vector<x11::Monitor> monitors = x11::monitors(connection_.get(), screen_);
+    if (index >= monitors.size()) return DXGI_ERROR_NOT_FOUND;
+    const x11::Monitor& m = monitors[index];
+    DXGI_OUTPUT_DESC desc{};
+    std::string device = x11::displayDeviceName(x11::displayNumber(connection_.get(), screen_, m.name));
+    std::copy(device.begin(), device.end(), desc.DeviceName);
+    desc.DesktopCoordinates = {m.x, m.y, m.x + m.width, m.y + m.height};
+    desc.AttachedToDesktop = TRUE;
+    desc.Rotation = DXGI_MODE_ROTATION_IDENTITY;
+    desc.Monitor = x11::monitorHandle(screen_, m.name);
+    *output = new Output(display_, screen_, desc, m.name);
+    return S_OK;
+  }
+
+  HRESULT GetDesc1(DXGI_ADAPTER_DESC1* desc) override {
+    if (!desc) return E_INVALIDARG;
+    *desc = {};
+    std::string text = "X11 screen " + std::to_string(screen_) + " of " + display_;
+    std::copy_n(text.begin(), std::min<size_t>(text.size(), 127), desc->Description);
+    desc->AdapterLuid.LowPart = static_cast<DWORD>(screen_ + 1);
+    return S_OK;
+  }
+
+ private:
+  std::string display_;
+  x11::Connection connection_;
+  int screen_;
+};
+
+class Factory : public platform::ComObject<IDXGIFactory1, IID_IDXGIObject, IID_IDXGIFactory, IID_IDXGIFactory1> {
+ public:
+  // No X server means a machine without adapters, not a failure.
+  Factory() : display_(x11::displayName()), connection_(x11::connect(display_)) {}
+
+  HRESULT EnumAdapters1(UINT index, IDXGIAdapter1** adapter) override {
+    if (!adapter) return E_INVALIDARG;
+    *adapter = nullptr;
+    if (!connection_ || index >= static_cast<UINT>(x11::screenCount(connection_.get()))) return DXGI_ERROR_NOT_FOUND;
+    *adapter = new Adapter(display_, connection_, static_cast<int>(index));
+    return S_OK;
+  }
+
+ private:
+  std::string display_;
+  x11::Connection connection_;
+};
+
+}  // namespace
+
+}  // namespace platform::dxgi
+
+HRESULT CreateDXGIFactory1(REFIID riid, void** factory) {
+  if (!factory) return E_INVALIDARG;
+  *factory = nullptr;
+  auto* created = new platform::dxgi::Factory();
+  HRESULT hr = created->QueryInterface(riid, factory);
+  created->Release();
+  return hr;
+}
