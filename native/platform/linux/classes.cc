@@ -2,6 +2,7 @@
 
 #include <iterator>
 
+#include "platform/linux/mfcapture.h"
 #include "platform/linux/wasapi.h"
 
 namespace platform {
@@ -18,6 +19,7 @@ HRESULT noClass(REFIID, void** object) {
 const ClassEntry classes[] = {
     {GUID_NULL, noClass},
     {CLSID_MMDeviceEnumerator, wasapi::createDeviceEnumerator},
+    {CLSID_MFCaptureEngineClassFactory, createCaptureEngineClassFactory},
 };
 
 }  // namespace

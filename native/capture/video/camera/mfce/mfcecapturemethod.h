@@ -6,7 +6,7 @@
 namespace capture::video::camera::mfce {
 
 // Cameras (sources()) and the microphones of capture devices (audioSources()).
-class MFCECaptureMethod : public capture::CaptureMethod {
+class MFCECaptureMethod : public virtual capture::CaptureMethod {
  public:
   bool available() override;
   std::vector<std::shared_ptr<capture::Source>> sources() override;

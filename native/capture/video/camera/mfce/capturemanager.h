@@ -1,0 +1,113 @@
+// One Media Foundation capture engine for one camera source: preview through sample callbacks,
+// recording through the engine's record sink, and the engine's events turned into flags and one
+// auto-reset event that the start and stop operations wait on.
+#pragma once
+
+#include <atomic>
+#include <cstdint>
+
+#include "capture/video/frame.h"
+#include "platform/dxgi.h"
+#include "platform/kernel32.h"
+#include "platform/mfcapture.h"
+
+namespace capture::video::camera::mfce {
+
+class CaptureManager {
+ public:
+  // Engine events: handled on the engine's thread once `direct` is set, else posted to
+  // `eventWindow`.
+  class CaptureEngineCB : public IMFCaptureEngineOnEventCallback {
+   public:
+    explicit CaptureEngineCB(HWND eventWindow) : eventWindow(eventWindow) {}
+    HRESULT STDMETHODCALLTYPE QueryInterface(REFIID riid, void** object) override;
+    ULONG STDMETHODCALLTYPE AddRef() override;
+    ULONG STDMETHODCALLTYPE Release() override;
+    HRESULT STDMETHODCALLTYPE OnEvent(IMFMediaEvent* event) override;
+
+    std::atomic<uint32_t> references{1};
+    HWND eventWindow;
+    bool direct = false;
+    CaptureManager* manager = nullptr;
+
+   protected:
+    virtual ~CaptureEngineCB() = default;
+  };
+
+  // Camera pictures: each one becomes the only frame of the manager's frame queue.
+  class CaptureEngineVideoPreviewCB : public IMFCaptureEngineOnSampleCallback {
+   public:
+    HRESULT STDMETHODCALLTYPE QueryInterface(REFIID riid, void** object) override;
+    ULONG STDMETHODCALLTYPE AddRef() override;
+    ULONG STDMETHODCALLTYPE Release() override;
+    HRESULT STDMETHODCALLTYPE OnSample(IMFSample* sample) override;
+
+    std::atomic<uint32_t> references{1};
+    CaptureManager* manager = nullptr;
+
+   protected:
+    virtual ~CaptureEngineVideoPreviewCB() = default;
+  };
+
+  // Microphone buffers: each one replaces the two level peaks.
+  class CaptureEngineAudioPreviewCB : public IMFCaptureEngineOnSampleCallback {
+   public:
+    HRESULT STDMETHODCALLTYPE QueryInterface(REFIID riid, void** object) override;
+    ULONG STDMETHODCALLTYPE AddRef() override;
+    ULONG STDMETHODCALLTYPE Release() override;
+    HRESULT STDMETHODCALLTYPE OnSample(IMFSample* sample) override;
+
+    std::atomic<uint32_t> references{1};
+    CaptureManager* manager = nullptr;
+
+   protected:
+    virtual ~CaptureEngineAudioPreviewCB() = default;
+  };
+
+  CaptureManager();
+  CaptureManager(const CaptureManager&) = delete;
+  CaptureManager& operator=(const CaptureManager&) = delete;
+
+  HRESULT Initialize(IUnknown* audioDevice, IUnknown* videoDevice);
+  void DestroyEngine();
+  HRESULT ConfigurePreview(UINT32& width, UINT32& height);
+  HRESULT StartPreview(capture::video::FrameQueue* queue);
+  HRESULT StopPreview();
+  HRESULT StartRecord(LPCWSTR path);
+  HRESULT StopRecord();
+  HRESULT HandleEngineEvent(IMFMediaEvent* event);
+
+  bool IsPreviewing() const { return previewing; }
+  bool IsRecording() const { return recording; }
+
+  HWND eventWindow = nullptr;
+  IMFCaptureEngine* engine = nullptr;
+  uint32_t hasAudio = 0;
+  uint32_t hasVideo = 0;
+  IMFCapturePreviewSink* previewSink = nullptr;
+  HWND previewWindow = nullptr;
+  CaptureEngineVideoPreviewCB* videoSampleCallback = nullptr;
+  capture::video::FrameQueue* frameQueue = nullptr;
+  CaptureEngineAudioPreviewCB* audioSampleCallback = nullptr;
+  uint32_t audioChannels = 0;
+  uint32_t audioBitsPerSample = 0;
+  std::atomic<double> leftPeak{0.0};
+  std::atomic<double> rightPeak{0.0};
+  CaptureEngineCB* eventCallback = nullptr;
+  bool previewing = false;
+  bool recording = false;
+  bool photoPending = false;
+  uint32_t errorId = 0;
+  HANDLE engineEvent = nullptr;
+  HANDLE powerRequest = INVALID_HANDLE_VALUE;
+  bool powerRequestSet = false;
+  IMFDXGIDeviceManager* dxgiManager = nullptr;
+  ID3D11Device* d3dDevice = nullptr;
+  UINT resetToken = 0;
+
+ private:
+  HRESULT AddVideoRecordStream(IMFCaptureSource* source, IMFCaptureRecordSink* sink);
+  HRESULT AddAudioRecordStream(IMFCaptureRecordSink* sink);
+};
+
+}  // namespace capture::video::camera::mfce

@@ -1,0 +1,944 @@
+// The capture engine on Linux. One engine thread per engine opens the device with libavdevice
+// (v4l2, lavfi or pulse) while a preview or a recording runs, decodes what it reads, hands ARGB32
+// pictures and PCM buffers to the preview sink's callbacks, feeds the record sink's sink writer,
+// and delivers the engine's events to its event callback. Callers only queue commands.
+extern "C" {
+#include <libavcodec/avcodec.h>
+#include <libavdevice/avdevice.h>
+#include <libavformat/avformat.h>
+#include <libavutil/opt.h>
+#include <libswresample/swresample.h>
+#include <libswscale/swscale.h>
+}
+
+#include <condition_variable>
+#include <cstring>
+#include <deque>
+#include <memory>
+#include <mutex>
+#include <string>
+#include <thread>
+#include <vector>
+
+#include "platform/linux/mfattributes.h"
+#include "platform/linux/mfcapture.h"
+
+namespace platform {
+
+namespace {
+
+constexpr LONGLONG ticksPerSecond = 10000000;  // media times are in 100 ns units
+constexpr HRESULT classNotAvailable = hresult(0x80040111);  // CLASS_E_CLASSNOTAVAILABLE
+
+class MediaEvent : public Attributes<IMFMediaEvent, IID_IMFMediaEvent> {
+ public:
+  MediaEvent(const GUID& type, HRESULT status) : type_(type), status_(status) {}
+  HRESULT GetType(MediaEventType* type) override {
+    if (!type) return E_POINTER;
+    *type = MEExtendedType;
+    return S_OK;
+  }
+  HRESULT GetExtendedType(GUID* type) override {
+    if (!type) return E_POINTER;
+    *type = type_;
+    return S_OK;
+  }
+  HRESULT GetStatus(HRESULT* status) override {
+    if (!status) return E_POINTER;
+    *status = status_;
+    return S_OK;
+  }
+  HRESULT GetValue(PROPVARIANT* value) override {
+    if (!value) return E_POINTER;
+    PropVariantInit(value);
+    return S_OK;
+  }
+
+ private:
+  GUID type_;
+  HRESULT status_;
+};
+
+template <class T>
+struct ComPtr {
+  ComPtr() = default;
+  explicit ComPtr(T* p, bool addRef) : p(p) {
+    if (p && addRef) p->AddRef();
+  }
+  ComPtr(const ComPtr& other) : p(other.p) {
+    if (p) p->AddRef();
+  }
+  ComPtr& operator=(ComPtr other) {
+    std::swap(p, other.p);
+    return *this;
+  }
+  ~ComPtr() {
+    if (p) p->Release();
+  }
+  T* operator->() const { return p; }
+  explicit operator bool() const { return p != nullptr; }
+  T* p = nullptr;
+};
+
+// What a device delivers, as read when the engine initialises.
+struct DeviceFormat {
+  GUID subtype = GUID_NULL;
+  int width = 0;
+  int height = 0;
+  AVRational rate{30, 1};
+  AVRational aspect{1, 1};
+  int sampleRate = 0;
+  int channels = 0;
+};
+
+// One opened device: demuxer and decoder.
+struct Input {
+  ~Input() {
+    avcodec_free_context(&decoder);
+    avformat_close_input(&format);
+  }
+  AVFormatContext* format = nullptr;
+  AVCodecContext* decoder = nullptr;
+  int stream = -1;
+};
+
+struct Device {
+  bool video = false;
+  std::string formatName;  // "v4l2", "lavfi" or "pulse"
+  std::string url;
+  int rate = 48000;  // microphones: what to ask the server for
+  int channels = 2;
+  DeviceFormat current;
+  std::unique_ptr<Input> input;
+};
+
+GUID videoSubtype(const AVCodecParameters* codec) {
+  if (codec->codec_id == AV_CODEC_ID_MJPEG) return MFVideoFormat_MJPG;
+  if (codec->codec_id == AV_CODEC_ID_H264) return MFVideoFormat_H264;
+  switch (codec->format) {
+    case AV_PIX_FMT_YUYV422: return MFVideoFormat_YUY2;
+    case AV_PIX_FMT_NV12: return MFVideoFormat_NV12;
+    case AV_PIX_FMT_YUV420P: return MFVideoFormat_I420;
+    case AV_PIX_FMT_BGR0:
+    case AV_PIX_FMT_BGRA: return MFVideoFormat_RGB32;
+    case AV_PIX_FMT_BGR24: return MFVideoFormat_RGB24;
+    default: return MFVideoFormat_YUY2;  // the engine converts whatever else the device sends
+  }
+}
+
+HRESULT openInput(Device& device, std::unique_ptr<Input>& result) {
+  auto input = std::make_unique<Input>();
+  const AVInputFormat* format = av_find_input_format(device.formatName.c_str());
+  if (!format) return MF_E_NO_CAPTURE_DEVICES_AVAILABLE;
+  AVDictionary* options = nullptr;
+  std::string url = device.url;
+  if (device.formatName == "pulse") {
+    av_dict_set_int(&options, "sample_rate", device.rate, 0);
+    av_dict_set_int(&options, "channels", device.channels, 0);
+    // 20 ms fragments: the server's default is a buffer of seconds, far too late for peaks.
+    av_dict_set_int(&options, "fragment_size", device.rate * device.channels * 2 / 50, 0);
+  } else if (device.formatName == "lavfi") {
+    // Test cameras look like a YUY2 webcam and run at their frame rate, not as fast as possible.
+    url += ",format=yuyv422,realtime";
+  }
+  int error = avformat_open_input(&input->format, url.c_str(), format, &options);
+  av_dict_free(&options);
+  if (error < 0) return device.video ? MF_E_VIDEO_RECORDING_DEVICE_INVALIDATED : MF_E_AUDIO_RECORDING_DEVICE_INVALIDATED;
+  if (avformat_find_stream_info(input->format, nullptr) < 0) return MF_E_INVALID_STREAM_DATA;
+  input->stream = av_find_best_stream(input->format, device.video ? AVMEDIA_TYPE_VIDEO : AVMEDIA_TYPE_AUDIO, -1, -1,
+                                      nullptr, 0);
+  if (input->stream < 0)
+    return device.video ? MF_E_CAPTURE_SOURCE_NO_VIDEO_STREAM_PRESENT : MF_E_CAPTURE_SOURCE_NO_AUDIO_STREAM_PRESENT;
+  AVStream* stream = input->format->streams[input->stream];
+  const AVCodec* codec = avcodec_find_decoder(stream->codecpar->codec_id);
+  if (!codec) return MF_E_TOPO_CODEC_NOT_FOUND;
+  input->decoder = avcodec_alloc_context3(codec);
+  if (!input->decoder) return E_OUTOFMEMORY;
+  avcodec_parameters_to_context(input->decoder, stream->codecpar);
+  input->decoder->thread_count = 1;
+  if (avcodec_open2(input->decoder, codec, nullptr) < 0) return MF_E_TOPO_CODEC_NOT_FOUND;
+
+  DeviceFormat& current = device.current;
+  if (device.video) {
+    current.subtype = videoSubtype(stream->codecpar);
+    current.width = stream->codecpar->width;
+    current.height = stream->codecpar->height;
+    AVRational rate = stream->avg_frame_rate.num ? stream->avg_frame_rate : stream->r_frame_rate;
+    if (rate.num > 0 && rate.den > 0) current.rate = rate;
+    if (stream->codecpar->sample_aspect_ratio.num > 0) current.aspect = stream->codecpar->sample_aspect_ratio;
+  } else {
+    current.subtype = MFAudioFormat_PCM;
+    current.sampleRate = stream->codecpar->sample_rate;
+    current.channels = stream->codecpar->ch_layout.nb_channels;
+  }
+  result = std::move(input);
+  return S_OK;
+}
+
+HRESULT makeDeviceType(const Device& device, IMFMediaType** type) {
+  IMFMediaType* made = nullptr;
+  HRESULT hr = MFCreateMediaType(&made);
+  if (FAILED(hr)) return hr;
+  const DeviceFormat& f = device.current;
+  if (device.video) {
+    hr = made->SetGUID(MF_MT_MAJOR_TYPE, MFMediaType_Video);
+    if (SUCCEEDED(hr)) hr = made->SetGUID(MF_MT_SUBTYPE, f.subtype);
+    if (SUCCEEDED(hr)) hr = MFSetAttributeSize(made, MF_MT_FRAME_SIZE, f.width, f.height);
+    if (SUCCEEDED(hr)) hr = MFSetAttributeRatio(made, MF_MT_FRAME_RATE, f.rate.num, f.rate.den);
+    if (SUCCEEDED(hr)) hr = MFSetAttributeRatio(made, MF_MT_PIXEL_ASPECT_RATIO, f.aspect.num, f.aspect.den);
+    if (SUCCEEDED(hr)) hr = made->SetUINT32(MF_MT_INTERLACE_MODE, MFVideoInterlace_Progressive);
+    if (SUCCEEDED(hr) && f.subtype != MFVideoFormat_MJPG && f.subtype != MFVideoFormat_H264)
+      hr = made->SetUINT32(MF_MT_ALL_SAMPLES_INDEPENDENT, TRUE);
+  } else {
+    const UINT32 block = 2 * f.channels;
+    hr = made->SetGUID(MF_MT_MAJOR_TYPE, MFMediaType_Audio);
+    if (SUCCEEDED(hr)) hr = made->SetGUID(MF_MT_SUBTYPE, MFAudioFormat_PCM);
+    if (SUCCEEDED(hr)) hr = made->SetUINT32(MF_MT_AUDIO_NUM_CHANNELS, f.channels);
+    if (SUCCEEDED(hr)) hr = made->SetUINT32(MF_MT_AUDIO_SAMPLES_PER_SECOND, f.sampleRate);
+    if (SUCCEEDED(hr)) hr = made->SetUINT32(MF_MT_AUDIO_BITS_PER_SAMPLE, 16);
+    if (SUCCEEDED(hr)) hr = made->SetUINT32(MF_MT_AUDIO_BLOCK_ALIGNMENT, block);
+    if (SUCCEEDED(hr)) hr = made->SetUINT32(MF_MT_AUDIO_AVG_BYTES_PER_SECOND, block * f.sampleRate);
+    if (SUCCEEDED(hr)) hr = made->SetUINT32(MF_MT_ALL_SAMPLES_INDEPENDENT, TRUE);
+  }
+  if (FAILED(hr)) {
+    made->Release();
+    return hr;
+  }
+  *type = made;
+  return S_OK;
+}
+
+// A sample holding a copy of bytes, or pixels written by fill(data).
+template <class Fill>
+HRESULT makeSample(DWORD length, LONGLONG time, LONGLONG duration, Fill fill, IMFSample** sample) {
+  IMFMediaBuffer* buffer = nullptr;
+  HRESULT hr = MFCreateMemoryBuffer(length, &buffer);
+  if (FAILED(hr)) return hr;
+  BYTE* data = nullptr;
+  hr = buffer->Lock(&data, nullptr, nullptr);
+  if (SUCCEEDED(hr)) {
+    fill(data);
+    buffer->Unlock();
+    hr = buffer->SetCurrentLength(length);
+  }
+  IMFSample* made = nullptr;
+  if (SUCCEEDED(hr)) hr = MFCreateSample(&made);
+  if (SUCCEEDED(hr)) hr = made->AddBuffer(buffer);
+  if (SUCCEEDED(hr)) hr = made->SetSampleTime(time);
+  if (SUCCEEDED(hr)) hr = made->SetSampleDuration(duration);
+  buffer->Release();
+  if (FAILED(hr)) {
+    if (made) made->Release();
+    return hr;
+  }
+  *sample = made;
+  return S_OK;
+}
+
+struct SinkStream {
+  DWORD source = 0;  // which device stream: video or audio
+  bool video = false;
+  ComPtr<IMFMediaType> type;
+  ComPtr<IMFCaptureEngineOnSampleCallback> callback;
+};
+
+// The record sink's writer and its converters, alive from record start to record stop.
+struct Recording {
+  ~Recording() {
+    sws_freeContext(scaler);
+    swr_free(&resampler);
+  }
+  ComPtr<IMFSinkWriter> writer;
+  DWORD videoStream = 0;
+  DWORD audioStream = 0;
+  bool hasVideo = false;
+  bool hasAudio = false;
+  SwsContext* scaler = nullptr;
+  SwrContext* resampler = nullptr;
+  int audioRate = 0;
+  int audioChannels = 0;
+  int64_t firstVideoPts = AV_NOPTS_VALUE;
+  LONGLONG audioSamples = 0;
+};
+
+enum class Command { StartPreview, StopPreview, StartRecord, StopRecord, Quit };
+
+bool isVideoStream(DWORD index) {
+  return index == MF_CAPTURE_ENGINE_PREFERRED_SOURCE_STREAM_FOR_VIDEO_PREVIEW ||
+         index == MF_CAPTURE_ENGINE_PREFERRED_SOURCE_STREAM_FOR_VIDEO_RECORD;
+}
+
+// Everything the engine, its source, its sinks and its thread share.
+struct EngineState {
+  std::mutex mutex;
+  std::condition_variable changed;
+  std::deque<Command> commands;
+  bool initialized = false;
+  HRESULT initStatus = S_OK;
+  ComPtr<IMFCaptureEngineOnEventCallback> events;
+  std::unique_ptr<Device> video;
+  std::unique_ptr<Device> audio;
+  std::vector<SinkStream> previewStreams;
+  std::vector<SinkStream> recordStreams;
+  std::string recordPath;
+  bool previewing = false;
+  std::unique_ptr<Recording> recording;
+  std::thread::id threadId;
+
+  // The device behind a source stream index, or null.
+  Device* deviceFor(DWORD index) {
+    if (isVideoStream(index)) return video.get();
+    if (index == MF_CAPTURE_ENGINE_PREFERRED_SOURCE_STREAM_FOR_AUDIO) return audio.get();
+    std::vector<Device*> all;
+    if (video) all.push_back(video.get());
+    if (audio) all.push_back(audio.get());
+    return index < all.size() ? all[index] : nullptr;
+  }
+  void waitInitialized(std::unique_lock<std::mutex>& lock) {
+    changed.wait(lock, [this] { return initialized; });
+  }
+};
+
+class EngineThread {
+ public:
+  explicit EngineThread(std::shared_ptr<EngineState> state) : state_(std::move(state)) {}
+  void run();
+
+ private:
+  void send(const GUID& type, HRESULT status);
+  HRESULT openDevices();
+  void closeDevices();
+  HRESULT startRecording();
+  void stopRecording();
+  void fail(HRESULT status);
+  void readOnce(Device& device);
+  void deliverVideo(AVFrame* frame, int64_t pts, AVRational timeBase);
+  void deliverAudio(AVFrame* frame, int64_t pts, AVRational timeBase);
+
+  std::shared_ptr<EngineState> state_;
+  SwsContext* previewScaler_ = nullptr;
+  SwrContext* previewConverter_ = nullptr;
+  AVPacket* packet_ = nullptr;
+  AVFrame* frame_ = nullptr;
+};
+
+void EngineThread::send(const GUID& type, HRESULT status) {
+  ComPtr<IMFCaptureEngineOnEventCallback> callback;
+  {
+    std::lock_guard<std::mutex> lock(state_->mutex);
+    callback = state_->events;
+  }
+  if (!callback) return;
+  auto* event = new MediaEvent(type, status);
+  callback->OnEvent(event);
+  event->Release();
+}
+
+HRESULT EngineThread::openDevices() {
+  for (Device* device : {state_->video.get(), state_->audio.get()}) {
+    if (!device || device->input) continue;
+    HRESULT hr = openInput(*device, device->input);
+    if (FAILED(hr)) return hr;
+  }
+  return S_OK;
+}
+
+void EngineThread::closeDevices() {
+  for (Device* device : {state_->video.get(), state_->audio.get()})
+    if (device) device->input.reset();
+  sws_freeContext(previewScaler_);
+  previewScaler_ = nullptr;
+  swr_free(&previewConverter_);
+}
+
+HRESULT EngineThread::startRecording() {
+  std::vector<SinkStream> streams;
+  std::string path;
+  {
+    std::lock_guard<std::mutex> lock(state_->mutex);
+    streams = state_->recordStreams;
+    path = state_->recordPath;
+  }
+  if (path.empty() || streams.empty()) return MF_E_INVALIDREQUEST;
+  auto recording = std::make_unique<Recording>();
+  const std::wstring url = widen(path);
+  HRESULT hr = MFCreateSinkWriterFromURL(url.c_str(), nullptr, nullptr, &recording->writer.p);
+  for (const SinkStream& stream : streams) {
+    if (FAILED(hr)) break;
+    Device* device = stream.video ? state_->video.get() : state_->audio.get();
+    const DeviceFormat& f = device->current;
+    DWORD index = 0;
+    hr = recording->writer->AddStream(stream.type.p, &index);
+    ComPtr<IMFMediaType> input;
+    if (SUCCEEDED(hr)) hr = MFCreateMediaType(&input.p);
+    if (FAILED(hr)) break;
+    if (stream.video) {
+      // The encoder is given top-down BGRA rows, as the preview gets them.
+      hr = input->SetGUID(MF_MT_MAJOR_TYPE, MFMediaType_Video);
+      if (SUCCEEDED(hr)) hr = input->SetGUID(MF_MT_SUBTYPE, MFVideoFormat_RGB32);
+      if (SUCCEEDED(hr)) hr = MFSetAttributeSize(input.p, MF_MT_FRAME_SIZE, f.width, f.height);
+      if (SUCCEEDED(hr)) hr = MFSetAttributeRatio(input.p, MF_MT_FRAME_RATE, f.rate.num, f.rate.den);
+      if (SUCCEEDED(hr)) hr = input->SetUINT32(MF_MT_DEFAULT_STRIDE, static_cast<UINT32>(f.width * 4));
+      if (SUCCEEDED(hr)) hr = input->SetUINT32(MF_MT_INTERLACE_MODE, MFVideoInterlace_Progressive);
+      recording->videoStream = index;
+      recording->hasVideo = true;
+    } else {
+      UINT32 rate = 0, channels = 0;
+      stream.type->GetUINT32(MF_MT_AUDIO_SAMPLES_PER_SECOND, &rate);
+      stream.type->GetUINT32(MF_MT_AUDIO_NUM_CHANNELS, &channels);
+      if (!rate) rate = f.sampleRate;
+      if (!channels) channels = f.channels;
+      recording->audioRate = static_cast<int>(rate);
+      recording->audioChannels = static_cast<int>(channels);
+      hr = input->SetGUID(MF_MT_MAJOR_TYPE, MFMediaType_Audio);
+      if (SUCCEEDED(hr)) hr = input->SetGUID(MF_MT_SUBTYPE, MFAudioFormat_PCM);
+      if (SUCCEEDED(hr)) hr = input->SetUINT32(MF_MT_AUDIO_NUM_CHANNELS, channels);
+      if (SUCCEEDED(hr)) hr = input->SetUINT32(MF_MT_AUDIO_SAMPLES_PER_SECOND, rate);
+      if (SUCCEEDED(hr)) hr = input->SetUINT32(MF_MT_AUDIO_BITS_PER_SAMPLE, 16);
+      if (SUCCEEDED(hr)) hr = input->SetUINT32(MF_MT_AUDIO_BLOCK_ALIGNMENT, 2 * channels);
+      if (SUCCEEDED(hr)) hr = input->SetUINT32(MF_MT_AUDIO_AVG_BYTES_PER_SECOND, 2 * channels * rate);
+      recording->audioStream = index;
+      recording->hasAudio = true;
+    }
+    if (SUCCEEDED(hr)) hr = recording->writer->SetInputMediaType(index, input.p, nullptr);
+  }
+  if (SUCCEEDED(hr)) hr = recording->writer->BeginWriting();
+  if (FAILED(hr)) return hr;
+  state_->recording = std::move(recording);
+  return S_OK;
+}
+
+void EngineThread::stopRecording() {
+  if (!state_->recording) return;
+  state_->recording->writer->Finalize();
+  state_->recording.reset();
+}
+
+// A device that stops answering ends preview and recording, as a vanished camera does.
+void EngineThread::fail(HRESULT status) {
+  stopRecording();
+  {
+    std::lock_guard<std::mutex> lock(state_->mutex);
+    state_->previewing = false;
+  }
+  closeDevices();
+  send(MF_CAPTURE_ENGINE_ERROR, status);
+}
+
+void EngineThread::deliverVideo(AVFrame* frame, int64_t pts, AVRational timeBase) {
+  const int width = frame->width;
+  const int height = frame->height;
+  const DWORD length = static_cast<DWORD>(width * height * 4);
+  previewScaler_ = sws_getCachedContext(previewScaler_, width, height, static_cast<AVPixelFormat>(frame->format), width,
+                                        height, AV_PIX_FMT_BGRA, SWS_POINT, nullptr, nullptr, nullptr);
+  if (!previewScaler_) return;
+  Recording* recording = state_->recording.get();
+  const AVRational rate = state_->video->current.rate;
+  const LONGLONG duration = av_rescale(ticksPerSecond, rate.den, rate.num);
+  LONGLONG time = av_rescale_q(pts, timeBase, AVRational{1, static_cast<int>(ticksPerSecond)});
+  if (recording && recording->hasVideo) {
+    if (recording->firstVideoPts == AV_NOPTS_VALUE) recording->firstVideoPts = time;
+    time -= recording->firstVideoPts;
+  }
+
+  ComPtr<IMFSample> sample;
+  HRESULT hr = makeSample(length, time, duration, [&](BYTE* data) {
+    uint8_t* planes[1] = {data};
+    int strides[1] = {width * 4};
+    sws_scale(previewScaler_, frame->data, frame->linesize, 0, height, planes, strides);
+  }, &sample.p);
+  if (FAILED(hr)) return;
+
+  std::vector<ComPtr<IMFCaptureEngineOnSampleCallback>> callbacks;
+  bool previewing;
+  {
+    std::lock_guard<std::mutex> lock(state_->mutex);
+    previewing = state_->previewing;
+    for (const SinkStream& stream : state_->previewStreams)
+      if (stream.video && stream.callback) callbacks.push_back(stream.callback);
+  }
+  if (previewing)
+    for (auto& callback : callbacks) callback->OnSample(sample.p);
+  if (recording && recording->hasVideo) recording->writer->WriteSample(recording->videoStream, sample.p);
+}
+
+void EngineThread::deliverAudio(AVFrame* frame, int64_t pts, AVRational timeBase) {
+  const DeviceFormat& f = state_->audio->current;
+  const int channels = frame->ch_layout.nb_channels;
+  Recording* recording = state_->recording.get();
+  const bool interleaved16 = frame->format == AV_SAMPLE_FMT_S16;
+  const DWORD length = static_cast<DWORD>(frame->nb_samples * channels * 2);
+  const LONGLONG duration = av_rescale(frame->nb_samples, ticksPerSecond, f.sampleRate);
+
+  if (interleaved16) {
+    std::vector<ComPtr<IMFCaptureEngineOnSampleCallback>> callbacks;
+    bool previewing;
+    {
+      std::lock_guard<std::mutex> lock(state_->mutex);
+      previewing = state_->previewing;
+      for (const SinkStream& stream : state_->previewStreams)
+        if (!stream.video && stream.callback) callbacks.push_back(stream.callback);
+    }
+    if (previewing && !callbacks.empty()) {
+      ComPtr<IMFSample> sample;
+      if (SUCCEEDED(makeSample(length, av_rescale_q(pts, timeBase, AVRational{1, static_cast<int>(ticksPerSecond)}), duration,
+                               [&](BYTE* data) { std::memcpy(data, frame->data[0], length); }, &sample.p)))
+        for (auto& callback : callbacks) callback->OnSample(sample.p);
+    }
+  }
+
+  if (recording && recording->hasAudio) {
+    if (!recording->resampler) {
+      AVChannelLayout out;
+      av_channel_layout_default(&out, recording->audioChannels);
+      swr_alloc_set_opts2(&recording->resampler, &out, AV_SAMPLE_FMT_S16, recording->audioRate, &frame->ch_layout,
+                          static_cast<AVSampleFormat>(frame->format), frame->sample_rate, 0, nullptr);
+      av_channel_layout_uninit(&out);
+      if (!recording->resampler || swr_init(recording->resampler) < 0) return;
+    }
+    const int room = swr_get_out_samples(recording->resampler, frame->nb_samples);
+    std::vector<uint8_t> converted(static_cast<size_t>(room) * recording->audioChannels * 2);
+    uint8_t* out[1] = {converted.data()};
+    const int made = swr_convert(recording->resampler, out, room, const_cast<const uint8_t**>(frame->extended_data),
+                                 frame->nb_samples);
+    if (made <= 0) return;
+    const DWORD bytes = static_cast<DWORD>(made * recording->audioChannels * 2);
+    const LONGLONG time = av_rescale(recording->audioSamples, ticksPerSecond, recording->audioRate);
+    const LONGLONG span = av_rescale(made, ticksPerSecond, recording->audioRate);
+    recording->audioSamples += made;
+    ComPtr<IMFSample> sample;
+    if (SUCCEEDED(makeSample(bytes, time, span, [&](BYTE* data) { std::memcpy(data, converted.data(), bytes); },
+                             &sample.p)))
+      recording->writer->WriteSample(recording->audioStream, sample.p);
+  }
+}
+
+void EngineThread::readOnce(Device& device) {
+  Input& input = *device.input;
+  int error = av_read_frame(input.format, packet_);
+  if (error == AVERROR(EAGAIN)) return;
+  if (error < 0) {
+    fail(device.video ? MF_E_VIDEO_RECORDING_DEVICE_INVALIDATED : MF_E_AUDIO_RECORDING_DEVICE_INVALIDATED);
+    return;
+  }
+  if (packet_->stream_index == input.stream && avcodec_send_packet(input.decoder, packet_) >= 0) {
+    const AVRational timeBase = input.format->streams[input.stream]->time_base;
+    while (avcodec_receive_frame(input.decoder, frame_) >= 0) {
+      const int64_t pts = frame_->best_effort_timestamp != AV_NOPTS_VALUE ? frame_->best_effort_timestamp : frame_->pts;
+      if (device.video)
+        deliverVideo(frame_, pts, timeBase);
+      else
+        deliverAudio(frame_, pts, timeBase);
+      av_frame_unref(frame_);
+    }
+  }
+  av_packet_unref(packet_);
+}
+
+void EngineThread::run() {
+  packet_ = av_packet_alloc();
+  frame_ = av_frame_alloc();
+
+  // Initialisation: learn each device's current format, then let the device go until needed.
+  HRESULT status = S_OK;
+  for (Device* device : {state_->video.get(), state_->audio.get()}) {
+    if (!device) continue;
+    HRESULT hr = openInput(*device, device->input);
+    device->input.reset();
+    if (FAILED(hr) && SUCCEEDED(status)) status = hr;
+  }
+  if (!state_->video && !state_->audio) status = MF_E_NO_CAPTURE_DEVICES_AVAILABLE;
+  {
+    std::lock_guard<std::mutex> lock(state_->mutex);
+    state_->initialized = true;
+    state_->initStatus = status;
+  }
+  state_->changed.notify_all();
+  send(MF_CAPTURE_ENGINE_INITIALIZED, status);
+
+  for (;;) {
+    std::vector<Command> commands;
+    bool active;
+    {
+      std::unique_lock<std::mutex> lock(state_->mutex);
+      if (!state_->previewing && !state_->recording)
+        state_->changed.wait(lock, [this] { return !state_->commands.empty(); });
+      commands.assign(state_->commands.begin(), state_->commands.end());
+      state_->commands.clear();
+    }
+    bool quit = false;
+    for (Command command : commands) {
+      switch (command) {
+        case Command::StartPreview: {
+          HRESULT hr = SUCCEEDED(state_->initStatus) ? openDevices() : state_->initStatus;
+          {
+            std::lock_guard<std::mutex> lock(state_->mutex);
+            state_->previewing = SUCCEEDED(hr);
+          }
+          send(MF_CAPTURE_ENGINE_PREVIEW_STARTED, hr);
+          break;
+        }
+        case Command::StopPreview: {
+          {
+            std::lock_guard<std::mutex> lock(state_->mutex);
+            state_->previewing = false;
+          }
+          send(MF_CAPTURE_ENGINE_PREVIEW_STOPPED, S_OK);
+          break;
+        }
+        case Command::StartRecord: {
+          HRESULT hr = SUCCEEDED(state_->initStatus) ? openDevices() : state_->initStatus;
+          if (SUCCEEDED(hr) && !state_->recording) hr = startRecording();
+          send(MF_CAPTURE_ENGINE_RECORD_STARTED, hr);
+          break;
+        }
+        case Command::StopRecord:
+          stopRecording();
+          send(MF_CAPTURE_ENGINE_RECORD_STOPPED, S_OK);
+          break;
+        case Command::Quit:
+          quit = true;
+          break;
+      }
+    }
+    if (quit) break;
+    {
+      std::lock_guard<std::mutex> lock(state_->mutex);
+      active = state_->previewing || state_->recording;
+    }
+    if (!active) {
+      closeDevices();
+      continue;
+    }
+    for (Device* device : {state_->video.get(), state_->audio.get()})
+      if (device && device->input) readOnce(*device);
+  }
+  stopRecording();
+  closeDevices();
+  av_packet_free(&packet_);
+  av_frame_free(&frame_);
+}
+
+class CaptureSource : public ComObject<IMFCaptureSource, IID_IMFCaptureSource> {
+ public:
+  explicit CaptureSource(std::shared_ptr<EngineState> state) : state_(std::move(state)) {}
+  HRESULT GetCaptureDeviceSource(MF_CAPTURE_ENGINE_DEVICE_TYPE, IMFMediaSource** source) override {
+    if (source) *source = nullptr;
+    return E_NOTIMPL;
+  }
+  HRESULT GetCaptureDeviceActivate(MF_CAPTURE_ENGINE_DEVICE_TYPE, IMFActivate** activate) override {
+    if (activate) *activate = nullptr;
+    return E_NOTIMPL;
+  }
+  HRESULT GetService(REFIID, REFIID, IUnknown** object) override {
+    if (object) *object = nullptr;
+    return MF_E_UNSUPPORTED_SERVICE;
+  }
+  HRESULT AddEffect(DWORD, IUnknown*) override { return E_NOTIMPL; }
+  HRESULT RemoveEffect(DWORD, IUnknown*) override { return E_NOTIMPL; }
+  HRESULT RemoveAllEffects(DWORD) override { return S_OK; }
+  HRESULT GetAvailableDeviceMediaType(DWORD stream, DWORD index, IMFMediaType** type) override {
+    if (index != 0) return MF_E_NO_MORE_TYPES;  // the device is used as it is set up
+    return GetCurrentDeviceMediaType(stream, type);
+  }
+  HRESULT SetCurrentDeviceMediaType(DWORD, IMFMediaType*) override { return E_NOTIMPL; }
+  HRESULT GetCurrentDeviceMediaType(DWORD stream, IMFMediaType** type) override {
+    if (!type) return E_POINTER;
+    *type = nullptr;
+    std::unique_lock<std::mutex> lock(state_->mutex);
+    state_->waitInitialized(lock);
+    if (FAILED(state_->initStatus)) return state_->initStatus;
+    Device* device = state_->deviceFor(stream);
+    if (!device) return MF_E_INVALIDSTREAMNUMBER;
+    return makeDeviceType(*device, type);
+  }
+  HRESULT GetDeviceStreamCount(DWORD* count) override {
+    if (!count) return E_POINTER;
+    *count = (state_->video ? 1 : 0) + (state_->audio ? 1 : 0);
+    return S_OK;
+  }
+  HRESULT GetDeviceStreamCategory(DWORD stream, MF_CAPTURE_ENGINE_STREAM_CATEGORY* category) override {
+    if (!category) return E_POINTER;
+    Device* device = state_->deviceFor(stream);
+    if (!device) return MF_E_INVALIDSTREAMNUMBER;
+    *category = device->video ? MF_CAPTURE_ENGINE_STREAM_CATEGORY_VIDEO_CAPTURE : MF_CAPTURE_ENGINE_STREAM_CATEGORY_AUDIO;
+    return S_OK;
+  }
+  HRESULT GetMirrorState(DWORD, BOOL* mirrored) override {
+    if (!mirrored) return E_POINTER;
+    *mirrored = FALSE;
+    return S_OK;
+  }
+  HRESULT SetMirrorState(DWORD, BOOL) override { return E_NOTIMPL; }
+  HRESULT GetStreamIndexFromFriendlyName(UINT32 name, DWORD* stream) override {
+    if (!stream) return E_POINTER;
+    *stream = name;
+    return state_->deviceFor(name) ? S_OK : MF_E_INVALIDSTREAMNUMBER;
+  }
+
+ private:
+  std::shared_ptr<EngineState> state_;
+};
+
+// Adds a stream to one of the two sinks' stream lists.
+HRESULT addSinkStream(EngineState& state, std::vector<SinkStream>& streams, DWORD source, IMFMediaType* type,
+                      DWORD* index) {
+  if (!type) return E_INVALIDARG;
+  std::unique_lock<std::mutex> lock(state.mutex);
+  state.waitInitialized(lock);
+  Device* device = state.deviceFor(source);
+  if (!device) return MF_E_INVALIDSTREAMNUMBER;
+  GUID major = GUID_NULL;
+  type->GetGUID(MF_MT_MAJOR_TYPE, &major);
+  if (major != (device->video ? MFMediaType_Video : MFMediaType_Audio)) return MF_E_INVALIDMEDIATYPE;
+  SinkStream stream;
+  stream.source = source;
+  stream.video = device->video;
+  stream.type = ComPtr<IMFMediaType>(type, true);
+  streams.push_back(stream);
+  if (index) *index = static_cast<DWORD>(streams.size() - 1);
+  return S_OK;
+}
+
+class PreviewSink : public ComObject<IMFCapturePreviewSink, IID_IMFCaptureSink, IID_IMFCapturePreviewSink> {
+ public:
+  explicit PreviewSink(std::shared_ptr<EngineState> state) : state_(std::move(state)) {}
+  HRESULT GetOutputMediaType(DWORD index, IMFMediaType** type) override {
+    if (!type) return E_POINTER;
+    std::lock_guard<std::mutex> lock(state_->mutex);
+    if (index >= state_->previewStreams.size()) return MF_E_INVALIDSTREAMNUMBER;
+    *type = state_->previewStreams[index].type.p;
+    (*type)->AddRef();
+    return S_OK;
+  }
+  HRESULT GetService(DWORD, REFGUID, REFIID, IUnknown** object) override {
+    if (object) *object = nullptr;
+    return MF_E_UNSUPPORTED_SERVICE;
+  }
+  HRESULT AddStream(DWORD source, IMFMediaType* type, IMFAttributes*, DWORD* index) override {
+    if (type) {
+      GUID subtype = GUID_NULL;
+      type->GetGUID(MF_MT_SUBTYPE, &subtype);
+      // Pictures come as 32-bit BGRA, sound as 16-bit PCM: those are what the engine converts to.
+      if (subtype != MFVideoFormat_ARGB32 && subtype != MFVideoFormat_RGB32 && subtype != MFAudioFormat_PCM)
+        return MF_E_INVALIDMEDIATYPE;
+    }
+    return addSinkStream(*state_, state_->previewStreams, source, type, index);
+  }
+  HRESULT Prepare() override { return S_OK; }
+  HRESULT RemoveAllStreams() override {
+    std::lock_guard<std::mutex> lock(state_->mutex);
+    state_->previewStreams.clear();
+    return S_OK;
+  }
+  HRESULT SetRenderHandle(HANDLE) override { return E_NOTIMPL; }
+  HRESULT SetRenderSurface(IUnknown*) override { return E_NOTIMPL; }
+  HRESULT UpdateVideo(const MFVideoNormalizedRect*, const RECT*, const COLORREF*) override { return E_NOTIMPL; }
+  HRESULT SetSampleCallback(DWORD index, IMFCaptureEngineOnSampleCallback* callback) override {
+    std::lock_guard<std::mutex> lock(state_->mutex);
+    if (index >= state_->previewStreams.size()) return MF_E_INVALIDSTREAMNUMBER;
+    state_->previewStreams[index].callback = ComPtr<IMFCaptureEngineOnSampleCallback>(callback, true);
+    return S_OK;
+  }
+  HRESULT GetMirrorState(BOOL* mirrored) override {
+    if (!mirrored) return E_POINTER;
+    *mirrored = FALSE;
+    return S_OK;
+  }
+  HRESULT SetMirrorState(BOOL) override { return E_NOTIMPL; }
+  HRESULT GetRotation(DWORD, DWORD* rotation) override {
+    if (!rotation) return E_POINTER;
+    *rotation = 0;
+    return S_OK;
+  }
+  HRESULT SetRotation(DWORD, DWORD) override { return E_NOTIMPL; }
+  HRESULT SetCustomSink(IMFMediaSink*) override { return E_NOTIMPL; }
+
+ private:
+  std::shared_ptr<EngineState> state_;
+};
+
+class RecordSink : public ComObject<IMFCaptureRecordSink, IID_IMFCaptureSink, IID_IMFCaptureRecordSink> {
+ public:
+  explicit RecordSink(std::shared_ptr<EngineState> state) : state_(std::move(state)) {}
+  HRESULT GetOutputMediaType(DWORD index, IMFMediaType** type) override {
+    if (!type) return E_POINTER;
+    std::lock_guard<std::mutex> lock(state_->mutex);
+    if (index >= state_->recordStreams.size()) return MF_E_INVALIDSTREAMNUMBER;
+    *type = state_->recordStreams[index].type.p;
+    (*type)->AddRef();
+    return S_OK;
+  }
+  HRESULT GetService(DWORD, REFGUID, REFIID, IUnknown** object) override {
+    if (object) *object = nullptr;
+    return MF_E_UNSUPPORTED_SERVICE;
+  }
+  HRESULT AddStream(DWORD source, IMFMediaType* type, IMFAttributes*, DWORD* index) override {
+    return addSinkStream(*state_, state_->recordStreams, source, type, index);
+  }
+  HRESULT Prepare() override { return S_OK; }
+  HRESULT RemoveAllStreams() override {
+    std::lock_guard<std::mutex> lock(state_->mutex);
+    if (state_->recording) return MF_E_INVALIDREQUEST;
+    state_->recordStreams.clear();
+    return S_OK;
+  }
+  HRESULT SetOutputByteStream(IMFByteStream*, REFGUID) override { return E_NOTIMPL; }
+  HRESULT SetOutputFileName(LPCWSTR name) override {
+    if (!name) return E_POINTER;
+    std::lock_guard<std::mutex> lock(state_->mutex);
+    state_->recordPath = narrow(name);
+    return S_OK;
+  }
+  HRESULT SetSampleCallback(DWORD, IMFCaptureEngineOnSampleCallback*) override { return E_NOTIMPL; }
+  HRESULT SetCustomSink(IMFMediaSink*) override { return E_NOTIMPL; }
+  HRESULT GetRotation(DWORD, DWORD* rotation) override {
+    if (!rotation) return E_POINTER;
+    *rotation = 0;
+    return S_OK;
+  }
+  HRESULT SetRotation(DWORD, DWORD) override { return E_NOTIMPL; }
+
+ private:
+  std::shared_ptr<EngineState> state_;
+};
+
+// A device object's link: "v4l2:<path>", "lavfi:<graph>" for cameras; a PulseAudio source name.
+std::unique_ptr<Device> deviceFrom(IUnknown* object, bool video) {
+  ComPtr<IMFAttributes> attributes;
+  if (!object || FAILED(object->QueryInterface(IID_IMFAttributes, reinterpret_cast<void**>(&attributes.p))))
+    return nullptr;
+  wchar_t* link = nullptr;
+  UINT32 length = 0;
+  const GUID& key = video ? MF_DEVSOURCE_ATTRIBUTE_SOURCE_TYPE_VIDCAP_SYMBOLIC_LINK
+                          : MF_DEVSOURCE_ATTRIBUTE_SOURCE_TYPE_AUDCAP_ENDPOINT_ID;
+  if (FAILED(attributes->GetAllocatedString(key, &link, &length))) return nullptr;
+  const std::string text = narrow(link);
+  CoTaskMemFree(link);
+  auto device = std::make_unique<Device>();
+  device->video = video;
+  if (video) {
+    const size_t colon = text.find(':');
+    if (colon == std::string::npos) return nullptr;
+    device->formatName = text.substr(0, colon);
+    device->url = text.substr(colon + 1);
+  } else {
+    device->formatName = "pulse";
+    device->url = text;
+    UINT32 value = 0;
+    if (SUCCEEDED(attributes->GetUINT32(deviceAudioRate, &value)) && value) device->rate = static_cast<int>(value);
+    if (SUCCEEDED(attributes->GetUINT32(deviceAudioChannels, &value)) && value)
+      device->channels = static_cast<int>(value);
+  }
+  return device;
+}
+
+class CaptureEngine : public ComObject<IMFCaptureEngine, IID_IMFCaptureEngine> {
+ public:
+  CaptureEngine() : state_(std::make_shared<EngineState>()) {}
+  ~CaptureEngine() override {
+    if (!thread_.joinable()) return;
+    {
+      std::lock_guard<std::mutex> lock(state_->mutex);
+      state_->commands.push_back(Command::Quit);
+    }
+    state_->changed.notify_all();
+    // Released from inside one of its own callbacks (an error event), the thread finishes alone.
+    if (thread_.get_id() == std::this_thread::get_id())
+      thread_.detach();
+    else
+      thread_.join();
+  }
+
+  HRESULT Initialize(IMFCaptureEngineOnEventCallback* callback, IMFAttributes* attributes, IUnknown* audio,
+                     IUnknown* video) override {
+    if (!callback) return E_POINTER;
+    if (thread_.joinable()) return MF_E_INVALIDREQUEST;
+    UINT32 only = 0;
+    const bool videoOnly = attributes && SUCCEEDED(attributes->GetUINT32(MF_CAPTURE_ENGINE_USE_VIDEO_DEVICE_ONLY, &only)) && only;
+    only = 0;
+    const bool audioOnly = attributes && SUCCEEDED(attributes->GetUINT32(MF_CAPTURE_ENGINE_USE_AUDIO_DEVICE_ONLY, &only)) && only;
+    if (video && !audioOnly) {
+      state_->video = deviceFrom(video, true);
+      if (!state_->video) return E_INVALIDARG;
+    }
+    if (audio && !videoOnly) {
+      state_->audio = deviceFrom(audio, false);
+      if (!state_->audio) return E_INVALIDARG;
+    }
+    state_->events = ComPtr<IMFCaptureEngineOnEventCallback>(callback, true);
+    avdevice_register_all();
+    auto state = state_;
+    thread_ = std::thread([state] { EngineThread(state).run(); });
+    return S_OK;
+  }
+  HRESULT StartPreview() override { return queue(Command::StartPreview); }
+  HRESULT StopPreview() override { return queue(Command::StopPreview); }
+  HRESULT StartRecord() override { return queue(Command::StartRecord); }
+  HRESULT StopRecord(BOOL, BOOL) override { return queue(Command::StopRecord); }
+  HRESULT TakePhoto() override { return E_NOTIMPL; }
+  HRESULT GetSink(MF_CAPTURE_ENGINE_SINK_TYPE type, IMFCaptureSink** sink) override {
+    if (!sink) return E_POINTER;
+    *sink = nullptr;
+    if (!thread_.joinable()) return MF_E_NOT_INITIALIZED;
+    if (type == MF_CAPTURE_ENGINE_SINK_TYPE_PREVIEW) {
+      if (!preview_) preview_ = ComPtr<IMFCapturePreviewSink>(new PreviewSink(state_), false);
+      *sink = preview_.p;
+    } else if (type == MF_CAPTURE_ENGINE_SINK_TYPE_RECORD) {
+      if (!record_) record_ = ComPtr<IMFCaptureRecordSink>(new RecordSink(state_), false);
+      *sink = record_.p;
+    } else {
+      return E_NOTIMPL;
+    }
+    (*sink)->AddRef();
+    return S_OK;
+  }
+  HRESULT GetSource(IMFCaptureSource** source) override {
+    if (!source) return E_POINTER;
+    *source = nullptr;
+    if (!thread_.joinable()) return MF_E_NOT_INITIALIZED;
+    *source = new CaptureSource(state_);
+    return S_OK;
+  }
+
+ private:
+  HRESULT queue(Command command) {
+    if (!thread_.joinable()) return MF_E_NOT_INITIALIZED;
+    {
+      std::lock_guard<std::mutex> lock(state_->mutex);
+      state_->commands.push_back(command);
+    }
+    state_->changed.notify_all();
+    return S_OK;
+  }
+
+  std::shared_ptr<EngineState> state_;
+  std::thread thread_;
+  ComPtr<IMFCapturePreviewSink> preview_;
+  ComPtr<IMFCaptureRecordSink> record_;
+};
+
+class CaptureEngineClassFactory : public ComObject<IMFCaptureEngineClassFactory, IID_IMFCaptureEngineClassFactory> {
+ public:
+  HRESULT CreateInstance(REFCLSID clsid, REFIID riid, LPVOID* object) override {
+    if (!object) return E_POINTER;
+    *object = nullptr;
+    if (clsid != CLSID_MFCaptureEngine) return classNotAvailable;
+    auto* engine = new CaptureEngine;
+    HRESULT hr = engine->QueryInterface(riid, object);
+    engine->Release();
+    return hr;
+  }
+};
+
+}  // namespace
+
+HRESULT createCaptureEngineClassFactory(REFIID riid, void** object) {
+  if (!object) return E_POINTER;
+  auto* factory = new CaptureEngineClassFactory;
+  HRESULT hr = factory->QueryInterface(riid, object);
+  factory->Release();
+  return hr;
+}
+
+}  // namespace platform

@@ -1,0 +1,179 @@
+// Capture-device enumeration: V4L2 video capture devices by card name, then the lavfi test
+// cameras of TAVIO_TEST_CAMERAS; PulseAudio sources that are not monitors by description.
+#include <dirent.h>
+#include <fcntl.h>
+#include <linux/videodev2.h>
+#include <pulse/pulseaudio.h>
+#include <sys/ioctl.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <cstdlib>
+#include <cstring>
+#include <string>
+#include <vector>
+
+#include "platform/linux/mfattributes.h"
+#include "platform/linux/mfcapture.h"
+
+namespace platform {
+
+namespace {
+
+class DeviceActivate : public Attributes<IMFActivate, IID_IMFActivate> {
+ public:
+  // The engine opens the device itself from the link attribute; there is no media source object.
+  HRESULT ActivateObject(REFIID, void** object) override {
+    if (object) *object = nullptr;
+    return E_NOTIMPL;
+  }
+  HRESULT ShutdownObject() override { return S_OK; }
+  HRESULT DetachObject() override { return S_OK; }
+};
+
+struct Device {
+  std::wstring name;
+  std::wstring link;
+  UINT32 rate = 0;
+  UINT32 channels = 0;
+};
+
+std::vector<Device> videoDevices() {
+  std::vector<Device> devices;
+  std::vector<int> numbers;
+  if (DIR* dir = opendir("/dev")) {
+    while (dirent* entry = readdir(dir)) {
+      if (std::strncmp(entry->d_name, "video", 5) == 0 && entry->d_name[5] >= '0' && entry->d_name[5] <= '9')
+        numbers.push_back(std::atoi(entry->d_name + 5));
+    }
+    closedir(dir);
+  }
+  std::sort(numbers.begin(), numbers.end());
+  for (int number : numbers) {
+    const std::string path = "/dev/video" + std::to_string(number);
+    int fd = open(path.c_str(), O_RDWR | O_NONBLOCK);
+    if (fd < 0) continue;
+    v4l2_capability caps{};
+    if (ioctl(fd, VIDIOC_QUERYCAP, &caps) == 0) {
+      // A camera often has a second node for metadata; only capture nodes are cameras.
+      const uint32_t nodeCaps = (caps.capabilities & V4L2_CAP_DEVICE_CAPS) ? caps.device_caps : caps.capabilities;
+      if (nodeCaps & V4L2_CAP_VIDEO_CAPTURE)
+        devices.push_back({widen(reinterpret_cast<const char*>(caps.card)), widen("v4l2:" + path)});
+    }
+    close(fd);
+  }
+  // Test cameras: "Name=lavfi graph" entries separated by ';'.
+  if (const char* list = std::getenv("TAVIO_TEST_CAMERAS")) {
+    std::string text = list;
+    size_t start = 0;
+    while (start <= text.size()) {
+      size_t end = text.find(';', start);
+      if (end == std::string::npos) end = text.size();
+      const std::string entry = text.substr(start, end - start);
+      const size_t equals = entry.find('=');
+      if (equals != std::string::npos && equals > 0 && equals + 1 < entry.size())
+        devices.push_back({widen(entry.substr(0, equals)), widen("lavfi:" + entry.substr(equals + 1))});
+      start = end + 1;
+    }
+  }
+  return devices;
+}
+
+struct SourceList {
+  std::vector<Device> devices;
+  bool done = false;
+};
+
+void onSource(pa_context*, const pa_source_info* info, int eol, void* userdata) {
+  auto* list = static_cast<SourceList*>(userdata);
+  if (eol != 0 || !info) {
+    list->done = true;
+    return;
+  }
+  if (info->monitor_of_sink != PA_INVALID_INDEX) return;  // what a sink plays is no microphone
+  list->devices.push_back({widen(info->description ? info->description : info->name), widen(info->name),
+                           info->sample_spec.rate, info->sample_spec.channels});
+}
+
+// Sources of the PulseAudio server; none when no server answers (no autospawn).
+std::vector<Device> audioDevices() {
+  SourceList list;
+  pa_mainloop* loop = pa_mainloop_new();
+  if (!loop) return {};
+  pa_context* context = pa_context_new(pa_mainloop_get_api(loop), "tavio_capture devices");
+  if (context && pa_context_connect(context, nullptr, PA_CONTEXT_NOAUTOSPAWN, nullptr) >= 0) {
+    pa_context_state_t state;
+    while ((state = pa_context_get_state(context)) != PA_CONTEXT_READY && PA_CONTEXT_IS_GOOD(state))
+      if (pa_mainloop_iterate(loop, 1, nullptr) < 0) break;
+    if (pa_context_get_state(context) == PA_CONTEXT_READY) {
+      if (pa_operation* operation = pa_context_get_source_info_list(context, onSource, &list)) {
+        while (!list.done && pa_operation_get_state(operation) == PA_OPERATION_RUNNING)
+          if (pa_mainloop_iterate(loop, 1, nullptr) < 0) break;
+        pa_operation_unref(operation);
+      }
+    }
+    pa_context_disconnect(context);
+  }
+  if (context) pa_context_unref(context);
+  pa_mainloop_free(loop);
+  return list.devices;
+}
+
+}  // namespace
+
+HRESULT createDeviceActivate(REFGUID category, const std::wstring& friendlyName, const std::wstring& link,
+                             IMFActivate** activate) {
+  if (!activate) return E_POINTER;
+  auto* device = new DeviceActivate;
+  HRESULT hr = device->SetGUID(MF_DEVSOURCE_ATTRIBUTE_SOURCE_TYPE, category);
+  if (SUCCEEDED(hr)) hr = device->SetString(MF_DEVSOURCE_ATTRIBUTE_FRIENDLY_NAME, friendlyName.c_str());
+  if (SUCCEEDED(hr))
+    hr = device->SetString(category == MF_DEVSOURCE_ATTRIBUTE_SOURCE_TYPE_AUDCAP_GUID
+                               ? MF_DEVSOURCE_ATTRIBUTE_SOURCE_TYPE_AUDCAP_ENDPOINT_ID
+                               : MF_DEVSOURCE_ATTRIBUTE_SOURCE_TYPE_VIDCAP_SYMBOLIC_LINK,
+                           link.c_str());
+  if (FAILED(hr)) {
+    device->Release();
+    *activate = nullptr;
+    return hr;
+  }
+  *activate = device;
+  return S_OK;
+}
+
+}  // namespace platform
+
+HRESULT MFEnumDeviceSources(IMFAttributes* attributes, IMFActivate*** devices, UINT32* count) {
+  if (!attributes || !devices || !count) return E_POINTER;
+  *devices = nullptr;
+  *count = 0;
+  GUID category = GUID_NULL;
+  if (FAILED(attributes->GetGUID(MF_DEVSOURCE_ATTRIBUTE_SOURCE_TYPE, &category))) return E_INVALIDARG;
+  std::vector<platform::Device> found;
+  if (category == MF_DEVSOURCE_ATTRIBUTE_SOURCE_TYPE_VIDCAP_GUID)
+    found = platform::videoDevices();
+  else if (category == MF_DEVSOURCE_ATTRIBUTE_SOURCE_TYPE_AUDCAP_GUID)
+    found = platform::audioDevices();
+  else
+    return E_INVALIDARG;
+
+  auto** array = static_cast<IMFActivate**>(CoTaskMemAlloc(sizeof(IMFActivate*) * (found.empty() ? 1 : found.size())));
+  if (!array) return E_OUTOFMEMORY;
+  UINT32 made = 0;
+  for (const platform::Device& device : found) {
+    IMFActivate* activate = nullptr;
+    HRESULT hr = platform::createDeviceActivate(category, device.name, device.link, &activate);
+    if (SUCCEEDED(hr) && device.rate) hr = activate->SetUINT32(platform::deviceAudioRate, device.rate);
+    if (SUCCEEDED(hr) && device.channels) hr = activate->SetUINT32(platform::deviceAudioChannels, device.channels);
+    if (FAILED(hr)) {
+      if (activate) activate->Release();
+      for (UINT32 i = 0; i < made; ++i) array[i]->Release();
+      CoTaskMemFree(array);
+      return hr;
+    }
+    array[made++] = activate;
+  }
+  *devices = array;
+  *count = made;
+  return S_OK;
+}

@@ -1,0 +1,57 @@
+// The DXGI device manager of the capture engine: it only lends the device it was given.
+#include "platform/linux/mfcapture.h"
+
+namespace platform {
+
+namespace {
+
+class DXGIDeviceManager : public ComObject<IMFDXGIDeviceManager, IID_IMFDXGIDeviceManager> {
+ public:
+  // Any token works as long as ResetDevice gets the same one back.
+  DXGIDeviceManager() : token_(static_cast<UINT>(reinterpret_cast<uintptr_t>(this) >> 4)) {}
+  UINT token() const { return token_; }
+  ~DXGIDeviceManager() override { release(device_); }
+
+  HRESULT CloseDeviceHandle(HANDLE) override { return S_OK; }
+  HRESULT GetVideoService(HANDLE, REFIID, void** service) override {
+    if (service) *service = nullptr;
+    return E_NOINTERFACE;
+  }
+  HRESULT LockDevice(HANDLE, REFIID riid, void** object, BOOL) override {
+    if (!object) return E_POINTER;
+    *object = nullptr;
+    if (!device_) return MF_E_NOT_INITIALIZED;
+    return device_->QueryInterface(riid, object);
+  }
+  HRESULT OpenDeviceHandle(HANDLE* handle) override {
+    if (!handle) return E_POINTER;
+    *handle = device_;
+    return device_ ? S_OK : MF_E_NOT_INITIALIZED;
+  }
+  HRESULT ResetDevice(IUnknown* device, UINT token) override {
+    if (!device) return E_INVALIDARG;
+    if (token != token_) return E_INVALIDARG;
+    device->AddRef();
+    release(device_);
+    device_ = device;
+    return S_OK;
+  }
+  HRESULT TestDevice(HANDLE) override { return device_ ? S_OK : MF_E_NOT_INITIALIZED; }
+  HRESULT UnlockDevice(HANDLE, BOOL) override { return S_OK; }
+
+ private:
+  UINT token_;
+  IUnknown* device_ = nullptr;
+};
+
+}  // namespace
+
+}  // namespace platform
+
+HRESULT MFCreateDXGIDeviceManager(UINT* resetToken, IMFDXGIDeviceManager** manager) {
+  if (!resetToken || !manager) return E_POINTER;
+  auto* made = new platform::DXGIDeviceManager;
+  *resetToken = made->token();
+  *manager = made;
+  return S_OK;
+}

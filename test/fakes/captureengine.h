@@ -1,0 +1,112 @@
+// A capture engine whose source reports a chosen device type and whose sinks remember what they
+// were given, for the capture-engine manager's tests.
+#pragma once
+
+#include <string>
+#include <vector>
+
+#include "platform/linux/com.h"
+#include "platform/mfcapture.h"
+
+namespace fakes {
+
+class FakeCaptureSource : public platform::ComObject<IMFCaptureSource, IID_IMFCaptureSource> {
+ public:
+  IMFMediaType* videoType = nullptr;  // borrowed; null: no such stream
+  IMFMediaType* audioType = nullptr;
+
+  HRESULT GetCaptureDeviceSource(MF_CAPTURE_ENGINE_DEVICE_TYPE, IMFMediaSource**) override { return E_NOTIMPL; }
+  HRESULT GetCaptureDeviceActivate(MF_CAPTURE_ENGINE_DEVICE_TYPE, IMFActivate**) override { return E_NOTIMPL; }
+  HRESULT GetService(REFIID, REFIID, IUnknown**) override { return E_NOTIMPL; }
+  HRESULT AddEffect(DWORD, IUnknown*) override { return E_NOTIMPL; }
+  HRESULT RemoveEffect(DWORD, IUnknown*) override { return E_NOTIMPL; }
+  HRESULT RemoveAllEffects(DWORD) override { return E_NOTIMPL; }
+  HRESULT GetAvailableDeviceMediaType(DWORD, DWORD, IMFMediaType**) override { return E_NOTIMPL; }
+  HRESULT SetCurrentDeviceMediaType(DWORD, IMFMediaType*) override { return E_NOTIMPL; }
+  HRESULT GetCurrentDeviceMediaType(DWORD stream, IMFMediaType** type) override {
+    IMFMediaType* chosen = stream == MF_CAPTURE_ENGINE_PREFERRED_SOURCE_STREAM_FOR_AUDIO ? audioType : videoType;
+    if (!chosen) return MF_E_INVALIDSTREAMNUMBER;
+    chosen->AddRef();
+    *type = chosen;
+    return S_OK;
+  }
+  HRESULT GetDeviceStreamCount(DWORD*) override { return E_NOTIMPL; }
+  HRESULT GetDeviceStreamCategory(DWORD, MF_CAPTURE_ENGINE_STREAM_CATEGORY*) override { return E_NOTIMPL; }
+  HRESULT GetMirrorState(DWORD, BOOL*) override { return E_NOTIMPL; }
+  HRESULT SetMirrorState(DWORD, BOOL) override { return E_NOTIMPL; }
+  HRESULT GetStreamIndexFromFriendlyName(UINT32, DWORD*) override { return E_NOTIMPL; }
+};
+
+// One object serves as the record sink and the preview sink.
+class FakeSink : public platform::ComObject<IMFCaptureRecordSink, IID_IMFCaptureSink, IID_IMFCaptureRecordSink> {
+ public:
+  ~FakeSink() override {
+    for (IMFMediaType* type : added) type->Release();
+  }
+  std::vector<DWORD> sources;
+  std::vector<IMFMediaType*> added;  // one reference each
+  std::wstring fileName;
+  int removeAllCalls = 0;
+  HRESULT audioAnswer = S_OK;  // what AddStream answers for the audio stream
+
+  HRESULT GetOutputMediaType(DWORD, IMFMediaType**) override { return E_NOTIMPL; }
+  HRESULT GetService(DWORD, REFGUID, REFIID, IUnknown**) override { return E_NOTIMPL; }
+  HRESULT AddStream(DWORD source, IMFMediaType* type, IMFAttributes*, DWORD* index) override {
+    if (source == MF_CAPTURE_ENGINE_PREFERRED_SOURCE_STREAM_FOR_AUDIO && FAILED(audioAnswer)) return audioAnswer;
+    sources.push_back(source);
+    type->AddRef();
+    added.push_back(type);
+    *index = static_cast<DWORD>(added.size() - 1);
+    return S_OK;
+  }
+  HRESULT Prepare() override { return S_OK; }
+  HRESULT RemoveAllStreams() override {
+    ++removeAllCalls;
+    return S_OK;
+  }
+  HRESULT SetOutputByteStream(IMFByteStream*, REFGUID) override { return E_NOTIMPL; }
+  HRESULT SetOutputFileName(LPCWSTR name) override {
+    fileName = name;
+    return S_OK;
+  }
+  HRESULT SetSampleCallback(DWORD, IMFCaptureEngineOnSampleCallback*) override { return S_OK; }
+  HRESULT SetCustomSink(IMFMediaSink*) override { return E_NOTIMPL; }
+  HRESULT GetRotation(DWORD, DWORD*) override { return E_NOTIMPL; }
+  HRESULT SetRotation(DWORD, DWORD) override { return E_NOTIMPL; }
+};
+
+class FakeCaptureEngine : public platform::ComObject<IMFCaptureEngine, IID_IMFCaptureEngine> {
+ public:
+  FakeCaptureEngine() : source(new FakeCaptureSource), sink(new FakeSink) {}
+  ~FakeCaptureEngine() override {
+    source->Release();
+    sink->Release();
+  }
+  FakeCaptureSource* source;
+  FakeSink* sink;
+  int startRecordCalls = 0;
+  int getSinkCalls = 0;
+
+  HRESULT Initialize(IMFCaptureEngineOnEventCallback*, IMFAttributes*, IUnknown*, IUnknown*) override { return S_OK; }
+  HRESULT StartPreview() override { return S_OK; }
+  HRESULT StopPreview() override { return S_OK; }
+  HRESULT StartRecord() override {
+    ++startRecordCalls;
+    return S_OK;
+  }
+  HRESULT StopRecord(BOOL, BOOL) override { return S_OK; }
+  HRESULT TakePhoto() override { return E_NOTIMPL; }
+  HRESULT GetSink(MF_CAPTURE_ENGINE_SINK_TYPE, IMFCaptureSink** result) override {
+    ++getSinkCalls;
+    sink->AddRef();
+    *result = sink;
+    return S_OK;
+  }
+  HRESULT GetSource(IMFCaptureSource** result) override {
+    source->AddRef();
+    *result = source;
+    return S_OK;
+  }
+};
+
+}  // namespace fakes
