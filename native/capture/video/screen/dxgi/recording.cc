@@ -1,0 +1,25 @@
+#include "capture/video/screen/dxgi/recording.h"
+
+#include <exception>
+#include <thread>
+
+#include "capture/log.h"
+#include "capture/video/encoder/mftencoder.h"
+
+namespace capture::video::screen::dxgi {
+
+void startRecording(std::shared_ptr<capture::video::FrameQueue> queue) {
+  std::thread([queue] {
+    capture::video::encoder::MFTEncoder encoder;
+    queue->stopped = false;
+    // A failed clip is reported as a warning and ends only this thread, not the host process.
+    try {
+      encoder.encode(queue.get());
+    } catch (const std::exception& e) {
+      capture::logWarning(e.what());
+    }
+    queue->stopped = true;
+  }).detach();
+}
+
+}  // namespace capture::video::screen::dxgi

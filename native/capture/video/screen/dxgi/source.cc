@@ -1,0 +1,134 @@
+#include "capture/video/screen/dxgi/source.h"
+
+#include <cstring>
+
+#include "capture/check.h"
+#include "capture/clock.h"
+#include "capture/text.h"
+#include "capture/video/scale.h"
+#include "capture/video/screen/dxgi/duplicate.h"
+#include "capture/video/screen/dxgi/held.h"
+#include "capture/video/screen/dxgi/recording.h"
+#include "capture/video/screen/dxgi/texture.h"
+#include "platform/user32.h"
+
+namespace capture::video::screen::dxgi {
+
+Source::Source(IDXGIOutput1* output, ID3D11Device* device, bool selected) : output(output), device(device) {
+  output->AddRef();
+  device->AddRef();
+  acquireTimeout = 5;
+  captureMouse = true;
+  isSelected = selected;
+  try {
+    device->GetImmediateContext(&context);
+    featureLevel = device->GetFeatureLevel();
+    DXGI_OUTPUT_DESC desc{};
+    output->GetDesc(&desc);
+    outputWidth = desc.DesktopCoordinates.right - desc.DesktopCoordinates.left;
+    outputHeight = desc.DesktopCoordinates.bottom - desc.DesktopCoordinates.top;
+    stagingTexture = createStagingTexture(device, outputWidth, outputHeight);
+    duplication = duplicateOutput(output, device);
+    queue = std::make_shared<capture::video::FrameQueue>(capture::toWide(name()), outputWidth, outputHeight, 0);
+  } catch (...) {
+    releaseAll();
+    throw;
+  }
+}
+
+Source::~Source() { releaseAll(); }
+
+void Source::releaseAll() {
+  release(output);
+  release(device);
+  release(context);
+  release(stagingTexture);
+  release(duplication);
+  pointer.shapeBuffer.reset();
+}
+
+std::string Source::name() {
+  DXGI_OUTPUT_DESC desc{};
+  output->GetDesc(&desc);
+  MONITORINFOEXA info;
+  std::memset(&info, 0, sizeof(info));
+  info.cbSize = sizeof(MONITORINFOEXA);
+  GetMonitorInfoA(desc.Monitor, &info);
+  DISPLAY_DEVICEA dd;
+  std::memset(&dd, 0, sizeof(dd));
+  dd.cb = sizeof(DISPLAY_DEVICEA);
+  EnumDisplayDevicesA(info.szDevice, 0, &dd, 0);
+  DEVMODEA dm;
+  std::memset(&dm, 0, sizeof(dm));
+  dm.dmSize = sizeof(DEVMODEA);
+  dm.dmDriverExtra = 0;
+  EnumDisplaySettingsA(info.szDevice, ENUM_CURRENT_SETTINGS, &dm);
+  return std::string(dd.DeviceString);
+}
+
+void Source::capture() {
+  DXGI_OUTDUPL_FRAME_INFO frameInfo{};
+  IDXGIResource* acquired = nullptr;
+  HRESULT hr = duplication->AcquireNextFrame(acquireTimeout, &frameInfo, &acquired);
+  if (hr == DXGI_ERROR_ACCESS_LOST) {
+    release(duplication);
+    while (!duplication) {
+      try {
+        duplication = duplicateOutput(output, device);
+      } catch (...) {
+        // Access comes back after the mode change or desktop switch is over.
+      }
+    }
+    return;
+  }
+  if (hr == DXGI_ERROR_INVALID_CALL) {
+    duplication->ReleaseFrame();
+    return;
+  }
+  if (hr == DXGI_ERROR_WAIT_TIMEOUT) return;
+  Held<IDXGIResource> resource(acquired);
+
+  updatePointer(pointer, frameInfo, [this](UINT size, void* buffer, UINT* required, DXGI_OUTDUPL_POINTER_SHAPE_INFO* info) {
+    return duplication->GetFramePointerShape(size, buffer, required, info);
+  });
+
+  ID3D11Texture2D* texture = nullptr;
+  hr = resource ? resource->QueryInterface(IID_ID3D11Texture2D, reinterpret_cast<void**>(&texture)) : E_POINTER;
+  resource.reset();
+  capture::checkResult("native/capture/video/screen/dxgi/source", 85, hr, "Could not create temporary texture.");
+  context->CopyResource(stagingTexture, texture);
+  texture->Release();
+
+  hr = duplication->ReleaseFrame();
+  capture::checkResult("native/capture/video/screen/dxgi/source", 91, hr, "Could not release image frame.");
+
+  D3D11_MAPPED_SUBRESOURCE mapped{};
+  hr = context->Map(stagingTexture, 0, D3D11_MAP_READ, 0, &mapped);
+  capture::checkResult("native/capture/video/screen/dxgi/source", 94, hr, "Could not map device context for image.");
+
+  auto frame = capture::video::Frame::make(outputWidth, outputHeight, 0, capture::currentTimeMillis());
+  // Rows are taken as packed at outputWidth * 4 bytes; RowPitch is not consulted.
+  std::memcpy(frame->data.get(), mapped.pData, frame->size);
+  if (captureMouse) drawPointer(pointer, *frame);
+
+  std::lock_guard<std::mutex> lock(queue->mutex);
+  while (queue->frames.size() > 1) queue->frames.pop_front();
+  queue->frames.push_back(std::move(frame));
+}
+
+bool Source::preview(uint8_t* dst, uint32_t swapRedBlue, int32_t dstWidth, int32_t dstHeight) {
+  std::lock_guard<std::mutex> lock(queue->mutex);
+  if (queue->frames.empty()) return false;
+  capture::video::scaleFrame(queue->frames.back()->data.get(), outputWidth, outputHeight, dst, dstWidth, dstHeight,
+                             swapRedBlue);
+  return true;
+}
+
+void Source::startEncode(std::string filename) {
+  queue->path = capture::toWide(filename);
+  startRecording(queue);
+}
+
+void Source::stopEncode() { queue->stopped = true; }
+
+}  // namespace capture::video::screen::dxgi
