@@ -99,10 +99,19 @@ async function startDesktop(options = {}) {
 function stopAll(xvfb, dir) {
   const pidFile = path.join(dir, 'pulse', 'pid');
   if (fs.existsSync(pidFile)) {
-    try { process.kill(Number(fs.readFileSync(pidFile, 'utf8')), 'SIGTERM'); } catch (_) { /* already gone */ }
+    const pid = Number(fs.readFileSync(pidFile, 'utf8'));
+    try {
+      process.kill(pid, 'SIGTERM');
+      // The server writes into the folder until it is gone; wait for it (at most a second).
+      const pause = new Int32Array(new SharedArrayBuffer(4));
+      for (let i = 0; i < 100; i++) {
+        process.kill(pid, 0);
+        Atomics.wait(pause, 0, 0, 10);
+      }
+    } catch (_) { /* gone */ }
   }
   if (xvfb) xvfb.process.kill('SIGTERM');
-  fs.rmSync(dir, { recursive: true, force: true });
+  fs.rmSync(dir, { recursive: true, force: true, maxRetries: 5, retryDelay: 50 });
 }
 
 // A moving test picture in a borderless window at (x, y); returns the child process.
