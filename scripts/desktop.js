@@ -104,10 +104,14 @@ function stopAll(xvfb, dir) {
       process.kill(pid, 'SIGTERM');
       // The server writes into the folder until it is gone; wait for it (at most a second).
       const pause = new Int32Array(new SharedArrayBuffer(4));
-      for (let i = 0; i < 100; i++) {
-        process.kill(pid, 0);
-        Atomics.wait(pause, 0, 0, 10);
-      }
+      const alive = () => {
+        try {
+          return !/^\d+ \(.*\) Z/.test(fs.readFileSync(`/proc/${pid}/stat`, 'utf8'));  // a zombie is gone
+        } catch (_) {
+          return false;
+        }
+      };
+      for (let i = 0; i < 100 && alive(); i++) Atomics.wait(pause, 0, 0, 10);
     } catch (_) { /* gone */ }
   }
   if (xvfb) xvfb.process.kill('SIGTERM');
