@@ -7,6 +7,7 @@ extern "C" {
 #include <libavdevice/avdevice.h>
 #include <libavformat/avformat.h>
 #include <libavutil/opt.h>
+#include <libavutil/time.h>
 #include <libswresample/swresample.h>
 #include <libswscale/swscale.h>
 }
@@ -283,6 +284,10 @@ struct EngineState {
   std::string recordPath;
   bool previewing = false;
   std::unique_ptr<Recording> recording;
+  // When StopRecord was called (av_gettime); 0 while no stop is pending. A microphone's read can
+  // return late with sound captured after it, which does not belong in the file.
+  int64_t stopRequestedAt = 0;
+  int64_t startRequestedAt = 0;  // likewise, sound captured before StartRecord was called
   std::thread::id threadId;
 
   // The device behind a source stream index, or null.
@@ -487,7 +492,17 @@ void EngineThread::deliverAudio(AVFrame* frame, int64_t pts, AVRational timeBase
     }
   }
 
-  if (recording && recording->hasAudio) {
+  int64_t stopAt = 0;
+  int64_t startAt = 0;
+  {
+    std::lock_guard<std::mutex> lock(state_->mutex);
+    stopAt = state_->stopRequestedAt;
+    startAt = state_->startRequestedAt;
+  }
+  // The pulse input stamps packets with the wall clock in microseconds.
+  const int64_t captured = av_rescale_q(pts, timeBase, AVRational{1, 1000000});
+  const bool outside = (stopAt && captured > stopAt) || captured < startAt;
+  if (recording && recording->hasAudio && !outside) {
     if (!recording->resampler) {
       AVChannelLayout out;
       av_channel_layout_default(&out, recording->audioChannels);
@@ -588,6 +603,10 @@ void EngineThread::run() {
         }
         case Command::StartRecord: {
           HRESULT hr = SUCCEEDED(state_->initStatus) ? openDevices() : state_->initStatus;
+          {
+            std::lock_guard<std::mutex> lock(state_->mutex);
+            state_->stopRequestedAt = 0;
+          }
           if (SUCCEEDED(hr) && !state_->recording) hr = startRecording();
           send(MF_CAPTURE_ENGINE_RECORD_STARTED, hr);
           break;
@@ -874,8 +893,20 @@ class CaptureEngine : public ComObject<IMFCaptureEngine, IID_IMFCaptureEngine> {
   }
   HRESULT StartPreview() override { return queue(Command::StartPreview); }
   HRESULT StopPreview() override { return queue(Command::StopPreview); }
-  HRESULT StartRecord() override { return queue(Command::StartRecord); }
-  HRESULT StopRecord(BOOL, BOOL) override { return queue(Command::StopRecord); }
+  HRESULT StartRecord() override {
+    {
+      std::lock_guard<std::mutex> lock(state_->mutex);
+      state_->startRequestedAt = av_gettime();
+    }
+    return queue(Command::StartRecord);
+  }
+  HRESULT StopRecord(BOOL, BOOL) override {
+    {
+      std::lock_guard<std::mutex> lock(state_->mutex);
+      state_->stopRequestedAt = av_gettime();
+    }
+    return queue(Command::StopRecord);
+  }
   HRESULT TakePhoto() override { return E_NOTIMPL; }
   HRESULT GetSink(MF_CAPTURE_ENGINE_SINK_TYPE type, IMFCaptureSink** sink) override {
     if (!sink) return E_POINTER;

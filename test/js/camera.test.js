@@ -1,0 +1,105 @@
+'use strict';
+// Cameras and capture-device microphones from JavaScript: lavfi test cameras named in
+// TAVIO_TEST_CAMERAS ("Name=lavfi graph;..."), and the virtual desktop's sine-source microphone.
+const test = require('node:test');
+const assert = require('node:assert');
+const { execFileSync } = require('child_process');
+const fs = require('fs');
+const os = require('os');
+const path = require('path');
+const { runAddon } = require('./addon');
+const { startDesktop } = require('../../scripts/desktop');
+
+const CAMERAS = 'Test Camera A=testsrc2=size=640x480:rate=30;Test Camera B=color=c=red:size=1280x720:rate=30';
+
+function probe(file) {
+  return JSON.parse(execFileSync('ffprobe', ['-v', 'error', '-show_entries',
+    'stream=codec_type,codec_name,width,height,sample_rate:format=duration', '-of', 'json', file], { encoding: 'utf8' }));
+}
+
+// Decodes every frame; ffmpeg -v error prints nothing for a clean file.
+function decodeErrors(file) {
+  return execFileSync('ffmpeg', ['-v', 'error', '-i', file, '-f', 'null', '-'], { encoding: 'utf8', stdio: ['ignore', 'pipe', 'pipe'] });
+}
+
+test('cameras and capture-device microphones', async (t) => {
+  const desktop = await startDesktop({ display: false, microphone: { name: 'tavio_mic', description: 'Tavio Microphone', frequency: 440 } });
+  t.after(() => desktop.stop());
+  const env = { ...desktop.env, TAVIO_TEST_CAMERAS: CAMERAS };
+  const dir = fs.mkdtempSync(path.join(os.tmpdir(), 'tavio-camera-'));
+  t.after(() => fs.rmSync(dir, { recursive: true, force: true }));
+
+  await t.test('cameras first, then microphones, the first of each selected, with real preview sizes', async () => {
+    const { reports, code } = await runAddon('addon.initialize(); report(events.map((e) => e.source));', { env });
+    assert.strictEqual(code, 0);
+    const sources = reports[0];
+    const cameras = sources.filter((s) => s.type === 'mfce_video');
+    const microphones = sources.filter((s) => s.type === 'mfce_audio');
+    assert.deepStrictEqual(cameras.map((s) => [s.id, s.name, s.selected, s.width, s.height, s.size, s.pixelWidth]), [
+      [0, 'Test Camera A', 1, 640, 480, 640 * 480 * 4, 4], [1, 'Test Camera B', 0, 1280, 720, 1280 * 720 * 4, 4]]);
+    assert.deepStrictEqual(microphones.map((s) => [s.id, s.name, s.selected]), [[2, 'Tavio Microphone', 1]]);
+    assert.deepStrictEqual(Object.keys(microphones[0]), ['id', 'name', 'selected', 'type']);
+  });
+
+  await t.test('getPreview shows the camera picture and the microphone tone', async () => {
+    const { reports, code } = await runAddon(`
+      addon.initialize();
+      await sleep(1000);
+      const red = addon.getPreview(1, 8, 8);
+      const pattern = addon.getPreview(0, 640, 480);
+      report({ red: Array.from(red.slice(0, 4)), white: Array.from(pattern.slice((40 * 640 + 40) * 4, (40 * 640 + 40) * 4 + 4)),
+               peaks: addon.getPreview(2) });
+    `, { env });
+    assert.strictEqual(code, 0);
+    const [{ red, white, peaks }] = reports;
+    assert.ok(red[0] > 240 && red[1] < 20 && red[2] < 20 && red[3] === 255, `red camera shows ${red}`);
+    // testsrc2's top-left region is a colour bar; its pixels are fully opaque and not black.
+    assert.strictEqual(white[3], 255);
+    assert.ok(white[0] + white[1] + white[2] > 100, `testsrc2 shows ${white}`);
+    // module-sine-source plays at amplitude 0.5 (its default).
+    assert.ok(Math.abs(peaks.left - 0.5) < 0.02 && peaks.right === peaks.left, JSON.stringify(peaks));
+  });
+
+  await t.test('startCapture records a camera to H.264 and a microphone to AAC', async () => {
+    const video = path.join(dir, 'camera.mp4');
+    const audio = path.join(dir, 'microphone.mp4');
+    const { reports, code } = await runAddon(`
+      addon.initialize();
+      await sleep(500);
+      const started = Date.now();
+      addon.startCapture(0, ${JSON.stringify(video)});
+      addon.startCapture(2, ${JSON.stringify(audio)});
+      await sleep(4000);
+      addon.stopCapture(0);
+      addon.stopCapture(2);
+      const seconds = (Date.now() - started) / 1000;
+      await sleep(3000);  // the files are finished on the engines' threads
+      report({ seconds, clips: events.filter((e) => e.type === 'new-clip') });
+    `, { env });
+    assert.strictEqual(code, 0);
+    const [{ seconds, clips }] = reports;
+    assert.deepStrictEqual(clips.map((c) => [c.uid, c.filename]), [[0, video], [2, audio]]);
+    const v = probe(video);
+    assert.deepStrictEqual(v.streams.map((s) => [s.codec_type, s.codec_name, s.width, s.height]), [['video', 'h264', 640, 480]]);
+    assert.ok(Math.abs(v.format.duration - seconds) / seconds < 0.05, `video ${v.format.duration} s for ${seconds} s`);
+    assert.strictEqual(decodeErrors(video), '');
+    const a = probe(audio);
+    assert.deepStrictEqual(a.streams.map((s) => [s.codec_type, s.codec_name]), [['audio', 'aac']]);
+    assert.strictEqual(decodeErrors(audio), '');
+    assert.ok(Math.abs(a.format.duration - seconds) / seconds < 0.05, `audio ${a.format.duration} s for ${seconds} s`);
+  });
+
+  await t.test('a ".MP4" name records nothing and still sends new-clip', async () => {
+    const upper = path.join(dir, 'camera.MP4');
+    const { reports, code } = await runAddon(`
+      addon.initialize();
+      addon.startCapture(1, ${JSON.stringify(upper)});
+      await sleep(1000);
+      addon.stopCapture(1);
+      report(events.filter((e) => e.type === 'new-clip'));
+    `, { env });
+    assert.strictEqual(code, 0);
+    assert.deepStrictEqual(reports[0].map((c) => [c.uid, c.filename]), [[1, upper]]);
+    assert.ok(!fs.existsSync(upper));
+  });
+});
