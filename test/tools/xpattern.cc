@@ -15,15 +15,18 @@ namespace {
 
 const uint32_t colours[4] = {0xFF0000, 0x00FF00, 0x0000FF, 0xFFFFFF};
 
-void draw(xcb_connection_t* c, xcb_window_t window, xcb_gcontext_t gc, uint16_t width, uint16_t height, int shift) {
+// Paints into a pixmap and copies it in one request, so a screen grab never sees half a step.
+void draw(xcb_connection_t* c, xcb_window_t window, xcb_pixmap_t pixmap, xcb_gcontext_t gc, uint16_t width,
+          uint16_t height, int shift) {
   uint16_t block = width / 4;
   for (int i = 0; i < 4; ++i) {
     uint32_t colour = colours[(i + 4 - shift % 4) % 4];
     xcb_change_gc(c, gc, XCB_GC_FOREGROUND, &colour);
     xcb_rectangle_t r{static_cast<int16_t>(i * block), 0, static_cast<uint16_t>(i == 3 ? width - 3 * block : block),
                       height};
-    xcb_poly_fill_rectangle(c, window, gc, 1, &r);
+    xcb_poly_fill_rectangle(c, pixmap, gc, 1, &r);
   }
+  xcb_copy_area(c, pixmap, window, gc, 0, 0, 0, 0, width, height);
   xcb_flush(c);
 }
 
@@ -52,13 +55,16 @@ int main(int argc, char** argv) {
   xcb_create_window(c, XCB_COPY_FROM_PARENT, window, screen->root, x, y, width, height, 0,
                     XCB_WINDOW_CLASS_INPUT_OUTPUT, screen->root_visual,
                     XCB_CW_BACK_PIXEL | XCB_CW_OVERRIDE_REDIRECT | XCB_CW_EVENT_MASK, values);
+  xcb_pixmap_t pixmap = xcb_generate_id(c);
+  xcb_create_pixmap(c, screen->root_depth, pixmap, window, width, height);
   xcb_gcontext_t gc = xcb_generate_id(c);
-  xcb_create_gc(c, gc, window, 0, nullptr);
+  uint32_t noExposures = 0;
+  xcb_create_gc(c, gc, window, XCB_GC_GRAPHICS_EXPOSURES, &noExposures);
   xcb_map_window(c, window);
   xcb_flush(c);
 
   int shift = 0;
-  draw(c, window, gc, width, height, shift);
+  draw(c, window, pixmap, gc, width, height, shift);
   free(xcb_get_input_focus_reply(c, xcb_get_input_focus(c), nullptr));  // drawn once this returns
   std::printf("ready\n");
   std::fflush(stdout);
@@ -67,14 +73,14 @@ int main(int argc, char** argv) {
   auto next = std::chrono::steady_clock::now();
   for (;;) {
     while (xcb_generic_event_t* event = xcb_poll_for_event(c)) {
-      if ((event->response_type & 0x7F) == XCB_EXPOSE) draw(c, window, gc, width, height, shift);
+      if ((event->response_type & 0x7F) == XCB_EXPOSE) draw(c, window, pixmap, gc, width, height, shift);
       free(event);
     }
     if (xcb_connection_has_error(c)) return 0;
     if (fps > 0) {
       next += std::chrono::duration_cast<std::chrono::steady_clock::duration>(period);
       std::this_thread::sleep_until(next);
-      draw(c, window, gc, width, height, ++shift);
+      draw(c, window, pixmap, gc, width, height, ++shift);
     } else {
       pollfd fd{xcb_get_file_descriptor(c), POLLIN, 0};
       poll(&fd, 1, -1);

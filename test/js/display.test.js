@@ -1,0 +1,203 @@
+'use strict';
+// Displays end to end: a private Xvfb with two RandR monitors, the add-on in a child process,
+// a known pattern drawn by test/tools/xpattern.cc (compiled here with g++), the pointer moved
+// with xdotool, recordings checked with ffprobe and by decoding them.
+const { test, before, after } = require('node:test');
+const assert = require('node:assert');
+const { spawn, execFileSync, spawnSync } = require('child_process');
+const fs = require('fs');
+const os = require('os');
+const path = require('path');
+const { startDesktop } = require('../../scripts/desktop');
+const { runAddon, root } = require('./addon');
+
+const MONITORS = ['*LEFT 960/254x1080/286+0+0 screen', 'RIGHT 960/254x1080/286+960+0 none'];
+let tools;
+let xpattern;
+
+before(() => {
+  tools = fs.mkdtempSync(path.join(os.tmpdir(), 'tavio-display-'));
+  xpattern = path.join(tools, 'xpattern');
+  execFileSync('g++', ['-O2', '-o', xpattern, path.join(root, 'test/tools/xpattern.cc'), '-lxcb']);
+});
+after(() => fs.rmSync(tools, { recursive: true, force: true }));
+
+// Starts xpattern and resolves once it has drawn.
+function pattern(env, args) {
+  return new Promise((resolve, reject) => {
+    const child = spawn(xpattern, args.map(String), { env: { ...process.env, ...env }, stdio: ['ignore', 'pipe', 'pipe'] });
+    child.stdout.on('data', (d) => { if (String(d).includes('ready')) resolve(child); });
+    child.on('error', reject);
+    child.on('exit', (code) => reject(new Error(`xpattern ended (${code})`)));
+  });
+}
+
+function movePointer(env, x, y) {
+  execFileSync('xdotool', ['mousemove', String(x), String(y)], { env: { ...process.env, ...env } });
+}
+
+async function withDesktop(fn) {
+  const desktop = await startDesktop({ monitors: MONITORS });
+  const children = [];
+  try {
+    await fn(desktop.env, children);
+  } finally {
+    for (const child of children) child.kill('SIGTERM');
+    desktop.stop();
+  }
+}
+
+// Script prelude: initialize and find the display sources.
+const INIT = `
+addon.initialize();
+const displays = events.filter((e) => e.type === 'new source' && e.source.type === 'dxgi').map((e) => e.source);
+const left = displays[0];
+async function preview(uid, w, h) {
+  for (let i = 0; i < 200; i++) {
+    const p = addon.getPreview(uid, w, h);
+    if (p) return p;
+    await sleep(10);
+  }
+  return undefined;
+}
+`;
+
+test('two monitors give two display sources in server order, the first selected', async () => {
+  await withDesktop(async (env) => {
+    const { reports, code, stderr } = await runAddon(`${INIT} report(displays);`, { env });
+    assert.strictEqual(code, 0, stderr);
+    const [displays] = reports;
+    assert.strictEqual(displays.length, 2);
+    assert.deepStrictEqual(displays.map((d) => d.name), ['LEFT', 'RIGHT']);
+    assert.deepStrictEqual(displays.map((d) => d.selected), [1, 0]);
+    assert.strictEqual(displays[1].id, displays[0].id + 1);
+    for (const d of displays) {
+      assert.strictEqual(d.width, 960);
+      assert.strictEqual(d.height, 1080);
+      assert.strictEqual(d.pixelWidth, 4);
+      assert.strictEqual(d.size, 960 * 1080 * 4);
+    }
+  });
+});
+
+test('getPreview returns the scaled pattern in red, green, blue, alpha order', async () => {
+  await withDesktop(async (env, children) => {
+    movePointer(env, 1900, 1000);  // on the right monitor, out of the picture
+    children.push(await pattern(env, [0, 0, 960, 1080]));
+    const { reports, code, stderr } = await runAddon(`${INIT}
+      const p = await preview(left.id, 96, 108);
+      // Block centres (quarters of 96 columns), row 54.
+      report([12, 36, 60, 84].map((x) => Array.from(p.slice((54 * 96 + x) * 4, (54 * 96 + x) * 4 + 4))));
+      report(p.length);
+      report(addon.getPreview(left.id, 0, 0).length);
+    `, { env });
+    assert.strictEqual(code, 0, stderr);
+    assert.deepStrictEqual(reports[0], [[255, 0, 0, 255], [0, 255, 0, 255], [0, 0, 255, 255], [255, 255, 255, 255]]);
+    assert.strictEqual(reports[1], 96 * 108 * 4);
+    assert.strictEqual(reports[2], 0);
+  });
+});
+
+test('mouseCapture switches the pointer in and out of the frames', async () => {
+  await withDesktop(async (env, children) => {
+    children.push(await pattern(env, [0, 0, 960, 1080]));
+    movePointer(env, 120, 540);  // inside the red block
+    // Counts pixels that are not red around the pointer, after a pointer move made a new frame.
+    const { reports, code, stderr, stdout } = await runAddon(`${INIT}
+      const { execFileSync } = require('child_process');
+      const notRed = (p) => {
+        let n = 0;
+        for (let y = 500; y < 580; y++) for (let x = 80; x < 160; x++) {
+          const i = (y * 960 + x) * 4;
+          if (!(p[i] === 255 && p[i + 1] === 0 && p[i + 2] === 0)) n++;
+        }
+        return n;
+      };
+      await preview(left.id, 960, 1080);
+      const counts = [];
+      for (const [enabled, x] of [[1, 121], [0, 122], [5, 121]]) {
+        addon.mouseCapture(left.id, enabled);
+        execFileSync('xdotool', ['mousemove', String(x), '540']);
+        await sleep(300);
+        counts.push(notRed(addon.getPreview(left.id, 960, 1080)));
+      }
+      report(counts);
+    `, { env });
+    assert.strictEqual(code, 0, stderr + stdout);
+    const [[on, off, onAgain]] = reports;
+    assert.ok(on > 20, `pointer drawn: ${on} pixels`);
+    assert.strictEqual(off, 0);
+    assert.ok(onAgain > 20, `pointer drawn again: ${onAgain} pixels`);
+  });
+});
+
+function probe(file) {
+  const r = spawnSync('ffprobe', ['-v', 'error', '-select_streams', 'v:0', '-show_entries',
+    'stream=codec_name,profile,width,height,r_frame_rate,bit_rate:packet=pts_time', '-of', 'json', file], { encoding: 'utf8' });
+  assert.strictEqual(r.status, 0, r.stderr);
+  return JSON.parse(r.stdout);
+}
+
+// Decoder errors of a full decode. The null muxer's complaints about two frames in one 1/30 s
+// tick are left out: capture times are variable by design while the stream declares 30/1.
+function decodeErrors(file) {
+  const r = spawnSync('ffmpeg', ['-v', 'error', '-i', file, '-f', 'null', '-'], { encoding: 'utf8' });
+  return r.stderr.split('\n').filter((line) => line && !/non monotonically increasing dts to muxer/.test(line)).join('\n');
+}
+
+test('a recording is H.264 Main at the monitor size, 30/1, timed by capture times', async () => {
+  await withDesktop(async (env, children) => {
+    children.push(await pattern(env, [0, 0, 960, 1080, 30]));
+    const file = path.join(tools, 'left.mp4');
+    const { reports, code, stderr, stdout } = await runAddon(`${INIT}
+      addon.startCapture(left.id, ${JSON.stringify(file)});
+      const clip = events.find((e) => e.type === 'new-clip');
+      await sleep(3000);
+      addon.stopCapture(left.id);
+      const stopped = Date.now();
+      await sleep(1500);
+      report({ clip, stopped });
+    `, { env });
+    assert.strictEqual(code, 0, stderr + stdout);
+    const [{ clip, stopped }] = reports;
+    assert.strictEqual(clip.filename, file);
+    const info = probe(file);
+    const [stream] = info.streams;
+    assert.strictEqual(stream.codec_name, 'h264');
+    assert.strictEqual(stream.profile, 'Main');
+    assert.strictEqual(stream.width, 960);
+    assert.strictEqual(stream.height, 1080);
+    assert.strictEqual(stream.r_frame_rate, '30/1');
+    assert.strictEqual(decodeErrors(file), '', 'decoding');
+    // Frame times are capture times: they span the recorded time and never go back.
+    const times = info.packets.map((p) => Number(p.pts_time)).sort((a, b) => a - b);
+    assert.ok(times.length > 30, `${times.length} frames`);
+    const span = times[times.length - 1] - times[0];
+    const recorded = (stopped - clip.start) / 1000;
+    assert.ok(Math.abs(span - recorded) < 0.5, `span ${span} s, recorded ${recorded} s`);
+  });
+});
+
+test('a recording into a missing folder is a warning and the host records again afterwards', async () => {
+  await withDesktop(async (env, children) => {
+    children.push(await pattern(env, [0, 0, 960, 1080, 30]));
+    const bad = path.join(tools, 'missing', 'folder', 'x.mp4');
+    const good = path.join(tools, 'after.mp4');
+    const { reports, code, stderr, stdout } = await runAddon(`${INIT}
+      addon.startCapture(left.id, ${JSON.stringify(bad)});
+      await sleep(1000);
+      addon.startCapture(left.id, ${JSON.stringify(good)});
+      await sleep(2000);
+      addon.stopCapture(left.id);
+      await sleep(1500);
+      report(events.filter((e) => e.type === 'new-clip').length);
+    `, { env });
+    assert.strictEqual(code, 0, stderr + stdout);
+    assert.strictEqual(reports[0], 2);
+    assert.match(stdout, /^\d+: Warning: [\s\S]*Could not create sink\./m);
+    assert.ok(!fs.existsSync(bad));
+    const [stream] = probe(good).streams;
+    assert.strictEqual(stream.codec_name, 'h264');
+    assert.strictEqual(decodeErrors(good), '');
+  });
+});

@@ -1,0 +1,83 @@
+// Measures one display grab (capture() of a changed output) against one memcpy of the same
+// number of bytes, both in this process, and prints the medians and their ratio.
+//   displaygrab [ROUNDS]      (grabs the first display of $DISPLAY)
+#include <xcb/xcb.h>
+
+#include <algorithm>
+#include <chrono>
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
+#include <vector>
+
+#include "capture/video/screen/dxgi/capturemethod.h"
+#include "capture/video/screen/dxgi/source.h"
+
+namespace {
+
+using Clock = std::chrono::steady_clock;
+
+double median(std::vector<double> values) {
+  std::sort(values.begin(), values.end());
+  return values[values.size() / 2];
+}
+
+}  // namespace
+
+int main(int argc, char** argv) {
+  int rounds = argc > 1 ? std::atoi(argv[1]) : 200;
+  auto sources = capture::video::screen::dxgi::CaptureMethod().sources();
+  if (sources.empty()) {
+    std::fprintf(stderr, "displaygrab: no display\n");
+    return 1;
+  }
+  auto* source = dynamic_cast<capture::video::screen::dxgi::Source*>(sources[0].get());
+  source->capture();  // the first acquisition always has a frame
+
+  // Draws on the root window, so every round has a changed output.
+  xcb_connection_t* c = xcb_connect(nullptr, nullptr);
+  xcb_screen_t* screen = xcb_setup_roots_iterator(xcb_get_setup(c)).data;
+  xcb_gcontext_t gc = xcb_generate_id(c);
+  xcb_create_gc(c, gc, screen->root, 0, nullptr);
+  uint32_t subwindows = XCB_SUBWINDOW_MODE_INCLUDE_INFERIORS;
+  xcb_change_gc(c, gc, XCB_GC_SUBWINDOW_MODE, &subwindows);
+
+  size_t bytes = static_cast<size_t>(source->size());
+  std::vector<double> grabs, copies;
+  int missed = 0;
+  for (int i = 0; i < rounds; ++i) {
+    uint32_t colour = (i & 1) ? 0x336699 : 0x996633;
+    xcb_change_gc(c, gc, XCB_GC_FOREGROUND, &colour);
+    xcb_rectangle_t r{0, 0, 64, 64};
+    xcb_poly_fill_rectangle(c, screen->root, gc, 1, &r);
+    free(xcb_get_input_focus_reply(c, xcb_get_input_focus(c), nullptr));
+
+    int64_t before = 0;
+    {
+      std::lock_guard<std::mutex> lock(source->queue->mutex);
+      before = source->queue->frames.empty() ? 0 : reinterpret_cast<intptr_t>(source->queue->frames.back().get());
+    }
+    auto start = Clock::now();
+    source->capture();
+    auto end = Clock::now();
+    {
+      std::lock_guard<std::mutex> lock(source->queue->mutex);
+      if (reinterpret_cast<intptr_t>(source->queue->frames.back().get()) == before) ++missed;
+    }
+    grabs.push_back(std::chrono::duration<double, std::milli>(end - start).count());
+  }
+
+  std::vector<uint8_t> from(bytes, 1), to(bytes, 2);
+  for (int i = 0; i < rounds; ++i) {
+    from[i % bytes] = static_cast<uint8_t>(i);
+    auto start = Clock::now();
+    std::memcpy(to.data(), from.data(), bytes);
+    auto end = Clock::now();
+    copies.push_back(std::chrono::duration<double, std::milli>(end - start).count());
+  }
+  std::printf("output %ux%u, %d rounds, %d without a new frame\n", source->width(), source->height(), rounds, missed);
+  std::printf("grab median %.3f ms, memcpy of %zu bytes median %.3f ms, ratio %.2f\n", median(grabs), bytes,
+              median(copies), median(grabs) / median(copies));
+  xcb_disconnect(c);
+  return missed == 0 ? 0 : 1;
+}
