@@ -1,0 +1,69 @@
+'use strict';
+// Records a 1920x1080 display that changes at 60 Hz for 20 s with the add-on, and the same
+// display with ffmpeg's x11grab and libx264 at the sink writer's settings (superfast,
+// zerolatency, Main, 10485760 bit/s), in the same run. Prints CPU seconds per written frame
+// and written frames per second for both, and the ratio of CPU per frame.
+//   node bench/display.js [seconds]
+const { spawn, spawnSync, execFileSync } = require('child_process');
+const fs = require('fs');
+const os = require('os');
+const path = require('path');
+const { startDesktop } = require('../scripts/desktop');
+const { runAddon, root } = require('../test/js/addon');
+
+const seconds = Number(process.argv[2] || 20);
+
+function frames(file) {
+  const r = spawnSync('ffprobe', ['-v', 'error', '-select_streams', 'v:0', '-count_packets', '-show_entries',
+    'stream=nb_read_packets,profile,bit_rate', '-of', 'json', file], { encoding: 'utf8' });
+  return JSON.parse(r.stdout).streams[0];
+}
+
+async function main() {
+  const dir = fs.mkdtempSync(path.join(os.tmpdir(), 'tavio-bench-'));
+  const xpattern = path.join(dir, 'xpattern');
+  execFileSync('g++', ['-O2', '-o', xpattern, path.join(root, 'test/tools/xpattern.cc'), '-lxcb']);
+  const desktop = await startDesktop({ width: 1920, height: 1080 });
+  const env = { ...process.env, ...desktop.env };
+  const animation = spawn(xpattern, ['0', '0', '1920', '1080', '60'], { env, stdio: 'ignore' });
+  try {
+    const ours = path.join(dir, 'ours.mp4');
+    const { reports, stderr } = await runAddon(`
+      addon.initialize();
+      const display = events.find((e) => e.type === 'new source' && e.source.type === 'dxgi').source;
+      const before = process.cpuUsage();
+      addon.startCapture(display.id, ${JSON.stringify(ours)});
+      await sleep(${seconds * 1000});
+      addon.stopCapture(display.id);
+      await sleep(2000);
+      const used = process.cpuUsage(before);
+      report((used.user + used.system) / 1e6);
+    `, { env: desktop.env, timeoutMs: (seconds + 60) * 1000 });
+    if (!reports.length) throw new Error(`add-on run failed: ${stderr}`);
+    const ourCpu = reports[0];
+    const ourStream = frames(ours);
+
+    const theirs = path.join(dir, 'ffmpeg.mp4');
+    const run = spawnSync('bash', ['-c', `ffmpeg -v error -y -f x11grab -framerate 60 -video_size 1920x1080 -i "$DISPLAY+0,0" ` +
+      `-t ${seconds} -c:v libx264 -preset superfast -tune zerolatency -profile:v main -b:v 10485760 ` +
+      `-pix_fmt yuv420p "${theirs}" && times`], { env, encoding: 'utf8' });
+    // `times` prints the shell's and then its children's user and system times.
+    const children = run.stdout.trim().split('\n').pop().match(/(\d+)m([\d.]+)s (\d+)m([\d.]+)s/);
+    const theirCpu = Number(children[1]) * 60 + Number(children[2]) + Number(children[3]) * 60 + Number(children[4]);
+    const theirStream = frames(theirs);
+
+    const ourFrames = Number(ourStream.nb_read_packets);
+    const theirFrames = Number(theirStream.nb_read_packets);
+    const line = (name, cpu, n, s) => console.log(`${name}: ${n} frames, ${(n / seconds).toFixed(1)} frames/s, ` +
+      `${cpu.toFixed(2)} CPU s, ${(cpu / n * 1000).toFixed(2)} CPU ms/frame, profile ${s.profile}, ${s.bit_rate} bit/s`);
+    line('tavio_capture', ourCpu, ourFrames, ourStream);
+    line('ffmpeg x11grab', theirCpu, theirFrames, theirStream);
+    console.log(`CPU per frame, ours / ffmpeg: ${((ourCpu / ourFrames) / (theirCpu / theirFrames)).toFixed(2)} (target <= 0.8)`);
+  } finally {
+    animation.kill('SIGTERM');
+    desktop.stop();
+    fs.rmSync(dir, { recursive: true, force: true });
+  }
+}
+
+main().catch((e) => { console.error(e); process.exit(1); });
