@@ -3,7 +3,8 @@
 // Finds every capture device, saves a preview picture of each display and camera, records a
 // few seconds of every source into MP4 files and prints the events. Without DISPLAY or
 // PULSE_SERVER in the environment it starts a private virtual desktop with a moving picture
-// and a tone playing. Files go to ./out (or the folder named as the first argument).
+// and a tone playing, and (unless TAVIO_TEST_CAMERAS says otherwise) a test camera. Files go to
+// ./out (or the folder named as the first argument).
 const { execFileSync, spawnSync } = require('child_process');
 const fs = require('fs');
 const path = require('path');
@@ -41,6 +42,10 @@ async function main() {
   if (!givenDisplay) {
     helpers.push(startAnimation(desktop.env, { x: 200, y: 150 }));
     console.log(`demo: private display ${desktop.env.DISPLAY} with a moving picture`);
+    if (process.env.TAVIO_TEST_CAMERAS === undefined) {
+      process.env.TAVIO_TEST_CAMERAS = 'Demo Test Camera=testsrc2=size=640x480:rate=30';
+      console.log('demo: test camera "Demo Test Camera" (an FFmpeg test pattern)');
+    }
   }
   if (!givenSound) {
     helpers.push(playTone(desktop.env, { frequency: 440 }));
