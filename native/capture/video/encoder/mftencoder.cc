@@ -1,0 +1,154 @@
+#include "capture/video/encoder/mftencoder.h"
+
+#include <chrono>
+#include <cstring>
+#include <memory>
+#include <thread>
+
+#include "capture/check.h"
+
+namespace capture::video::encoder {
+
+namespace {
+
+const char* const file = "native/capture/video/encoder/mftencoder";
+
+constexpr UINT32 bitRate = 10485760;
+constexpr LONGLONG sampleDuration = 166666;  // 1/60 s, while the stream declares 30 fps: both kept on purpose
+
+// Releases a platform object when the scope ends, however it ends.
+template <class T>
+struct Held {
+  T* object = nullptr;
+  ~Held() { release(); }
+  void release() {
+    if (object) object->Release();
+    object = nullptr;
+  }
+};
+
+}  // namespace
+
+MFTEncoder::MFTEncoder() : firstTimestamp(0), frameCount(0) {}
+
+// The writer is released here although the recording never needs it again after Finalize:
+// holding on to it would keep its encoder's memory for the life of the process.
+MFTEncoder::~MFTEncoder() {
+  if (writer) writer->Release();
+}
+
+void MFTEncoder::encode(capture::video::FrameQueue* queue) {
+  this->queue = queue;
+  checkResult(file, 20, MFStartup(MF_VERSION, MFSTARTUP_FULL), "Could not start MFT.");
+  // A failure after start-up shuts Media Foundation down before the exception leaves, so the
+  // recording thread that reports it ends with start-up and shut-down paired.
+  struct ShutdownOnFailure {
+    bool armed = true;
+    ~ShutdownOnFailure() {
+      if (armed) MFShutdown();
+    }
+  } guard;
+  configure();
+  while (!queue->stopped.load()) {
+    ++frameCount;
+    writeFrame();
+  }
+  checkResult(file, 34, writer->Finalize(), "Could not finalize writer.");
+  guard.armed = false;
+  checkResult(file, 35, MFShutdown(), "Could not shut down MFT.");
+}
+
+void MFTEncoder::configure() {
+  Held<IMFAttributes> attrs;
+  checkResult(file, 48, MFCreateAttributes(&attrs.object, 0), "Unable to create sink writer config.");
+  checkResult(file, 49, attrs.object->SetUINT32(MF_LOW_LATENCY, TRUE), "Unable to set low latency mode.");
+  checkResult(file, 50, attrs.object->SetUINT32(MF_READWRITE_ENABLE_HARDWARE_TRANSFORMS, TRUE),
+              "Unable to enable hardware transforms.");
+  checkResult(file, 51, attrs.object->SetUINT32(MF_SINK_WRITER_DISABLE_THROTTLING, TRUE),
+              "Unable to disable throttling.");
+  checkResult(file, 52, attrs.object->SetGUID(MF_TRANSCODE_CONTAINERTYPE, MFTranscodeContainerType_MPEG4),
+              "Unable to set container type.");
+  checkResult(file, 54, MFCreateSinkWriterFromURL(queue->path.c_str(), nullptr, attrs.object, &writer),
+              "Could not create sink.");
+  attrs.release();
+
+  const UINT64 frameSize = (static_cast<UINT64>(queue->width) << 32) | static_cast<UINT32>(queue->height);
+  const UINT64 frameRate = (static_cast<UINT64>(30) << 32) | 1;
+  const UINT64 aspectRatio = (static_cast<UINT64>(1) << 32) | 1;
+
+  Held<IMFMediaType> out;
+  checkResult(file, 58, MFCreateMediaType(&out.object), "Could not create output media type.");
+  checkResult(file, 59, out.object->SetGUID(MF_MT_MAJOR_TYPE, MFMediaType_Video), "Unable to set major type of output.");
+  checkResult(file, 60, out.object->SetGUID(MF_MT_SUBTYPE, MFVideoFormat_H264), "Unable to set subtype of output.");
+  checkResult(file, 61, out.object->SetUINT32(MF_MT_AVG_BITRATE, bitRate), "Unable to set output bitrate.");
+  checkResult(file, 62, out.object->SetUINT32(MF_MT_INTERLACE_MODE, MFVideoInterlace_Progressive),
+              "Unable to set output interlace mode.");
+  checkResult(file, 63, out.object->SetUINT64(MF_MT_FRAME_SIZE, frameSize), "Unable to set output resolution.");
+  checkResult(file, 64, out.object->SetUINT64(MF_MT_FRAME_RATE, frameRate), "Unable to set output framerate.");
+  checkResult(file, 65, out.object->SetUINT64(MF_MT_PIXEL_ASPECT_RATIO, aspectRatio),
+              "Unable to set output pixel aspect ratio.");
+  checkResult(file, 66, out.object->SetUINT32(MF_MT_MPEG2_PROFILE, eAVEncH264VProfile_Main),
+              "Unable to set output profile.");
+  checkResult(file, 67, writer->AddStream(out.object, &streamIndex), "Could not add stream to writer.");
+  out.release();
+
+  // No default stride: the input is bottom-up RGB32, which writeFrame() provides.
+  Held<IMFMediaType> in;
+  checkResult(file, 71, MFCreateMediaType(&in.object), "Could not create input media type.");
+  checkResult(file, 72, in.object->SetGUID(MF_MT_MAJOR_TYPE, MFMediaType_Video), "Unable to set major type of input.");
+  checkResult(file, 73, in.object->SetGUID(MF_MT_SUBTYPE, MFVideoFormat_RGB32), "Unable to set subtype of input.");
+  checkResult(file, 74, in.object->SetUINT32(MF_MT_AVG_BITRATE, bitRate), "Unable to set input bitrate.");
+  checkResult(file, 75, in.object->SetUINT32(MF_MT_INTERLACE_MODE, MFVideoInterlace_Progressive),
+              "Unable to set input interlace mode.");
+  checkResult(file, 76, in.object->SetUINT64(MF_MT_FRAME_SIZE, frameSize), "Unable to set input resolution.");
+  checkResult(file, 77, in.object->SetUINT64(MF_MT_FRAME_RATE, frameRate), "Unable to set input framerate.");
+  checkResult(file, 78, in.object->SetUINT64(MF_MT_PIXEL_ASPECT_RATIO, aspectRatio),
+              "Unable to set input pixel aspect ratio.");
+  checkResult(file, 80, writer->SetInputMediaType(streamIndex, in.object, nullptr), "Could not set input media type.");
+  in.release();
+
+  checkResult(file, 83, writer->BeginWriting(), "Could not being writing.");
+}
+
+void MFTEncoder::writeFrame() {
+  const DWORD length = static_cast<DWORD>(queue->width) * static_cast<DWORD>(queue->height) * 4;
+  Held<IMFMediaBuffer> buffer;
+  checkResult(file, 88, MFCreateMemoryBuffer(length, &buffer.object), "Could not create memory buffer");
+
+  // The newest frame always stays for the preview, so a frame is taken only while two or more
+  // are queued; until then poll every 5 ms (the stop flag is not looked at here).
+  std::unique_ptr<Frame> frame;
+  for (;;) {
+    {
+      std::lock_guard<std::mutex> lock(queue->mutex);
+      if (queue->frames.size() > 1) {
+        frame = std::move(queue->frames.front());
+        queue->frames.pop_front();
+        break;
+      }
+    }
+    std::this_thread::sleep_until(std::chrono::system_clock::now() + std::chrono::microseconds(5000));
+  }
+
+  BYTE* dst = nullptr;
+  checkResult(file, 105, buffer.object->Lock(&dst, nullptr, nullptr), "Could not get a lock on input buffer.");
+  // Rows go in upside down: the input type is bottom-up RGB32.
+  const uint32_t rowBytes = static_cast<uint32_t>(frame->width) * 4;
+  const uint8_t* src = frame->data.get();
+  for (uint64_t i = 0; i < frame->height; ++i)
+    std::memcpy(dst + (frame->height - 1 - i) * rowBytes, src + i * rowBytes, rowBytes);
+  if (firstTimestamp == 0) firstTimestamp = frame->timestamp;
+  checkResult(file, 124, buffer.object->Unlock(), "Could not unlock input buffer.");
+  checkResult(file, 126, buffer.object->SetCurrentLength(length), "Could not set current length.");
+
+  Held<IMFSample> sample;
+  checkResult(file, 129, MFCreateSample(&sample.object), "Could not create sample.");
+  checkResult(file, 130, sample.object->AddBuffer(buffer.object), "Coudl not add input buffer to sample.");
+  checkResult(file, 134, sample.object->SetSampleTime((frame->timestamp - firstTimestamp) * 10000),
+              "Could not set sample time.");
+  checkResult(file, 135, sample.object->SetSampleDuration(sampleDuration), "Could not set sample duration.");
+  checkResult(file, 137, writer->WriteSample(streamIndex, sample.object), "Could not write sample.");
+  frame.reset();  // its pixel bytes, then the frame
+}
+
+}  // namespace capture::video::encoder

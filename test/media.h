@@ -1,0 +1,199 @@
+// Reads recorded files back with libavformat and libavcodec, for the encoder tests.
+#pragma once
+
+#include <cmath>
+#include <cstdint>
+#include <cstdlib>
+#include <filesystem>
+#include <string>
+#include <vector>
+
+extern "C" {
+#include <libavcodec/avcodec.h>
+#include <libavformat/avformat.h>
+#include <libavutil/channel_layout.h>
+#include <libswresample/swresample.h>
+#include <libswscale/swscale.h>
+}
+
+namespace media {
+
+// A folder of its own for a test's files, removed with everything in it.
+class TempFolder {
+ public:
+  TempFolder() {
+    std::string pattern = (std::filesystem::temp_directory_path() / "tavio-media-XXXXXX").string();
+    path_ = mkdtemp(pattern.data());
+  }
+  ~TempFolder() {
+    std::error_code ignored;
+    std::filesystem::remove_all(path_, ignored);
+  }
+  std::string file(const std::string& name) const { return path_ + "/" + name; }
+  const std::string& path() const { return path_; }
+
+ private:
+  std::string path_;
+};
+
+struct Packet {
+  double time;      // seconds
+  double duration;  // seconds
+  bool key;
+};
+
+struct Stream {
+  std::string codec;
+  int profile = 0;
+  int width = 0;
+  int height = 0;
+  AVRational rFrameRate{0, 1};
+  AVRational avgFrameRate{0, 1};
+  int sampleRate = 0;
+  int channels = 0;
+  double duration = 0;  // seconds, from the stream
+  std::vector<Packet> packets;
+  int64_t bytes = 0;    // sum of packet sizes
+};
+
+struct File {
+  bool opened = false;
+  double duration = 0;  // seconds, the container's
+  std::vector<Stream> streams;
+};
+
+inline File probe(const std::string& path) {
+  File file;
+  AVFormatContext* format = nullptr;
+  if (avformat_open_input(&format, path.c_str(), nullptr, nullptr) < 0) return file;
+  if (avformat_find_stream_info(format, nullptr) < 0) {
+    avformat_close_input(&format);
+    return file;
+  }
+  file.opened = true;
+  file.duration = format->duration == AV_NOPTS_VALUE ? 0 : format->duration / double(AV_TIME_BASE);
+  for (unsigned i = 0; i < format->nb_streams; ++i) {
+    const AVStream* s = format->streams[i];
+    Stream stream;
+    stream.codec = avcodec_get_name(s->codecpar->codec_id);
+    stream.profile = s->codecpar->profile;
+    stream.width = s->codecpar->width;
+    stream.height = s->codecpar->height;
+    stream.rFrameRate = s->r_frame_rate;
+    stream.avgFrameRate = s->avg_frame_rate;
+    stream.sampleRate = s->codecpar->sample_rate;
+    stream.channels = s->codecpar->ch_layout.nb_channels;
+    stream.duration = s->duration == AV_NOPTS_VALUE ? 0 : s->duration * av_q2d(s->time_base);
+    file.streams.push_back(stream);
+  }
+  av_seek_frame(format, -1, 0, AVSEEK_FLAG_BACKWARD);
+  AVPacket* packet = av_packet_alloc();
+  while (av_read_frame(format, packet) >= 0) {
+    const AVRational tb = format->streams[packet->stream_index]->time_base;
+    file.streams[packet->stream_index].packets.push_back(
+        {packet->pts * av_q2d(tb), packet->duration * av_q2d(tb), (packet->flags & AV_PKT_FLAG_KEY) != 0});
+    file.streams[packet->stream_index].bytes += packet->size;
+    av_packet_unref(packet);
+  }
+  av_packet_free(&packet);
+  avformat_close_input(&format);
+  return file;
+}
+
+// Decodes every frame of the first stream of the given kind. Video frames come out as packed
+// B, G, R, A rows (top-down), audio as interleaved float samples; errors counts decoder failures.
+struct Decoded {
+  int frames = 0;
+  int errors = 0;
+  int width = 0;
+  int height = 0;
+  std::vector<uint8_t> firstPicture;  // BGRA
+  int sampleRate = 0;
+  int channels = 0;
+  std::vector<float> samples;  // interleaved
+};
+
+inline Decoded decode(const std::string& path, AVMediaType kind) {
+  Decoded out;
+  AVFormatContext* format = nullptr;
+  if (avformat_open_input(&format, path.c_str(), nullptr, nullptr) < 0) return out;
+  avformat_find_stream_info(format, nullptr);
+  const AVCodec* codec = nullptr;
+  const int index = av_find_best_stream(format, kind, -1, -1, &codec, 0);
+  if (index < 0) {
+    avformat_close_input(&format);
+    return out;
+  }
+  AVCodecContext* context = avcodec_alloc_context3(codec);
+  avcodec_parameters_to_context(context, format->streams[index]->codecpar);
+  context->err_recognition = AV_EF_EXPLODE;
+  avcodec_open2(context, codec, nullptr);
+  AVPacket* packet = av_packet_alloc();
+  AVFrame* frame = av_frame_alloc();
+  SwrContext* resampler = nullptr;
+  auto take = [&]() {
+    while (avcodec_receive_frame(context, frame) == 0) {
+      ++out.frames;
+      if (kind == AVMEDIA_TYPE_VIDEO && out.firstPicture.empty()) {
+        out.width = frame->width;
+        out.height = frame->height;
+        out.firstPicture.resize(static_cast<size_t>(frame->width) * frame->height * 4);
+        SwsContext* sws = sws_getContext(frame->width, frame->height, static_cast<AVPixelFormat>(frame->format),
+                                         frame->width, frame->height, AV_PIX_FMT_BGRA, SWS_POINT, nullptr, nullptr,
+                                         nullptr);
+        uint8_t* planes[1] = {out.firstPicture.data()};
+        int strides[1] = {frame->width * 4};
+        sws_scale(sws, frame->data, frame->linesize, 0, frame->height, planes, strides);
+        sws_freeContext(sws);
+      } else if (kind == AVMEDIA_TYPE_AUDIO) {
+        if (!resampler) {
+          out.sampleRate = frame->sample_rate;
+          out.channels = frame->ch_layout.nb_channels;
+          swr_alloc_set_opts2(&resampler, &frame->ch_layout, AV_SAMPLE_FMT_FLT, frame->sample_rate, &frame->ch_layout,
+                              static_cast<AVSampleFormat>(frame->format), frame->sample_rate, 0, nullptr);
+          swr_init(resampler);
+        }
+        const size_t at = out.samples.size();
+        out.samples.resize(at + static_cast<size_t>(frame->nb_samples) * out.channels);
+        uint8_t* planes[1] = {reinterpret_cast<uint8_t*>(out.samples.data() + at)};
+        swr_convert(resampler, planes, frame->nb_samples, const_cast<const uint8_t**>(frame->extended_data),
+                    frame->nb_samples);
+      }
+      av_frame_unref(frame);
+    }
+  };
+  while (av_read_frame(format, packet) >= 0) {
+    if (packet->stream_index == index && avcodec_send_packet(context, packet) < 0) ++out.errors;
+    av_packet_unref(packet);
+    take();
+  }
+  avcodec_send_packet(context, nullptr);
+  take();
+  swr_free(&resampler);
+  av_frame_free(&frame);
+  av_packet_free(&packet);
+  avcodec_free_context(&context);
+  avformat_close_input(&format);
+  return out;
+}
+
+// The power of one frequency in a block of mono samples (Goertzel).
+inline double power(const std::vector<float>& mono, double frequency, int sampleRate) {
+  const double w = 2 * M_PI * frequency / sampleRate, c = 2 * std::cos(w);
+  double s1 = 0, s2 = 0;
+  for (float x : mono) {
+    const double s0 = x + c * s1 - s2;
+    s2 = s1;
+    s1 = s0;
+  }
+  return (s1 * s1 + s2 * s2 - c * s1 * s2) / (mono.size() * double(mono.size()));
+}
+
+// One channel of interleaved samples.
+inline std::vector<float> channel(const std::vector<float>& interleaved, int channels, int which) {
+  std::vector<float> out;
+  for (size_t i = which; i < interleaved.size(); i += channels) out.push_back(interleaved[i]);
+  return out;
+}
+
+}  // namespace media

@@ -1,0 +1,736 @@
+// The Linux sink writer: real files written through FFmpeg, read back with libavformat.
+#include <gtest/gtest.h>
+
+#include <cstring>
+#include <fstream>
+#include <random>
+#include <string>
+#include <vector>
+
+#include "media.h"
+#include "platform/mf.h"
+
+namespace {
+
+struct MediaFoundation {
+  MediaFoundation() { EXPECT_EQ(MFStartup(MF_VERSION, MFSTARTUP_FULL), S_OK); }
+  ~MediaFoundation() { EXPECT_EQ(MFShutdown(), S_OK); }
+};
+
+std::wstring wide(const std::string& path) { return platform::widen(path); }
+
+IMFSinkWriter* createWriter(const std::string& path, HRESULT* result = nullptr, bool mp4 = true) {
+  IMFAttributes* attributes = nullptr;
+  MFCreateAttributes(&attributes, 0);
+  attributes->SetUINT32(MF_LOW_LATENCY, TRUE);
+  attributes->SetUINT32(MF_SINK_WRITER_DISABLE_THROTTLING, TRUE);
+  if (mp4) attributes->SetGUID(MF_TRANSCODE_CONTAINERTYPE, MFTranscodeContainerType_MPEG4);
+  IMFSinkWriter* writer = nullptr;
+  HRESULT hr = MFCreateSinkWriterFromURL(wide(path).c_str(), nullptr, attributes, &writer);
+  attributes->Release();
+  if (result) *result = hr;
+  return writer;
+}
+
+IMFMediaType* h264Type(UINT32 width, UINT32 height, UINT32 profile = eAVEncH264VProfile_Main) {
+  IMFMediaType* type = nullptr;
+  MFCreateMediaType(&type);
+  type->SetGUID(MF_MT_MAJOR_TYPE, MFMediaType_Video);
+  type->SetGUID(MF_MT_SUBTYPE, MFVideoFormat_H264);
+  type->SetUINT32(MF_MT_AVG_BITRATE, 10485760);
+  type->SetUINT32(MF_MT_INTERLACE_MODE, MFVideoInterlace_Progressive);
+  MFSetAttributeSize(type, MF_MT_FRAME_SIZE, width, height);
+  MFSetAttributeRatio(type, MF_MT_FRAME_RATE, 30, 1);
+  MFSetAttributeRatio(type, MF_MT_PIXEL_ASPECT_RATIO, 1, 1);
+  type->SetUINT32(MF_MT_MPEG2_PROFILE, profile);
+  return type;
+}
+
+IMFMediaType* rgb32Type(UINT32 width, UINT32 height) {
+  IMFMediaType* type = nullptr;
+  MFCreateMediaType(&type);
+  type->SetGUID(MF_MT_MAJOR_TYPE, MFMediaType_Video);
+  type->SetGUID(MF_MT_SUBTYPE, MFVideoFormat_RGB32);
+  MFSetAttributeSize(type, MF_MT_FRAME_SIZE, width, height);
+  MFSetAttributeRatio(type, MF_MT_FRAME_RATE, 30, 1);
+  return type;
+}
+
+// A video writer of one H.264 stream fed with RGB32; input is adjusted by `adjust` if given.
+template <class Adjust>
+IMFSinkWriter* videoWriterWith(const std::string& path, UINT32 width, UINT32 height, DWORD* stream, Adjust adjust,
+                           UINT32 profile = eAVEncH264VProfile_Main) {
+  IMFSinkWriter* writer = createWriter(path);
+  if (!writer) return nullptr;
+  IMFMediaType* out = h264Type(width, height, profile);
+  EXPECT_EQ(writer->AddStream(out, stream), S_OK);
+  out->Release();
+  IMFMediaType* in = rgb32Type(width, height);
+  adjust(in);
+  EXPECT_EQ(writer->SetInputMediaType(*stream, in, nullptr), S_OK);
+  in->Release();
+  EXPECT_EQ(writer->BeginWriting(), S_OK);
+  return writer;
+}
+IMFSinkWriter* videoWriter(const std::string& path, UINT32 width, UINT32 height, DWORD* stream,
+                           UINT32 profile = eAVEncH264VProfile_Main) {
+  return videoWriterWith(path, width, height, stream, [](IMFMediaType*) {}, profile);
+}
+
+IMFSample* sampleOf(const void* bytes, DWORD length, LONGLONG time, LONGLONG duration, bool timed = true) {
+  IMFMediaBuffer* buffer = nullptr;
+  MFCreateMemoryBuffer(length, &buffer);
+  BYTE* data = nullptr;
+  buffer->Lock(&data, nullptr, nullptr);
+  if (length) std::memcpy(data, bytes, length);
+  buffer->Unlock();
+  buffer->SetCurrentLength(length);
+  IMFSample* sample = nullptr;
+  MFCreateSample(&sample);
+  sample->AddBuffer(buffer);
+  buffer->Release();
+  if (timed) sample->SetSampleTime(time);
+  if (duration >= 0) sample->SetSampleDuration(duration);
+  return sample;
+}
+
+HRESULT writeBytes(IMFSinkWriter* writer, DWORD stream, const std::vector<uint8_t>& bytes, LONGLONG time,
+                   LONGLONG duration, bool timed = true) {
+  IMFSample* sample = sampleOf(bytes.data(), static_cast<DWORD>(bytes.size()), time, duration, timed);
+  HRESULT hr = writer->WriteSample(stream, sample);
+  sample->Release();
+  return hr;
+}
+
+// B, G, R, X rows in memory order; `bottomUp` stores the last picture row first.
+std::vector<uint8_t> bands(int width, int height, bool bottomUp) {
+  std::vector<uint8_t> pixels(static_cast<size_t>(width) * height * 4);
+  for (int y = 0; y < height; ++y) {
+    const int pictureRow = bottomUp ? height - 1 - y : y;
+    const bool top = pictureRow < height / 2;
+    for (int x = 0; x < width; ++x) {
+      uint8_t* p = &pixels[(static_cast<size_t>(y) * width + x) * 4];
+      p[0] = top ? 0 : 255;  // blue below
+      p[1] = 0;
+      p[2] = top ? 255 : 0;  // red above
+      p[3] = 0;
+    }
+  }
+  return pixels;
+}
+
+// Which of red or blue a decoded BGRA pixel is closest to: 'r', 'b' or '?'.
+char colourAt(const media::Decoded& decoded, int x, int y) {
+  const uint8_t* p = &decoded.firstPicture[(static_cast<size_t>(y) * decoded.width + x) * 4];
+  if (p[2] > 180 && p[0] < 80 && p[1] < 80) return 'r';
+  if (p[0] > 180 && p[2] < 80 && p[1] < 80) return 'b';
+  return '?';
+}
+
+TEST(MediaFoundationStartup, CountsStartupsAndRefusesUnpairedShutdown) {
+  while (SUCCEEDED(MFShutdown())) {
+  }
+  EXPECT_EQ(MFShutdown(), MF_E_PLATFORM_NOT_INITIALIZED);
+  EXPECT_EQ(MFStartup(0x10000, MFSTARTUP_FULL), MF_E_BAD_STARTUP_VERSION);
+  EXPECT_EQ(MFStartup(MF_VERSION, MFSTARTUP_FULL), S_OK);
+  EXPECT_EQ(MFStartup(MF_VERSION, MFSTARTUP_LITE), S_OK);
+  EXPECT_EQ(MFShutdown(), S_OK);
+  EXPECT_EQ(MFShutdown(), S_OK);
+  EXPECT_EQ(MFShutdown(), MF_E_PLATFORM_NOT_INITIALIZED);
+  EXPECT_EQ(MF_VERSION, 0x20070u);
+}
+
+TEST(SinkWriter, NeedsAStartedPlatform) {
+  while (SUCCEEDED(MFShutdown())) {
+  }
+  media::TempFolder folder;
+  HRESULT hr = S_OK;
+  IMFSinkWriter* writer = createWriter(folder.file("a.mp4"), &hr);
+  EXPECT_EQ(hr, MF_E_PLATFORM_NOT_INITIALIZED);
+  EXPECT_EQ(writer, nullptr);
+}
+
+TEST(SinkWriter, UnopenablePathsFailWithTheWindowsCodes) {
+  MediaFoundation started;
+  media::TempFolder folder;
+  HRESULT hr = S_OK;
+  EXPECT_EQ(createWriter(folder.file("missing/a.mp4"), &hr), nullptr);
+  EXPECT_EQ(hr, HRESULT_FROM_WIN32(ERROR_PATH_NOT_FOUND));
+  EXPECT_EQ(static_cast<uint32_t>(hr), 0x80070003u);
+  { std::ofstream(folder.file("plain")) << "x"; }
+  EXPECT_EQ(createWriter(folder.file("plain/a.mp4"), &hr), nullptr);
+  EXPECT_EQ(hr, HRESULT_FROM_WIN32(ERROR_PATH_NOT_FOUND));
+  EXPECT_EQ(createWriter(folder.path(), &hr), nullptr);  // a folder is no file
+  EXPECT_EQ(hr, HRESULT_FROM_WIN32(ERROR_ACCESS_DENIED));
+  EXPECT_EQ(createWriter(folder.file("no-container.xyz"), &hr, false), nullptr);
+  EXPECT_EQ(hr, MF_E_UNSUPPORTED_BYTESTREAM_TYPE);
+}
+
+TEST(SinkWriter, CreatesTheFileAtOnceAndTakesTheContainerFromTheAttribute) {
+  MediaFoundation started;
+  media::TempFolder folder;
+  // The extension says nothing; the attribute chooses MP4.
+  const std::string path = folder.file("clip.unknown");
+  DWORD stream = 0;
+  IMFSinkWriter* writer = createWriter(path);
+  ASSERT_NE(writer, nullptr);
+  EXPECT_TRUE(std::filesystem::exists(path));
+  IMFMediaType* out = h264Type(64, 64);
+  ASSERT_EQ(writer->AddStream(out, &stream), S_OK);
+  out->Release();
+  IMFMediaType* in = rgb32Type(64, 64);
+  ASSERT_EQ(writer->SetInputMediaType(stream, in, nullptr), S_OK);
+  in->Release();
+  ASSERT_EQ(writer->BeginWriting(), S_OK);
+  const auto pixels = bands(64, 64, true);
+  for (int i = 0; i < 3; ++i) EXPECT_EQ(writeBytes(writer, stream, pixels, i * 333333LL, 333333), S_OK);
+  EXPECT_EQ(writer->Finalize(), S_OK);
+  writer->Release();
+  AVFormatContext* format = nullptr;
+  ASSERT_EQ(avformat_open_input(&format, path.c_str(), nullptr, nullptr), 0);
+  EXPECT_NE(std::string(format->iformat->name).find("mp4"), std::string::npos);
+  avformat_close_input(&format);
+}
+
+TEST(SinkWriter, H264IsReallyMainWithTheTypesSizeRateAndBitRate) {
+  MediaFoundation started;
+  media::TempFolder folder;
+  const std::string path = folder.file("noise.mp4");
+  const UINT32 width = 640, height = 360;
+  DWORD stream = 99;
+  IMFSinkWriter* writer = videoWriter(path, width, height, &stream);
+  ASSERT_NE(writer, nullptr);
+  EXPECT_EQ(stream, 0u);
+  // Noise needs far more than the bit rate, so the encoder has to hold it at its target.
+  std::mt19937 random(7);
+  std::vector<uint8_t> pixels(width * height * 4);
+  const int frames = 90;
+  for (int i = 0; i < frames; ++i) {
+    for (auto& byte : pixels) byte = static_cast<uint8_t>(random());
+    ASSERT_EQ(writeBytes(writer, stream, pixels, i * 10000000LL / 30, 333333), S_OK);
+  }
+  EXPECT_EQ(writer->Finalize(), S_OK);
+  writer->Release();
+
+  const media::File file = media::probe(path);
+  ASSERT_TRUE(file.opened);
+  ASSERT_EQ(file.streams.size(), 1u);
+  const media::Stream& video = file.streams[0];
+  EXPECT_EQ(video.codec, "h264");
+  EXPECT_EQ(video.profile, FF_PROFILE_H264_MAIN);
+  EXPECT_EQ(video.width, 640);
+  EXPECT_EQ(video.height, 360);
+  EXPECT_EQ(av_cmp_q(video.rFrameRate, AVRational{30, 1}), 0) << video.rFrameRate.num << "/" << video.rFrameRate.den;
+  EXPECT_EQ(av_cmp_q(video.avgFrameRate, AVRational{30, 1}), 0)
+      << video.avgFrameRate.num << "/" << video.avgFrameRate.den;
+  ASSERT_EQ(video.packets.size(), static_cast<size_t>(frames));
+  const double seconds = frames / 30.0;
+  const double bitsPerSecond = video.bytes * 8 / seconds;
+  EXPECT_NEAR(bitsPerSecond, 10485760, 10485760 * 0.15);
+  EXPECT_NEAR(file.duration, seconds, 0.001);  // packet durations set: not one frame short
+
+  const media::Decoded decoded = media::decode(path, AVMEDIA_TYPE_VIDEO);
+  EXPECT_EQ(decoded.errors, 0);
+  EXPECT_EQ(decoded.frames, frames);
+}
+
+TEST(SinkWriter, BaselineProfileWhenAsked) {
+  MediaFoundation started;
+  media::TempFolder folder;
+  const std::string path = folder.file("base.mp4");
+  DWORD stream = 0;
+  IMFSinkWriter* writer = videoWriter(path, 128, 96, &stream, eAVEncH264VProfile_Base);
+  ASSERT_NE(writer, nullptr);
+  const auto pixels = bands(128, 96, true);
+  for (int i = 0; i < 5; ++i) ASSERT_EQ(writeBytes(writer, stream, pixels, i * 333333LL, 333333), S_OK);
+  EXPECT_EQ(writer->Finalize(), S_OK);
+  writer->Release();
+  const media::File file = media::probe(path);
+  ASSERT_TRUE(file.opened);
+  EXPECT_EQ(file.streams[0].profile & ~FF_PROFILE_H264_CONSTRAINED, FF_PROFILE_H264_BASELINE);
+}
+
+TEST(SinkWriter, RGB32WithoutStrideIsBottomUp) {
+  MediaFoundation started;
+  media::TempFolder folder;
+  const std::string path = folder.file("bottomup.mp4");
+  DWORD stream = 0;
+  IMFSinkWriter* writer = videoWriter(path, 160, 120, &stream);
+  ASSERT_NE(writer, nullptr);
+  const auto pixels = bands(160, 120, true);
+  for (int i = 0; i < 3; ++i) ASSERT_EQ(writeBytes(writer, stream, pixels, i * 333333LL, 333333), S_OK);
+  ASSERT_EQ(writer->Finalize(), S_OK);
+  writer->Release();
+  const media::Decoded decoded = media::decode(path, AVMEDIA_TYPE_VIDEO);
+  ASSERT_EQ(decoded.width, 160);
+  EXPECT_EQ(colourAt(decoded, 80, 10), 'r');
+  EXPECT_EQ(colourAt(decoded, 80, 110), 'b');
+}
+
+TEST(SinkWriter, PositiveDefaultStrideIsTopDown) {
+  MediaFoundation started;
+  media::TempFolder folder;
+  const std::string path = folder.file("topdown.mp4");
+  DWORD stream = 0;
+  IMFSinkWriter* writer =
+      videoWriterWith(path, 160, 120, &stream, [](IMFMediaType* in) { in->SetUINT32(MF_MT_DEFAULT_STRIDE, 160 * 4); });
+  ASSERT_NE(writer, nullptr);
+  const auto pixels = bands(160, 120, false);
+  for (int i = 0; i < 3; ++i) ASSERT_EQ(writeBytes(writer, stream, pixels, i * 333333LL, 333333), S_OK);
+  ASSERT_EQ(writer->Finalize(), S_OK);
+  writer->Release();
+  const media::Decoded decoded = media::decode(path, AVMEDIA_TYPE_VIDEO);
+  ASSERT_EQ(decoded.width, 160);
+  EXPECT_EQ(colourAt(decoded, 80, 10), 'r');
+  EXPECT_EQ(colourAt(decoded, 80, 110), 'b');
+}
+
+TEST(SinkWriter, SampleTimesAndDurationsBecomePacketTimes) {
+  MediaFoundation started;
+  media::TempFolder folder;
+  const std::string path = folder.file("times.mp4");
+  DWORD stream = 0;
+  IMFSinkWriter* writer = videoWriter(path, 64, 64, &stream);
+  ASSERT_NE(writer, nullptr);
+  const auto pixels = bands(64, 64, true);
+  ASSERT_EQ(writeBytes(writer, stream, pixels, 0, 166666), S_OK);
+  ASSERT_EQ(writeBytes(writer, stream, pixels, 330000, 166666), S_OK);
+  ASSERT_EQ(writeBytes(writer, stream, pixels, 1000000, 166666), S_OK);
+  // Without a time a sample follows the previous one; without a duration it lasts one frame.
+  ASSERT_EQ(writeBytes(writer, stream, pixels, 0, -1, false), S_OK);
+  ASSERT_EQ(writeBytes(writer, stream, pixels, 0, -1, false), S_OK);
+  ASSERT_EQ(writer->Finalize(), S_OK);
+  writer->Release();
+  const media::File file = media::probe(path);
+  ASSERT_TRUE(file.opened);
+  const auto& packets = file.streams[0].packets;
+  ASSERT_EQ(packets.size(), 5u);
+  EXPECT_NEAR(packets[0].time, 0.0, 1e-4);
+  EXPECT_NEAR(packets[1].time, 0.033, 1e-4);
+  EXPECT_NEAR(packets[2].time, 0.100, 1e-4);
+  EXPECT_NEAR(packets[3].time, 0.1166666, 1e-4);
+  EXPECT_NEAR(packets[4].time, 0.15, 1e-4);
+  EXPECT_NEAR(packets[2].duration, 1 / 60.0, 1e-4);
+  EXPECT_TRUE(packets[0].key);
+  EXPECT_NEAR(file.duration, 0.15 + 1 / 30.0, 1e-3);
+}
+
+TEST(SinkWriter, RefusesCallsOutOfOrder) {
+  MediaFoundation started;
+  media::TempFolder folder;
+  IMFSinkWriter* writer = createWriter(folder.file("order.mp4"));
+  ASSERT_NE(writer, nullptr);
+  std::vector<uint8_t> pixels(64 * 64 * 4);
+  EXPECT_EQ(writer->BeginWriting(), MF_E_INVALIDREQUEST);  // no stream
+  DWORD stream = 0;
+  IMFMediaType* out = h264Type(64, 64);
+  ASSERT_EQ(writer->AddStream(out, &stream), S_OK);
+  EXPECT_EQ(writeBytes(writer, stream, pixels, 0, 1), MF_E_INVALIDREQUEST);
+  EXPECT_EQ(writer->BeginWriting(), MF_E_TRANSFORM_TYPE_NOT_SET);
+  IMFMediaType* in = rgb32Type(64, 64);
+  EXPECT_EQ(writer->SetInputMediaType(5, in, nullptr), MF_E_INVALIDSTREAMNUMBER);
+  ASSERT_EQ(writer->SetInputMediaType(stream, in, nullptr), S_OK);
+  ASSERT_EQ(writer->BeginWriting(), S_OK);
+  EXPECT_EQ(writer->AddStream(out, &stream), MF_E_INVALIDREQUEST);
+  EXPECT_EQ(writer->SetInputMediaType(stream, in, nullptr), MF_E_INVALIDREQUEST);
+  EXPECT_EQ(writeBytes(writer, 3, pixels, 0, 1), MF_E_INVALIDSTREAMNUMBER);
+  EXPECT_EQ(writeBytes(writer, stream, std::vector<uint8_t>(100), 0, 1), MF_E_BUFFERTOOSMALL);
+  EXPECT_EQ(writeBytes(writer, stream, pixels, 0, 333333), S_OK);
+  EXPECT_EQ(writer->PlaceMarker(stream, nullptr), MF_E_INVALIDREQUEST);
+  EXPECT_EQ(writer->SendStreamTick(stream, 333333), S_OK);
+  MF_SINK_WRITER_STATISTICS statistics{};
+  statistics.cb = sizeof statistics;
+  ASSERT_EQ(writer->GetStatistics(stream, &statistics), S_OK);
+  EXPECT_EQ(statistics.qwNumSamplesReceived, 2u);
+  EXPECT_EQ(statistics.qwNumSamplesProcessed, 1u);
+  EXPECT_EQ(statistics.qwByteCountProcessed, 64u * 64 * 4);
+  EXPECT_EQ(writer->Finalize(), S_OK);
+  EXPECT_EQ(writer->Finalize(), MF_E_INVALIDREQUEST);
+  EXPECT_EQ(writeBytes(writer, stream, pixels, 0, 1), MF_E_INVALIDREQUEST);
+  out->Release();
+  in->Release();
+  writer->Release();
+}
+
+TEST(SinkWriter, RefusesTypesItCannotWrite) {
+  MediaFoundation started;
+  media::TempFolder folder;
+  IMFSinkWriter* writer = createWriter(folder.file("types.mp4"));
+  ASSERT_NE(writer, nullptr);
+  DWORD stream = 0;
+  IMFMediaType* mjpg = h264Type(64, 64);
+  mjpg->SetGUID(MF_MT_SUBTYPE, MFVideoFormat_MJPG);
+  EXPECT_EQ(writer->AddStream(mjpg, &stream), MF_E_INVALIDMEDIATYPE);
+  IMFMediaType* sizeless = h264Type(64, 64);
+  sizeless->DeleteItem(MF_MT_FRAME_SIZE);
+  EXPECT_EQ(writer->AddStream(sizeless, &stream), MF_E_INVALIDMEDIATYPE);
+  IMFMediaType* out = h264Type(64, 64);
+  ASSERT_EQ(writer->AddStream(out, &stream), S_OK);
+  IMFMediaType* in = rgb32Type(64, 64);
+  in->SetGUID(MF_MT_SUBTYPE, MFVideoFormat_MJPG);
+  EXPECT_EQ(writer->SetInputMediaType(stream, in, nullptr), MF_E_INVALIDMEDIATYPE);
+  in->SetGUID(MF_MT_MAJOR_TYPE, MFMediaType_Audio);
+  EXPECT_EQ(writer->SetInputMediaType(stream, in, nullptr), MF_E_INVALIDMEDIATYPE);
+  for (IMFMediaType* type : {mjpg, sizeless, out, in}) type->Release();
+  writer->Release();  // dropped unfinished, as a failed recording leaves it
+}
+
+TEST(SinkWriter, FinalizeWithoutSamplesFails) {
+  MediaFoundation started;
+  media::TempFolder folder;
+  DWORD stream = 0;
+  IMFSinkWriter* writer = videoWriter(folder.file("empty.mp4"), 64, 64, &stream);
+  ASSERT_NE(writer, nullptr);
+  EXPECT_EQ(writer->Finalize(), MF_E_SINK_NO_SAMPLES_PROCESSED);
+  writer->Release();
+}
+
+// ---- AAC ----
+
+IMFMediaType* aacType(UINT32 rate, UINT32 channels, UINT32 bytesPerSecond = 24000) {
+  IMFMediaType* type = nullptr;
+  MFCreateMediaType(&type);
+  type->SetGUID(MF_MT_MAJOR_TYPE, MFMediaType_Audio);
+  type->SetGUID(MF_MT_SUBTYPE, MFAudioFormat_AAC);
+  type->SetUINT32(MF_MT_AUDIO_BITS_PER_SAMPLE, 16);
+  type->SetUINT32(MF_MT_AUDIO_SAMPLES_PER_SECOND, rate);
+  type->SetUINT32(MF_MT_AUDIO_NUM_CHANNELS, channels);
+  type->SetUINT32(MF_MT_AUDIO_AVG_BYTES_PER_SECOND, bytesPerSecond);
+  return type;
+}
+
+IMFSinkWriter* audioWriter(const std::string& path, UINT32 rate, UINT32 channels, WORD tag, WORD bits, DWORD mask,
+                           DWORD* stream) {
+  IMFSinkWriter* writer = createWriter(path);
+  if (!writer) return nullptr;
+  IMFMediaType* out = aacType(rate, channels);
+  EXPECT_EQ(writer->AddStream(out, stream), S_OK);
+  out->Release();
+  WAVEFORMATEX format{};
+  format.wFormatTag = tag;
+  format.nChannels = static_cast<WORD>(channels);
+  format.nSamplesPerSec = rate;
+  format.wBitsPerSample = bits;
+  format.nBlockAlign = static_cast<WORD>(channels * bits / 8);
+  format.nAvgBytesPerSec = rate * format.nBlockAlign;
+  IMFMediaType* in = nullptr;
+  MFCreateMediaType(&in);
+  EXPECT_EQ(MFInitMediaTypeFromWaveFormatEx(in, &format, sizeof format), S_OK);
+  if (mask) in->SetUINT32(MF_MT_AUDIO_CHANNEL_MASK, mask);
+  EXPECT_EQ(writer->SetInputMediaType(*stream, in, nullptr), S_OK);
+  in->Release();
+  EXPECT_EQ(writer->BeginWriting(), S_OK);
+  return writer;
+}
+
+// A sine of `frequency` at amplitude 0.5 in every channel, as bytes of the given sample kind.
+std::vector<uint8_t> sine(double frequency, UINT32 rate, UINT32 channels, WORD tag, WORD bits, int64_t first,
+                          int frames) {
+  std::vector<uint8_t> bytes(static_cast<size_t>(frames) * channels * bits / 8);
+  uint8_t* out = bytes.data();
+  for (int f = 0; f < frames; ++f) {
+    const double value = 0.5 * std::sin(2 * M_PI * frequency * (first + f) / rate);
+    for (UINT32 c = 0; c < channels; ++c) {
+      if (tag == WAVE_FORMAT_IEEE_FLOAT) {
+        const float v = static_cast<float>(value);
+        std::memcpy(out, &v, 4);
+      } else {
+        const int32_t v = static_cast<int32_t>(std::lround(value * ((1LL << (bits - 1)) - 1)));
+        std::memcpy(out, &v, bits / 8);  // little-endian: the low bytes
+      }
+      out += bits / 8;
+    }
+  }
+  return bytes;
+}
+
+struct AudioCase {
+  UINT32 rate;
+  UINT32 channels;
+  WORD tag;
+  WORD bits;
+  DWORD mask;
+};
+
+class AacFile : public testing::TestWithParam<AudioCase> {};
+
+TEST_P(AacFile, KeepsRateChannelsDurationAndTheTone) {
+  const AudioCase c = GetParam();
+  MediaFoundation started;
+  media::TempFolder folder;
+  const std::string path = folder.file("tone.mp4");
+  DWORD stream = 0;
+  IMFSinkWriter* writer = audioWriter(path, c.rate, c.channels, c.tag, c.bits, c.mask, &stream);
+  ASSERT_NE(writer, nullptr);
+  const int packet = static_cast<int>(c.rate / 100);  // 10 ms packets for 2 s
+  for (int i = 0; i < 200; ++i) {
+    const auto bytes = sine(440, c.rate, c.channels, c.tag, c.bits, int64_t(i) * packet, packet);
+    // The first packet carries no time, the rest the time of their first sample.
+    ASSERT_EQ(writeBytes(writer, stream, bytes, i * 100000LL, 0, i != 0), S_OK);
+  }
+  ASSERT_EQ(writer->Finalize(), S_OK);
+  writer->Release();
+
+  const media::File file = media::probe(path);
+  ASSERT_TRUE(file.opened);
+  ASSERT_EQ(file.streams.size(), 1u);
+  EXPECT_EQ(file.streams[0].codec, "aac");
+  EXPECT_EQ(file.streams[0].sampleRate, static_cast<int>(c.rate));
+  EXPECT_EQ(file.streams[0].channels, static_cast<int>(c.channels));
+  EXPECT_NEAR(file.duration, 2.0, 2.0 * 0.03);
+  const double bitsPerSecond = file.streams[0].bytes * 8 / 2.0;
+  EXPECT_LT(bitsPerSecond, 192000 * 1.2);
+
+  const media::Decoded decoded = media::decode(path, AVMEDIA_TYPE_AUDIO);
+  EXPECT_EQ(decoded.errors, 0);
+  ASSERT_EQ(decoded.channels, static_cast<int>(c.channels));
+  for (int ch = 0; ch < decoded.channels; ++ch) {
+    if (decoded.channels == 6 && ch == 3) continue;  // the LFE channel is low-passed by design
+    std::vector<float> mono = media::channel(decoded.samples, decoded.channels, ch);
+    ASSERT_GT(mono.size(), c.rate);
+    mono.assign(mono.begin() + c.rate / 2, mono.begin() + c.rate / 2 + c.rate);  // one second from the middle
+    const double tone = media::power(mono, 440, static_cast<int>(c.rate));
+    EXPECT_NEAR(std::sqrt(tone) * 2, 0.5, 0.05) << "channel " << ch;  // the amplitude comes back
+    for (double other : {220.0, 660.0, 1000.0, 3000.0})
+      EXPECT_LT(media::power(mono, other, static_cast<int>(c.rate)), tone / 1000) << other << " Hz, channel " << ch;
+  }
+}
+
+INSTANTIATE_TEST_SUITE_P(
+    SampleKinds, AacFile,
+    testing::Values(AudioCase{48000, 2, WAVE_FORMAT_IEEE_FLOAT, 32, SPEAKER_FRONT_LEFT | SPEAKER_FRONT_RIGHT},
+                    AudioCase{44100, 1, WAVE_FORMAT_PCM, 16, SPEAKER_FRONT_CENTER},
+                    AudioCase{48000, 2, WAVE_FORMAT_PCM, 24, 0}, AudioCase{48000, 2, WAVE_FORMAT_PCM, 32, 0},
+                    AudioCase{48000, 6, WAVE_FORMAT_IEEE_FLOAT, 32, 0x3F},      // 5.1
+                    AudioCase{48000, 6, WAVE_FORMAT_IEEE_FLOAT, 32, 0x60F}));  // 5.1 with side speakers
+
+TEST(SinkWriter, AudioGapsInSampleTimesBecomeSilence) {
+  MediaFoundation started;
+  media::TempFolder folder;
+  const std::string path = folder.file("gap.mp4");
+  DWORD stream = 0;
+  IMFSinkWriter* writer = audioWriter(path, 48000, 2, WAVE_FORMAT_IEEE_FLOAT, 32, 3, &stream);
+  ASSERT_NE(writer, nullptr);
+  // One second, then one more second stamped to start at 2 s.
+  for (int i = 0; i < 200; ++i) {
+    const LONGLONG time = (i < 100 ? i : i + 100) * 100000LL;
+    const auto bytes = sine(440, 48000, 2, WAVE_FORMAT_IEEE_FLOAT, 32, int64_t(i) * 480, 480);
+    ASSERT_EQ(writeBytes(writer, stream, bytes, time, 0, i != 0), S_OK);
+  }
+  ASSERT_EQ(writer->Finalize(), S_OK);
+  writer->Release();
+  const media::File file = media::probe(path);
+  EXPECT_NEAR(file.duration, 3.0, 0.05);
+  const media::Decoded decoded = media::decode(path, AVMEDIA_TYPE_AUDIO);
+  std::vector<float> left = media::channel(decoded.samples, 2, 0);
+  ASSERT_GT(left.size(), 48000u * 2);
+  std::vector<float> gap(left.begin() + 48000 + 9600, left.begin() + 2 * 48000 - 9600);
+  double energy = 0;
+  for (float x : gap) energy += x * x;
+  EXPECT_LT(energy / gap.size(), 1e-6);
+}
+
+// ---- attribute stores, media types, buffers, samples, collections ----
+
+TEST(Attributes, StoreTypedValuesAndAnswerWithMediaFoundationCodes) {
+  IMFAttributes* attributes = nullptr;
+  ASSERT_EQ(MFCreateAttributes(&attributes, 4), S_OK);
+  const GUID key = MF_MT_AVG_BITRATE, other = MF_MT_SUBTYPE;
+  UINT32 u32 = 0;
+  UINT64 u64 = 0;
+  GUID guid;
+  EXPECT_EQ(attributes->GetUINT32(key, &u32), MF_E_ATTRIBUTENOTFOUND);
+  EXPECT_EQ(attributes->SetUINT32(key, 7), S_OK);
+  EXPECT_EQ(attributes->GetUINT32(key, &u32), S_OK);
+  EXPECT_EQ(u32, 7u);
+  EXPECT_EQ(attributes->GetUINT64(key, &u64), MF_E_INVALIDTYPE);
+  EXPECT_EQ(attributes->SetUINT32(key, 9), S_OK);  // replaces
+  attributes->GetUINT32(key, &u32);
+  EXPECT_EQ(u32, 9u);
+  EXPECT_EQ(attributes->SetGUID(other, MFAudioFormat_AAC), S_OK);
+  EXPECT_EQ(attributes->GetGUID(other, &guid), S_OK);
+  EXPECT_EQ(guid, MFAudioFormat_AAC);
+  EXPECT_EQ(attributes->SetString(MF_MT_USER_DATA, L"name"), S_OK);
+  UINT32 length = 0;
+  EXPECT_EQ(attributes->GetStringLength(MF_MT_USER_DATA, &length), S_OK);
+  EXPECT_EQ(length, 4u);
+  wchar_t small[3];
+  EXPECT_EQ(attributes->GetString(MF_MT_USER_DATA, small, 3, &length), HRESULT_FROM_WIN32(122));
+  LPWSTR text = nullptr;
+  EXPECT_EQ(attributes->GetAllocatedString(MF_MT_USER_DATA, &text, &length), S_OK);
+  EXPECT_EQ(std::wstring(text), L"name");
+  CoTaskMemFree(text);
+  const UINT8 blob[3] = {1, 2, 3};
+  EXPECT_EQ(attributes->SetBlob(MF_MT_MPEG_SEQUENCE_HEADER, blob, 3), S_OK);
+  UINT8* copy = nullptr;
+  EXPECT_EQ(attributes->GetAllocatedBlob(MF_MT_MPEG_SEQUENCE_HEADER, &copy, &length), S_OK);
+  EXPECT_EQ(length, 3u);
+  EXPECT_EQ(copy[2], 3);
+  CoTaskMemFree(copy);
+  EXPECT_EQ(attributes->SetDouble(MF_MT_FRAME_RATE_RANGE_MAX, 2.5), S_OK);
+  IMFAttributes* inner = nullptr;
+  MFCreateAttributes(&inner, 0);
+  EXPECT_EQ(attributes->SetUnknown(MF_MT_FRAME_RATE_RANGE_MIN, inner), S_OK);
+  inner->Release();
+  IMFAttributes* back = nullptr;
+  EXPECT_EQ(attributes->GetUnknown(MF_MT_FRAME_RATE_RANGE_MIN, IID_IMFAttributes, reinterpret_cast<void**>(&back)),
+            S_OK);
+  EXPECT_EQ(back, inner);
+  back->Release();
+  MF_ATTRIBUTE_TYPE type;
+  EXPECT_EQ(attributes->GetItemType(MF_MT_FRAME_RATE_RANGE_MAX, &type), S_OK);
+  EXPECT_EQ(type, MF_ATTRIBUTE_DOUBLE);
+  UINT32 count = 0;
+  attributes->GetCount(&count);
+  EXPECT_EQ(count, 6u);
+  GUID first;
+  EXPECT_EQ(attributes->GetItemByIndex(0, &first, nullptr), S_OK);
+  EXPECT_EQ(first, key);
+  EXPECT_EQ(attributes->GetItemByIndex(6, &first, nullptr), E_INVALIDARG);
+
+  IMFAttributes* copied = nullptr;
+  MFCreateAttributes(&copied, 0);
+  EXPECT_EQ(attributes->CopyAllItems(copied), S_OK);
+  BOOL same = FALSE;
+  EXPECT_EQ(attributes->Compare(copied, MF_ATTRIBUTES_MATCH_ALL_ITEMS, &same), S_OK);
+  EXPECT_TRUE(same);
+  copied->SetUINT32(key, 10);
+  attributes->Compare(copied, MF_ATTRIBUTES_MATCH_ALL_ITEMS, &same);
+  EXPECT_FALSE(same);
+  copied->DeleteItem(key);
+  attributes->Compare(copied, MF_ATTRIBUTES_MATCH_THEIR_ITEMS, &same);
+  EXPECT_TRUE(same);
+  attributes->Compare(copied, MF_ATTRIBUTES_MATCH_OUR_ITEMS, &same);
+  EXPECT_FALSE(same);
+  attributes->Compare(copied, MF_ATTRIBUTES_MATCH_INTERSECTION, &same);
+  EXPECT_TRUE(same);
+  copied->Release();
+  EXPECT_EQ(attributes->DeleteAllItems(), S_OK);
+  attributes->GetCount(&count);
+  EXPECT_EQ(count, 0u);
+  attributes->Release();
+}
+
+TEST(Attributes, MediaTypeFromWaveFormat) {
+  WAVEFORMATEXTENSIBLE format{};
+  format.Format.wFormatTag = WAVE_FORMAT_EXTENSIBLE;
+  format.Format.nChannels = 2;
+  format.Format.nSamplesPerSec = 48000;
+  format.Format.wBitsPerSample = 32;
+  format.Format.nBlockAlign = 8;
+  format.Format.nAvgBytesPerSec = 384000;
+  format.Format.cbSize = 22;
+  format.Samples.wValidBitsPerSample = 32;
+  format.dwChannelMask = 3;
+  format.SubFormat = KSDATAFORMAT_SUBTYPE_IEEE_FLOAT;
+  IMFMediaType* type = nullptr;
+  MFCreateMediaType(&type);
+  EXPECT_EQ(MFInitMediaTypeFromWaveFormatEx(type, &format.Format, 18), E_INVALIDARG);
+  ASSERT_EQ(MFInitMediaTypeFromWaveFormatEx(type, &format.Format, sizeof format), S_OK);
+  GUID subtype;
+  type->GetGUID(MF_MT_SUBTYPE, &subtype);
+  EXPECT_EQ(subtype, MFAudioFormat_Float);
+  UINT32 value = 0;
+  type->GetUINT32(MF_MT_AUDIO_CHANNEL_MASK, &value);
+  EXPECT_EQ(value, 3u);
+  type->GetUINT32(MF_MT_AUDIO_BLOCK_ALIGNMENT, &value);
+  EXPECT_EQ(value, 8u);
+  BOOL compressed = TRUE;
+  type->IsCompressedFormat(&compressed);
+  EXPECT_FALSE(compressed);
+
+  WAVEFORMATEX plain = format.Format;
+  plain.wFormatTag = WAVE_FORMAT_PCM;
+  plain.wBitsPerSample = 16;
+  plain.cbSize = 0;
+  IMFMediaType* pcm = nullptr;
+  MFCreateMediaType(&pcm);
+  ASSERT_EQ(MFInitMediaTypeFromWaveFormatEx(pcm, &plain, sizeof plain), S_OK);
+  pcm->GetGUID(MF_MT_SUBTYPE, &subtype);
+  EXPECT_EQ(subtype, MFAudioFormat_PCM);
+  EXPECT_EQ(pcm->GetUINT32(MF_MT_AUDIO_CHANNEL_MASK, &value), MF_E_ATTRIBUTENOTFOUND);
+  DWORD flags = 0;
+  EXPECT_EQ(type->IsEqual(pcm, &flags), S_FALSE);
+  EXPECT_EQ(flags, MF_MEDIATYPE_EQUAL_MAJOR_TYPES | MF_MEDIATYPE_EQUAL_FORMAT_USER_DATA);
+  EXPECT_EQ(type->IsEqual(type, &flags), S_OK);
+  type->Release();
+  pcm->Release();
+}
+
+TEST(Samples, BuffersTimesAndContiguousCopies) {
+  IMFMediaBuffer* a = nullptr;
+  IMFMediaBuffer* b = nullptr;
+  ASSERT_EQ(MFCreateMemoryBuffer(4, &a), S_OK);
+  ASSERT_EQ(MFCreateMemoryBuffer(8, &b), S_OK);
+  BYTE* data = nullptr;
+  DWORD max = 0, current = 9;
+  a->Lock(&data, &max, &current);
+  EXPECT_EQ(max, 4u);
+  EXPECT_EQ(current, 0u);
+  EXPECT_EQ(reinterpret_cast<uintptr_t>(data) % 16, 0u);
+  std::memcpy(data, "abcd", 4);
+  a->Unlock();
+  EXPECT_EQ(a->SetCurrentLength(5), E_INVALIDARG);
+  a->SetCurrentLength(4);
+  b->Lock(&data, nullptr, nullptr);
+  std::memcpy(data, "ef", 2);
+  b->Unlock();
+  b->SetCurrentLength(2);
+
+  IMFSample* sample = nullptr;
+  MFCreateSample(&sample);
+  LONGLONG time = 0;
+  EXPECT_EQ(sample->GetSampleTime(&time), MF_E_NO_SAMPLE_TIMESTAMP);
+  EXPECT_EQ(sample->GetSampleDuration(&time), MF_E_NO_SAMPLE_DURATION);
+  sample->SetSampleTime(5);
+  EXPECT_EQ(sample->GetSampleTime(&time), S_OK);
+  EXPECT_EQ(time, 5);
+  IMFMediaBuffer* joined = nullptr;
+  EXPECT_EQ(sample->ConvertToContiguousBuffer(&joined), E_UNEXPECTED);
+  sample->AddBuffer(a);
+  sample->AddBuffer(b);
+  DWORD total = 0, count = 0;
+  sample->GetTotalLength(&total);
+  EXPECT_EQ(total, 6u);
+  ASSERT_EQ(sample->ConvertToContiguousBuffer(&joined), S_OK);
+  joined->Lock(&data, nullptr, &current);
+  EXPECT_EQ(std::string(reinterpret_cast<char*>(data), current), "abcdef");
+  joined->Unlock();
+  sample->GetBufferCount(&count);
+  EXPECT_EQ(count, 1u);
+  joined->Release();
+  IMFMediaBuffer* tiny = nullptr;
+  MFCreateMemoryBuffer(2, &tiny);
+  EXPECT_EQ(sample->CopyToBuffer(tiny), MF_E_BUFFERTOOSMALL);
+  tiny->Release();
+  sample->Release();
+  a->Release();
+  b->Release();
+}
+
+TEST(Collections, HoldReferencesInOrder) {
+  IMFCollection* collection = nullptr;
+  ASSERT_EQ(MFCreateCollection(&collection), S_OK);
+  IMFMediaType* first = nullptr;
+  IMFMediaType* second = nullptr;
+  MFCreateMediaType(&first);
+  MFCreateMediaType(&second);
+  collection->AddElement(second);
+  collection->InsertElementAt(0, first);
+  DWORD count = 0;
+  collection->GetElementCount(&count);
+  EXPECT_EQ(count, 2u);
+  IUnknown* element = nullptr;
+  ASSERT_EQ(collection->GetElement(0, &element), S_OK);
+  EXPECT_EQ(element, static_cast<IUnknown*>(first));
+  element->Release();
+  EXPECT_EQ(collection->GetElement(2, &element), E_INVALIDARG);
+  ASSERT_EQ(collection->RemoveElement(1, &element), S_OK);
+  EXPECT_EQ(element, static_cast<IUnknown*>(second));
+  element->Release();
+  collection->Release();
+  first->Release();
+  second->Release();
+}
+
+}  // namespace
