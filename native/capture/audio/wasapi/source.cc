@@ -1,0 +1,263 @@
+#include "capture/audio/wasapi/source.h"
+
+#include <chrono>
+#include <cstring>
+#include <exception>
+#include <iostream>
+#include <stdexcept>
+#include <thread>
+
+#include "capture/audio/formats.h"
+#include "capture/audio/mfencoder.h"
+#include "capture/audio/peaks.h"
+#include "capture/check.h"
+#include "capture/log.h"
+#include "capture/text.h"
+
+namespace capture::audio::wasapi {
+
+namespace {
+
+constexpr const char* kFile = "native/capture/audio/wasapi/source";
+constexpr REFERENCE_TIME kBufferDuration = 1000000;  // 100 ms
+
+void pause() { std::this_thread::sleep_for(std::chrono::microseconds(5000)); }
+
+// The endpoint's mix format as a 40-byte block of our own, whatever cbSize says.
+WAVEFORMATEXTENSIBLE* readMixFormat(IAudioClient* client) {
+  WAVEFORMATEX* mix = nullptr;
+  capture::checkResult(kFile, 390, client->GetMixFormat(&mix), "Could not get mix format from audio client.");
+  auto* copy = new WAVEFORMATEXTENSIBLE;
+  std::memcpy(copy, mix, sizeof(WAVEFORMATEXTENSIBLE));
+  CoTaskMemFree(mix);
+  return copy;
+}
+
+// The outermost frame of both threads: a failure becomes a warning line and ends the thread.
+template <class Body>
+void guarded(Body body) {
+  try {
+    body();
+  } catch (const std::exception& e) {
+    capture::logWarning(*e.what() ? e.what() : nullptr);
+  } catch (...) {
+    capture::logWarning(nullptr);
+  }
+}
+
+void finish(Encoder*& encoder) {
+  Encoder* done = encoder;
+  encoder = nullptr;
+  done->finalize();
+  delete done;
+}
+
+Encoder* makeMFEncoder(const std::string& path, const WAVEFORMATEXTENSIBLE* format) {
+  return new MFEncoder(path, format);
+}
+
+}  // namespace
+
+// The silence thread's share of the source: it never ends, so it must not depend on the source.
+struct Source::Silence {
+  IMMDevice* endpoint;
+  IAudioClient* silenceClient = nullptr;
+  IAudioRenderClient* renderClient = nullptr;
+
+  void run() {
+    capture::checkResult(kFile, 173,
+                         endpoint->Activate(IID_IAudioClient, CLSCTX_ALL, nullptr, reinterpret_cast<void**>(&silenceClient)),
+                         "Could not create audio client.");
+    WAVEFORMATEXTENSIBLE* mix = readMixFormat(silenceClient);
+    HRESULT hr = silenceClient->Initialize(AUDCLNT_SHAREMODE_SHARED, 0, kBufferDuration, 0, &mix->Format, nullptr);
+    delete mix;
+    capture::checkResult(kFile, 178, hr, "Could not initialize the audio client.");
+    UINT32 bufferFrames = 0;
+    capture::checkResult(kFile, 183, silenceClient->GetBufferSize(&bufferFrames), "Could not get the buffer size.");
+    capture::checkResult(kFile, 186,
+                         silenceClient->GetService(IID_IAudioRenderClient, reinterpret_cast<void**>(&renderClient)),
+                         "Could not get the audio capture client service from the audio client.");
+    capture::checkResult(kFile, 189, silenceClient->Start(), "Could not start the audio client.");
+    for (;;) {
+      UINT32 padding = 0;
+      capture::checkResult(kFile, 194, silenceClient->GetCurrentPadding(&padding), "Could not get current padding size.");
+      if (padding < bufferFrames) {
+        const UINT32 frames = bufferFrames - padding;
+        BYTE* data = nullptr;
+        capture::checkResult(kFile, 205, renderClient->GetBuffer(frames, &data), "Unable to get silence buffer.");
+        capture::checkResult(kFile, 206, renderClient->ReleaseBuffer(frames, AUDCLNT_BUFFERFLAGS_SILENT),
+                             "Unable to release silence buffer.");
+      } else {
+        pause();
+      }
+    }
+  }
+};
+
+Source::Source(IMMDevice* endpoint, bool isSelected) : Source(endpoint, isSelected, makeMFEncoder) {}
+
+Source::Source(IMMDevice* endpoint, bool isSelected, EncoderFactory makeEncoder)
+    : endpoint(endpoint), makeEncoder(std::move(makeEncoder)), isSelected(isSelected) {
+  silence = std::make_shared<Silence>();
+  endpoint->AddRef();
+  silence->endpoint = endpoint;
+  std::thread([state = silence] { guarded([&] { state->run(); }); }).detach();
+}
+
+Source::~Source() {
+  if (endpoint) endpoint->Release();
+  if (IAudioClient* client = audioClient.load()) client->Release();
+  if (IAudioCaptureClient* client = captureClient.load()) client->Release();
+  delete format.load();
+  // A recording that capture never took up: dropped without finishing its file.
+  delete encoder.load();
+  delete stopped.load();
+}
+
+int32_t Source::type() { return capture::AudioEndpoint; }
+
+std::string Source::name() {
+  IPropertyStore* store = nullptr;
+  capture::checkResult(kFile, 404, endpoint->OpenPropertyStore(STGM_READ, &store), "Could not open property store");
+  PROPVARIANT value;
+  PropVariantInit(&value);
+  HRESULT hr = store->GetValue(PKEY_Device_FriendlyName, &value);
+  if (FAILED(hr)) store->Release();
+  capture::checkResult(kFile, 416, hr, "Could not get key from property store.");
+  std::string text = value.vt == VT_LPWSTR && value.pwszVal ? capture::toUtf8(value.pwszVal) : std::string();
+  PropVariantClear(&value);
+  store->Release();
+  return text;
+}
+
+void Source::startPreview() { previewing.exchange(true); }
+void Source::stopPreview() { previewing.exchange(false); }
+bool Source::selected() { return isSelected; }
+void Source::stopCapturing() { capturing.exchange(false); }
+void Source::stopEncode() {
+  encoding.exchange(false);
+  if (Encoder* waiting = encoder.exchange(nullptr)) delete stopped.exchange(waiting);
+}
+
+void Source::capture() {
+  if (capturing.exchange(true)) return;
+  std::thread([self = shared_from_this()] { guarded([&] { self->runCapture(); }); }).detach();
+}
+
+void Source::startEncode(std::string filename) {
+  Encoder* made = makeEncoder(filename, format.load());
+  // One still waiting never got a packet; it is replaced without being finalised.
+  delete encoder.exchange(made);
+  encoding.exchange(true);
+}
+
+uint16_t Source::channels() {
+  WAVEFORMATEXTENSIBLE* current = format.load();
+  return current ? current->Format.nChannels : 0;
+}
+
+double Source::peak(int32_t channel) {
+  std::lock_guard<std::mutex> hold(peakLock);
+  return capture::at(peaks, static_cast<size_t>(static_cast<uint32_t>(channel)));
+}
+
+void Source::runCapture() {
+  IAudioClient* client = nullptr;
+  capture::checkResult(kFile, 212, endpoint->Activate(IID_IAudioClient, CLSCTX_ALL, nullptr, reinterpret_cast<void**>(&client)),
+                       "Could not create audio client.");
+  audioClient.exchange(client);
+
+  // The format is completed before it is published: other threads read it without a lock. A block
+  // from an earlier capture stays allocated, since an encoder may still hold it.
+  WAVEFORMATEXTENSIBLE* captureFormat = readMixFormat(client);
+  WAVEFORMATEX* closest = nullptr;
+  if (client->IsFormatSupported(AUDCLNT_SHAREMODE_SHARED, &captureFormat->Format, &closest) == S_FALSE) {
+    captureFormat->Format.wFormatTag = closest->wFormatTag;
+    captureFormat->Format.nChannels = closest->nChannels;
+    captureFormat->Format.nSamplesPerSec = closest->nSamplesPerSec;
+    captureFormat->Format.nAvgBytesPerSec = closest->nAvgBytesPerSec;
+    captureFormat->Format.nBlockAlign = closest->nBlockAlign;
+    captureFormat->Format.wBitsPerSample = closest->wBitsPerSample;
+    describeWaveFormat(closest);
+  }
+  if (closest) CoTaskMemFree(closest);
+  format.exchange(captureFormat);
+  {
+    std::lock_guard<std::mutex> hold(peakLock);
+    peaks.resize(captureFormat->Format.nChannels, 0.0);
+  }
+
+  capture::checkResult(kFile, 240,
+                       client->Initialize(AUDCLNT_SHAREMODE_SHARED, AUDCLNT_STREAMFLAGS_LOOPBACK, kBufferDuration, 0,
+                                          &captureFormat->Format, nullptr),
+                       "Could not initialize the audio client.");
+  IAudioCaptureClient* packets = nullptr;
+  capture::checkResult(kFile, 243, client->GetService(IID_IAudioCaptureClient, reinterpret_cast<void**>(&packets)),
+                       "Could not get the audio capture client service from the audio client.");
+  captureClient.exchange(packets);
+  capture::checkResult(kFile, 246, client->Start(), "Could not start the audio client.");
+
+  // The recording this thread writes. Whatever ends the thread hands it back to the source as if
+  // it had never been taken, so that a later capture thread carries on with it or finishes it.
+  Encoder* writing = nullptr;
+  struct HandBack {
+    Source& source;
+    Encoder*& writing;
+    ~HandBack() {
+      if (!writing) return;
+      std::atomic<Encoder*>& slot = source.encoding.load() ? source.encoder : source.stopped;
+      Encoder* empty = nullptr;
+      if (!slot.compare_exchange_strong(empty, writing)) delete writing;  // a newer one is there
+    }
+  } handBack{*this, writing};
+
+  while (capturing.load()) {
+    BYTE* data = nullptr;
+    UINT32 frames = 0;
+    DWORD flags = 0;
+    UINT64 devicePosition = 0;
+    UINT64 qpcPosition = 0;
+    HRESULT hr = packets->GetBuffer(&data, &frames, &flags, &devicePosition, &qpcPosition);
+    if (hr == AUDCLNT_E_OUT_OF_ORDER) {
+      capture::checkResult(kFile, 259, packets->ReleaseBuffer(0), "Could not release the audio capture client's buffer.");
+      continue;
+    }
+    if (hr == AUDCLNT_E_DEVICE_INVALIDATED) capture::checkResult(kFile, 262, hr, "Audio device is no longer valid for capture.");
+    if (hr == AUDCLNT_E_BUFFER_OPERATION_PENDING) capture::checkResult(kFile, 264, hr, "Audio buffer operation is pending.");
+    if (hr == AUDCLNT_E_SERVICE_NOT_RUNNING) capture::checkResult(kFile, 266, hr, "Audio client service is not running.");
+    if (frames == 0 && hr == AUDCLNT_S_BUFFER_EMPTY) {
+      capture::checkResult(kFile, 271, packets->ReleaseBuffer(0), "Could not release the audio capture client's buffer.");
+      pause();
+      continue;
+    }
+
+    // Silence is handed on as a block of the packet's size whose contents nobody reads as sound.
+    std::unique_ptr<BYTE[]> silent;
+    if (flags & AUDCLNT_BUFFERFLAGS_SILENT) {
+      silent.reset(new BYTE[static_cast<size_t>(captureFormat->Format.nBlockAlign) * frames]);
+      data = silent.get();
+    }
+    if (flags & (AUDCLNT_BUFFERFLAGS_DATA_DISCONTINUITY | AUDCLNT_BUFFERFLAGS_TIMESTAMP_ERROR))
+      std::cout << "Dev Pos: " << devicePosition << "\tClock Pos: " << qpcPosition << std::endl;
+
+    const bool recording = encoding.load();
+    if (basePosition == 0 || !recording) basePosition = qpcPosition;
+    if (recording) {
+      if (Encoder* fresh = encoder.exchange(nullptr)) {
+        // A new recording began before this thread saw the previous one stopped.
+        if (writing) finish(writing);
+        writing = fresh;
+      }
+      if (writing)
+        writing->write(data, frames, &captureFormat->Format, static_cast<int64_t>(qpcPosition - basePosition));
+    } else {
+      if (writing) finish(writing);
+      if (Encoder* never = stopped.exchange(nullptr)) finish(never);
+    }
+    if (previewing.load()) computePeaks(data, frames, captureFormat, peaks, peakLock);
+    silent.reset();
+    capture::checkResult(kFile, 309, packets->ReleaseBuffer(frames), "Could not release the audio capture client's buffer.");
+  }
+}
+
+}  // namespace capture::audio::wasapi

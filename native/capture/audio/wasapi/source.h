@@ -1,0 +1,72 @@
+#pragma once
+
+#include <atomic>
+#include <cstdint>
+#include <functional>
+#include <memory>
+#include <mutex>
+#include <string>
+#include <vector>
+
+#include "capture/audio/encoder.h"
+#include "capture/audio/source.h"
+#include "platform/wasapi.h"
+
+namespace capture::audio::wasapi {
+
+// What one audio playback endpoint plays, by loopback capture. A thread of its own plays silence
+// into the endpoint for the life of the process, so loopback packets keep coming while nothing
+// else plays. Sources live in std::shared_ptr: the capture thread holds its source.
+class Source : public capture::audio::Source, public std::enable_shared_from_this<Source> {
+ public:
+  // Makes the encoder of one recording for a path and the capture format.
+  using EncoderFactory = std::function<Encoder*(const std::string& path, const WAVEFORMATEXTENSIBLE* format)>;
+
+  // Takes over the caller's reference to the endpoint. Starts the silence thread.
+  Source(IMMDevice* endpoint, bool isSelected);
+  Source(IMMDevice* endpoint, bool isSelected, EncoderFactory makeEncoder);
+  ~Source() override;
+
+  int32_t type() override;
+  std::string name() override;
+  void startPreview() override;
+  void stopPreview() override;
+  void capture() override;
+  void stopCapturing() override;
+  void startEncode(std::string filename) override;
+  void stopEncode() override;
+  bool selected() override;
+
+  // 0 until the capture thread has read the format.
+  uint16_t channels() override;
+  double peak(int32_t channel) override;
+
+ private:
+  struct Silence;
+
+  void runCapture();
+
+  IMMDevice* endpoint;
+  // The newest capture thread's clients; each thread works with its own, and a later thread's
+  // replace an earlier one's here without releasing them.
+  std::atomic<IAudioClient*> audioClient{nullptr};
+  std::atomic<IAudioCaptureClient*> captureClient{nullptr};
+  // The silence thread's clients live with that thread, which may outlive the source.
+  std::shared_ptr<Silence> silence;
+  std::atomic<WAVEFORMATEXTENSIBLE*> format{nullptr};
+  // The recording handed between threads: startEncode puts a new encoder here, the capture thread
+  // takes it with its first recorded packet and owns it from then. One that stopEncode finds still
+  // waiting moves to `stopped`, for the capture thread to finalise on its next packet.
+  std::atomic<Encoder*> encoder{nullptr};
+  std::atomic<Encoder*> stopped{nullptr};
+  EncoderFactory makeEncoder;
+  bool isSelected;
+  std::mutex peakLock;
+  std::vector<double> peaks;
+  std::atomic<bool> capturing{false};
+  std::atomic<bool> previewing{false};
+  std::atomic<bool> encoding{false};
+  uint64_t basePosition = 0;
+};
+
+}  // namespace capture::audio::wasapi

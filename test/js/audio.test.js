@@ -1,0 +1,162 @@
+'use strict';
+// Audio playback endpoints from JavaScript: enumeration, level peaks and AAC recordings of what a
+// PulseAudio sink plays.
+const test = require('node:test');
+const assert = require('node:assert');
+const { execFileSync } = require('child_process');
+const fs = require('fs');
+const os = require('os');
+const path = require('path');
+const { runAddon } = require('./addon');
+const { startDesktop } = require('../../scripts/desktop');
+
+const SINKS = [
+  { name: 'tavio_left', description: 'Tavio Left Speaker', rate: 48000, channels: 2 },
+  { name: 'tavio_main', description: 'Tavio Main Speaker', rate: 48000, channels: 2, default: true },
+  { name: 'tavio_mono', description: 'Tavio Mono Speaker', rate: 44100, channels: 1 },
+];
+
+// A sine tone WAV made with sox (which cannot play to PulseAudio here; paplay does that).
+function tone(dir, { frequency = 440, seconds = 5, volume = 0.5, rate = 48000, channels = 2 } = {}) {
+  const file = path.join(dir, `tone-${frequency}-${rate}-${channels}-${seconds}.wav`);
+  if (!fs.existsSync(file)) {
+    execFileSync('sox', ['-n', '-r', String(rate), '-c', String(channels), '-b', '16', file,
+      'synth', String(seconds), 'sine', String(frequency), 'vol', String(volume)]);
+  }
+  return file;
+}
+
+// Script text: starts paplay of `file` into `sink` inside the child and returns the process.
+const play = (file, sink) => `require('child_process').spawn('paplay', ['--device=${sink}', ${JSON.stringify(file)}], { stdio: 'ignore' })`;
+
+const wasapi = (events) => events.filter((e) => e.source.type === 'wasapi').map((e) => e.source);
+
+function probe(file) {
+  const out = execFileSync('ffprobe', ['-v', 'error', '-show_entries',
+    'stream=codec_type,codec_name,sample_rate,channels:format=duration', '-of', 'json', file], { encoding: 'utf8' });
+  return JSON.parse(out);
+}
+
+// Relative power of one frequency in mono float samples (Goertzel).
+function power(samples, rate, frequency) {
+  const k = 2 * Math.cos((2 * Math.PI * frequency) / rate);
+  let s1 = 0;
+  let s2 = 0;
+  for (const x of samples) {
+    const s0 = x + k * s1 - s2;
+    s2 = s1;
+    s1 = s0;
+  }
+  return (s1 * s1 + s2 * s2 - k * s1 * s2) / (samples.length * samples.length);
+}
+
+function decode(file, rate) {
+  const raw = execFileSync('ffmpeg', ['-v', 'error', '-i', file, '-f', 'f32le', '-ac', '1', '-ar', String(rate), '-'],
+    { maxBuffer: 1 << 28 });
+  return new Float32Array(raw.buffer, raw.byteOffset, raw.length / 4);
+}
+
+test('audio endpoints', async (t) => {
+  const desktop = await startDesktop({ display: false, sinks: SINKS });
+  t.after(() => desktop.stop());
+  const env = desktop.env;
+  const dir = fs.mkdtempSync(path.join(os.tmpdir(), 'tavio-audio-'));
+  t.after(() => fs.rmSync(dir, { recursive: true, force: true }));
+
+  await t.test('every sink is a wasapi source, the default first and only it selected', async () => {
+    const { reports, code } = await runAddon('addon.initialize(); report(events);', { env });
+    assert.strictEqual(code, 0);
+    const sources = wasapi(reports[0]);
+    assert.deepStrictEqual(sources.map((s) => [s.name, s.selected]), [
+      ['Tavio Main Speaker', 1], ['Tavio Left Speaker', 0], ['Tavio Mono Speaker', 0]]);
+  });
+
+  await t.test('getPreview of a sink playing a half-scale tone shows both channels near 0.5', async () => {
+    const file = tone(dir, { seconds: 4 });
+    const { reports, code, stdout } = await runAddon(`
+      addon.initialize();
+      const uid = events.find((e) => e.source.type === 'wasapi' && e.source.name === 'Tavio Main Speaker').source.id;
+      const quiet = addon.getPreview(uid);
+      const player = ${play(file, 'tavio_main')};
+      let preview = null;
+      for (let i = 0; i < 300; i++) {
+        await sleep(10);
+        preview = addon.getPreview(uid);
+        if (preview.left > 0.4 && preview.right > 0.4) break;
+      }
+      player.kill();
+      const left = events.find((e) => e.source.name === 'Tavio Left Speaker').source.id;
+      report({ quiet, preview, other: addon.getPreview(left) });`, { env });
+    assert.strictEqual(code, 0, stdout);
+    const { preview, other } = reports[0];
+    assert.deepStrictEqual(Object.keys(preview).sort(), ['0', '1', 'left', 'right']);
+    assert.ok(Math.abs(preview.left - 0.5) < 0.02, `left ${preview.left}`);
+    assert.ok(Math.abs(preview.right - 0.5) < 0.02, `right ${preview.right}`);
+    assert.strictEqual(preview['0'], preview.left);
+    assert.strictEqual(preview['1'], preview.right);
+    // The tone went to one sink only.
+    assert.strictEqual(other.left, 0, JSON.stringify(other));
+  });
+
+  await t.test('a clip recorded while a 440 Hz tone plays is AAC at the sink rate and channels, as long as recorded', async () => {
+    const file = tone(dir, { seconds: 6, rate: 44100, channels: 1 });
+    const clip = path.join(dir, 'clip.mp4');
+    const { reports, code, stdout } = await runAddon(`
+      addon.initialize();
+      const uid = events.find((e) => e.source.name === 'Tavio Mono Speaker').source.id;
+      const player = ${play(file, 'tavio_mono')};
+      for (let i = 0; i < 300 && !(addon.getPreview(uid).left > 0.4); i++) await sleep(10);
+      addon.startCapture(uid, ${JSON.stringify(clip)});
+      const start = Date.now();
+      await sleep(3000);
+      addon.stopCapture(uid);
+      const wall = Date.now() - start;
+      await sleep(500);  // the next packet finishes the file
+      player.kill();
+      report({ wall, clips: events.filter((e) => e.type === 'new-clip').length });`, { env });
+    assert.strictEqual(code, 0, stdout);
+    const { wall, clips } = reports[0];
+    assert.strictEqual(clips, 1);
+    const info = probe(clip);
+    const audio = info.streams.find((s) => s.codec_type === 'audio');
+    assert.strictEqual(audio.codec_name, 'aac');
+    assert.strictEqual(Number(audio.sample_rate), 44100);
+    assert.strictEqual(audio.channels, 1);
+    const seconds = Number(info.format.duration);
+    assert.ok(Math.abs(seconds * 1000 - wall) / wall < 0.05, `file ${seconds} s, recorded ${wall} ms`);
+    const samples = decode(clip, 44100);
+    const at440 = power(samples, 44100, 440);
+    for (const other of [220, 330, 550, 880, 1000]) {
+      assert.ok(at440 > 100 * power(samples, 44100, other), `440 Hz against ${other} Hz`);
+    }
+  });
+});
+
+test('a sink that goes away ends its capture thread with a warning', async () => {
+  const desktop = await startDesktop({ display: false, sinks: [SINKS[1], SINKS[0]] });
+  try {
+    const env = desktop.env;
+    const modules = execFileSync('pactl', ['list', 'short', 'modules'], { env: { ...process.env, ...env }, encoding: 'utf8' });
+    const line = modules.split('\n').find((l) => l.includes('sink_name=tavio_left'));
+    const index = line.split('\t')[0];
+    const { stdout, code } = await runAddon(`
+      addon.initialize();
+      await sleep(500);
+      require('child_process').execFileSync('pactl', ['unload-module', '${index}']);
+      await sleep(500);`, { env });
+    assert.strictEqual(code, 0);
+    const lines = stdout.split('\n');
+    const at = lines.findIndex((l) => /^\d{13}: Warning: /.test(l));
+    assert.ok(at >= 0, stdout);
+    assert.match(lines[at + 1], /^\tnative\/capture\/audio\/wasapi\/source\(262\): 0x88890004: Audio device is no longer valid for capture\./);
+    assert.strictEqual(lines.filter((l) => l.includes('(262)')).length, 1, 'only the vanished sink fails');
+  } finally {
+    desktop.stop();
+  }
+});
+
+test('without a sound server there is no default endpoint', async () => {
+  const { stdout } = await runAddon('addon.initialize(); report(events);',
+    { env: { PULSE_SERVER: `unix:${os.tmpdir()}/no-such-pulse-server`, DISPLAY: '' } });
+  assert.match(stdout, /native\/capture\/audio\/wasapi\/capturemethod\(30\): 0x80070490: Could not get the default device\./);
+});

@@ -1,0 +1,418 @@
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+
+#include <algorithm>
+#include <chrono>
+#include <cstring>
+#include <memory>
+#include <sstream>
+#include <stdexcept>
+#include <string>
+#include <thread>
+#include <vector>
+
+#include "capture/audio/wasapi/source.h"
+#include "fakes/audio.h"
+
+namespace {
+
+using ::testing::HasSubstr;
+
+WAVEFORMATEXTENSIBLE stereoFloat(DWORD rate = 48000) {
+  WAVEFORMATEXTENSIBLE format{};
+  format.Format.wFormatTag = WAVE_FORMAT_EXTENSIBLE;
+  format.Format.nChannels = 2;
+  format.Format.nSamplesPerSec = rate;
+  format.Format.wBitsPerSample = 32;
+  format.Format.nBlockAlign = 8;
+  format.Format.nAvgBytesPerSec = rate * 8;
+  format.Format.cbSize = 22;
+  format.Samples.wValidBitsPerSample = 32;
+  format.dwChannelMask = SPEAKER_FRONT_LEFT | SPEAKER_FRONT_RIGHT;
+  format.SubFormat = KSDATAFORMAT_SUBTYPE_IEEE_FLOAT;
+  return format;
+}
+
+fakes::Packet floats(std::vector<float> samples, UINT64 qpc, DWORD flags = 0, UINT64 device = 0) {
+  fakes::Packet packet;
+  packet.bytes.resize(samples.size() * sizeof(float));
+  if (!samples.empty()) std::memcpy(packet.bytes.data(), samples.data(), packet.bytes.size());
+  packet.frames = static_cast<UINT32>(samples.size() / 2);
+  packet.flags = flags;
+  packet.qpcPosition = qpc;
+  packet.devicePosition = device;
+  return packet;
+}
+
+fakes::Packet answer(HRESULT result) {
+  fakes::Packet packet;
+  packet.result = result;
+  return packet;
+}
+
+// Lines the process wrote to standard output while a test ran a capture thread.
+class Output {
+ public:
+  Output() { testing::internal::CaptureStdout(); }
+  std::vector<std::string> lines() {
+    std::istringstream text(testing::internal::GetCapturedStdout());
+    std::vector<std::string> result;
+    for (std::string line; std::getline(text, line);) result.push_back(line);
+    return result;
+  }
+};
+
+int count(const std::vector<std::string>& lines, const std::string& part) {
+  return static_cast<int>(std::count_if(lines.begin(), lines.end(),
+                                        [&](const std::string& line) { return line.find(part) != std::string::npos; }));
+}
+
+class WasapiSource : public testing::Test {
+ protected:
+  void SetUp() override {
+    audio->mix = stereoFloat();
+    endpoint = new fakes::Endpoint(audio, L"Speakers \U0001F50A");
+    source = std::make_shared<capture::audio::wasapi::Source>(
+        endpoint, true, [this](const std::string& path, const WAVEFORMATEXTENSIBLE* format) {
+          auto log = std::make_shared<fakes::EncoderLog>();
+          log->path = path;
+          encoders.push_back(log);
+          formatsGiven.push_back(format);
+          return new fakes::Encoder(log);
+        });
+  }
+
+  void TearDown() override {
+    if (source) endCapture();
+  }
+
+  // Starts the capture thread and waits until it has read the format and started its client.
+  void startCapture() {
+    source->capture();
+    ASSERT_TRUE(audio->waitFor([&] {
+      return std::any_of(audio->initializations.begin(), audio->initializations.end(),
+                         [](const fakes::AudioLog::Init& init) { return init.flags != 0; }) &&
+             audio->starts >= 1 && source->channels() != 0;
+    }));
+  }
+
+  // Stops the capture thread and waits until it has let go of the source.
+  void endCapture() {
+    std::weak_ptr<capture::audio::wasapi::Source> watch = source;
+    source->stopCapturing();
+    source.reset();
+    const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(10);
+    while (!watch.expired() && std::chrono::steady_clock::now() < deadline)
+      std::this_thread::sleep_for(std::chrono::milliseconds(1));
+    EXPECT_TRUE(watch.expired()) << "the capture thread did not end";
+  }
+
+  void feed(fakes::Packet packet) {
+    const int before = answered();
+    audio->push(std::move(packet));
+    ASSERT_TRUE(audio->waitAnswered(before + 1));
+  }
+
+  int answered() {
+    std::lock_guard<std::mutex> lock(audio->mutex);
+    return audio->answered;
+  }
+
+  std::shared_ptr<fakes::AudioLog> audio = std::make_shared<fakes::AudioLog>();
+  fakes::Endpoint* endpoint = nullptr;
+  std::shared_ptr<capture::audio::wasapi::Source> source;
+  std::vector<std::shared_ptr<fakes::EncoderLog>> encoders;
+  std::vector<const WAVEFORMATEXTENSIBLE*> formatsGiven;
+};
+
+TEST_F(WasapiSource, DescribesItselfBeforeCapture) {
+  EXPECT_EQ(source->type(), 1);
+  EXPECT_TRUE(source->isAudio());
+  EXPECT_FALSE(source->isVideo());
+  EXPECT_TRUE(source->selected());
+  EXPECT_EQ(source->name(), "Speakers \xF0\x9F\x94\x8A");
+  EXPECT_EQ(source->channels(), 0);
+  try {
+    source->peak(0);
+    ADD_FAILURE() << "peak(0) before capture returned";
+  } catch (const std::out_of_range& e) {
+    EXPECT_STREQ(e.what(), "invalid vector<T> subscript");
+  }
+}
+
+TEST_F(WasapiSource, SilenceThreadRefillsWhatThePlaybackBufferLacks) {
+  {
+    std::lock_guard<std::mutex> lock(audio->mutex);
+    audio->paddings = {4800, 1000, 4800, 4700};
+  }
+  ASSERT_TRUE(audio->waitFor([&] { return audio->silenceReleases.size() >= 2; }));
+  std::lock_guard<std::mutex> lock(audio->mutex);
+  ASSERT_GE(audio->initializations.size(), 1u);
+  const fakes::AudioLog::Init& init = audio->initializations.front();
+  EXPECT_EQ(init.mode, AUDCLNT_SHAREMODE_SHARED);
+  EXPECT_EQ(init.flags, 0u);
+  EXPECT_EQ(init.duration, 1000000);
+  EXPECT_EQ(init.periodicity, 0);
+  EXPECT_FALSE(init.sessionGuid);
+  EXPECT_EQ(std::memcmp(&init.format, &audio->mix, sizeof(WAVEFORMATEXTENSIBLE)), 0);
+  EXPECT_EQ(audio->silenceRequests, (std::vector<UINT32>{3800, 100}));
+  EXPECT_EQ(audio->silenceReleases[0], std::make_pair(UINT32{3800}, DWORD{AUDCLNT_BUFFERFLAGS_SILENT}));
+  EXPECT_EQ(audio->silenceReleases[1], std::make_pair(UINT32{100}, DWORD{AUDCLNT_BUFFERFLAGS_SILENT}));
+}
+
+TEST_F(WasapiSource, CaptureOpensLoopbackOnceAndPreviewsPeaks) {
+  startCapture();
+  source->capture();  // already running: no second thread
+  {
+    std::lock_guard<std::mutex> lock(audio->mutex);
+    const auto loopback = std::find_if(audio->initializations.begin(), audio->initializations.end(),
+                                       [](const fakes::AudioLog::Init& init) { return init.flags != 0; });
+    EXPECT_EQ(loopback->flags, AUDCLNT_STREAMFLAGS_LOOPBACK);
+    EXPECT_EQ(loopback->duration, 1000000);
+    EXPECT_EQ(std::memcmp(&loopback->format, &audio->mix, sizeof(WAVEFORMATEXTENSIBLE)), 0);
+  }
+  EXPECT_EQ(source->channels(), 2);
+  EXPECT_EQ(source->peak(0), 0.0);
+  EXPECT_EQ(source->peak(1), 0.0);
+  EXPECT_THROW(source->peak(2), std::out_of_range);
+
+  feed(floats({0.5f, -0.25f}, 100));  // preview off: peaks stay
+  EXPECT_EQ(source->peak(0), 0.0);
+  source->startPreview();
+  feed(floats({0.5f, -0.25f, -0.75f, 0.125f}, 200));
+  EXPECT_EQ(source->peak(0), 0.75);
+  EXPECT_EQ(source->peak(1), 0.25);
+  source->stopPreview();
+  feed(floats({0.0f, 0.0f}, 300));
+  EXPECT_EQ(source->peak(0), 0.75);
+  {
+    std::lock_guard<std::mutex> lock(audio->mutex);
+    EXPECT_EQ(audio->captureReleases, (std::vector<UINT32>{1, 2, 1}));
+  }
+  endCapture();
+  std::lock_guard<std::mutex> lock(audio->mutex);
+  EXPECT_EQ(audio->activations, 2) << "one client for silence, one for capture";
+}
+
+TEST_F(WasapiSource, ClosestMatchReplacesTheWaveFieldsAndIsDescribed) {
+  WAVEFORMATEXTENSIBLE closest = stereoFloat(44100);
+  closest.Format.wFormatTag = WAVE_FORMAT_PCM;
+  closest.Format.nChannels = 1;
+  closest.Format.wBitsPerSample = 16;
+  closest.Format.nBlockAlign = 2;
+  closest.Format.nAvgBytesPerSec = 88200;
+  closest.Format.cbSize = 0;
+  closest.dwChannelMask = 0x4;
+  closest.SubFormat = KSDATAFORMAT_SUBTYPE_PCM;
+  {
+    std::lock_guard<std::mutex> lock(audio->mutex);
+    audio->formatAnswer = S_FALSE;
+    audio->closest = closest;
+  }
+  Output output;
+  startCapture();
+  endCapture();
+  std::vector<std::string> lines = output.lines();
+  std::lock_guard<std::mutex> lock(audio->mutex);
+  const auto loopback = std::find_if(audio->initializations.begin(), audio->initializations.end(),
+                                     [](const fakes::AudioLog::Init& init) { return init.flags != 0; });
+  const WAVEFORMATEX& used = loopback->format.Format;
+  EXPECT_EQ(used.wFormatTag, WAVE_FORMAT_PCM);
+  EXPECT_EQ(used.nChannels, 1);
+  EXPECT_EQ(used.nSamplesPerSec, 44100u);
+  EXPECT_EQ(used.nAvgBytesPerSec, 88200u);
+  EXPECT_EQ(used.nBlockAlign, 2);
+  EXPECT_EQ(used.wBitsPerSample, 16);
+  // The extensible part is the mix format's.
+  EXPECT_EQ(used.cbSize, 22);
+  EXPECT_EQ(loopback->format.dwChannelMask, 3u);
+  EXPECT_TRUE(loopback->format.SubFormat == KSDATAFORMAT_SUBTYPE_IEEE_FLOAT);
+  EXPECT_EQ(count(lines, "Format: 1"), 1);
+  EXPECT_EQ(count(lines, "Channels: 1"), 1);
+  EXPECT_EQ(count(lines, "Samples Per Sec: 44100"), 1);
+  EXPECT_EQ(count(lines, "Size: 0"), 1);
+}
+
+TEST_F(WasapiSource, OtherFormatAnswersAreIgnored) {
+  {
+    std::lock_guard<std::mutex> lock(audio->mutex);
+    audio->formatAnswer = E_FAIL;
+  }
+  Output output;
+  startCapture();
+  endCapture();
+  EXPECT_EQ(count(output.lines(), "Samples Per Sec: "), 0);
+  std::lock_guard<std::mutex> lock(audio->mutex);
+  EXPECT_EQ(std::memcmp(&audio->initializations.back().format, &audio->mix, sizeof(WAVEFORMATEXTENSIBLE)), 0);
+}
+
+// The base follows every packet while not encoding; the first recorded packet keeps the base of
+// the packet before it, and every later one is timed from there.
+TEST_F(WasapiSource, RecordedTimeIsMeasuredFromTheLastPacketBeforeEncoding) {
+  startCapture();
+  feed(floats({0.1f, 0.1f}, 1000));
+  feed(floats({0.1f, 0.1f}, 2000));
+  source->startEncode("clip.mp4");
+  ASSERT_EQ(encoders.size(), 1u);
+  EXPECT_EQ(encoders[0]->path, "clip.mp4");
+  ASSERT_NE(formatsGiven[0], nullptr);
+  EXPECT_EQ(formatsGiven[0]->Format.nSamplesPerSec, 48000u);
+  feed(floats({0.1f, 0.1f}, 3000));
+  feed(floats({0.1f, 0.1f, 0.2f, 0.2f}, 4500));
+  source->stopEncode();
+  {
+    std::lock_guard<std::mutex> lock(encoders[0]->mutex);
+    ASSERT_EQ(encoders[0]->writes.size(), 2u);
+    EXPECT_EQ(encoders[0]->writes[0].time, 1000);
+    EXPECT_EQ(encoders[0]->writes[1].time, 2500);
+    EXPECT_EQ(encoders[0]->writes[1].frames, 2u);
+    EXPECT_EQ(encoders[0]->finalized, 0) << "finalised only by the next packet";
+    EXPECT_FALSE(encoders[0]->deleted);
+  }
+  feed(floats({0.1f, 0.1f}, 6000));
+  {
+    std::lock_guard<std::mutex> lock(encoders[0]->mutex);
+    EXPECT_EQ(encoders[0]->writes.size(), 2u);
+    EXPECT_EQ(encoders[0]->finalized, 1);
+    EXPECT_TRUE(encoders[0]->deleted);
+  }
+  // While not encoding the base follows every packet again.
+  feed(floats({0.1f, 0.1f}, 7000));
+  source->startEncode("second.mp4");
+  feed(floats({0.1f, 0.1f}, 9000));
+  feed(floats({0.1f, 0.1f}, 9250));
+  std::lock_guard<std::mutex> lock(encoders[1]->mutex);
+  ASSERT_EQ(encoders[1]->writes.size(), 2u);
+  EXPECT_EQ(encoders[1]->writes[0].time, 2000);
+  EXPECT_EQ(encoders[1]->writes[1].time, 2250);
+}
+
+TEST_F(WasapiSource, RecordingStoppedBeforeItsFirstPacketIsStillFinalised) {
+  startCapture();
+  source->startEncode("never.mp4");
+  source->stopEncode();
+  feed(floats({0.1f, 0.1f}, 1000));
+  std::lock_guard<std::mutex> lock(encoders[0]->mutex);
+  EXPECT_TRUE(encoders[0]->writes.empty());
+  EXPECT_EQ(encoders[0]->finalized, 1);
+  EXPECT_TRUE(encoders[0]->deleted);
+}
+
+TEST_F(WasapiSource, CaptureStoppedBeforeTheNextPacketLeavesTheEncoderUnfinalised) {
+  startCapture();
+  source->startEncode("cut.mp4");
+  feed(floats({0.1f, 0.1f}, 1000));
+  source->stopEncode();
+  std::shared_ptr<fakes::EncoderLog> log = encoders[0];
+  endCapture();  // drops the last reference: the source is gone
+  std::lock_guard<std::mutex> lock(log->mutex);
+  EXPECT_EQ(log->writes.size(), 1u);
+  EXPECT_EQ(log->finalized, 0);
+}
+
+TEST_F(WasapiSource, SpecialAnswersOfGetBuffer) {
+  startCapture();
+  source->startEncode("clip.mp4");
+  feed(answer(AUDCLNT_E_OUT_OF_ORDER));
+  feed(answer(AUDCLNT_S_BUFFER_EMPTY));
+  // A zero-frame packet with another result goes on to the encoder.
+  feed(floats({}, 5000));
+  fakes::Packet silent = floats({0.9f, 0.9f, 0.9f, 0.9f}, 6000, AUDCLNT_BUFFERFLAGS_SILENT);
+  feed(silent);
+  const uint8_t* original;
+  {
+    std::lock_guard<std::mutex> lock(audio->mutex);
+    original = audio->handedOut;
+    EXPECT_EQ(audio->captureReleases, (std::vector<UINT32>{0, 0, 0, 2}));
+  }
+  std::lock_guard<std::mutex> lock(encoders[0]->mutex);
+  ASSERT_EQ(encoders[0]->writes.size(), 2u);
+  EXPECT_EQ(encoders[0]->writes[0].frames, 0u);
+  EXPECT_EQ(encoders[0]->writes[1].frames, 2u);
+  EXPECT_NE(encoders[0]->writes[1].data, original) << "a silent packet is handed on in a block of its own";
+  EXPECT_EQ(encoders[0]->writes[1].time, 1000);
+}
+
+TEST_F(WasapiSource, DiscontinuityAndTimestampErrorsWriteOnePositionLine) {
+  startCapture();
+  Output output;
+  feed(floats({0.1f, 0.1f}, 12345, AUDCLNT_BUFFERFLAGS_DATA_DISCONTINUITY, 480));
+  feed(floats({0.1f, 0.1f}, 23456, 0, 960));
+  feed(floats({0.1f, 0.1f}, 34567, AUDCLNT_BUFFERFLAGS_TIMESTAMP_ERROR, 1440));
+  std::vector<std::string> lines = output.lines();
+  EXPECT_EQ(count(lines, "Dev Pos: "), 2);
+  EXPECT_EQ(count(lines, "Dev Pos: 480\tClock Pos: 12345"), 1);
+  EXPECT_EQ(count(lines, "Dev Pos: 1440\tClock Pos: 34567"), 1);
+  std::lock_guard<std::mutex> lock(audio->mutex);
+  EXPECT_EQ(audio->captureReleases, (std::vector<UINT32>{1, 1, 1}));
+}
+
+struct Failure {
+  HRESULT result;
+  const char* text;
+};
+
+class WasapiSourceFailure : public WasapiSource, public testing::WithParamInterface<Failure> {};
+
+TEST_P(WasapiSourceFailure, EndsTheCaptureThreadWithAWarning) {
+  startCapture();
+  Output output;
+  audio->push(answer(GetParam().result));
+  std::weak_ptr<capture::audio::wasapi::Source> watch = source;
+  std::shared_ptr<capture::audio::wasapi::Source> kept = source;
+  ASSERT_TRUE(audio->waitAnswered(1));
+  // The thread ends by itself, leaving the flag set: capture() starts nothing new.
+  const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(10);
+  while (kept.use_count() > 2 && std::chrono::steady_clock::now() < deadline)
+    std::this_thread::sleep_for(std::chrono::milliseconds(1));
+  EXPECT_EQ(kept.use_count(), 2) << "the capture thread still holds the source";
+  std::vector<std::string> lines = output.lines();
+  EXPECT_EQ(count(lines, ": Warning: "), 1);
+  EXPECT_EQ(count(lines, GetParam().text), 1);
+  kept->capture();
+  std::this_thread::sleep_for(std::chrono::milliseconds(20));
+  std::lock_guard<std::mutex> lock(audio->mutex);
+  EXPECT_EQ(audio->activations, 2);
+}
+
+INSTANTIATE_TEST_SUITE_P(
+    Results, WasapiSourceFailure,
+    testing::Values(
+        Failure{AUDCLNT_E_DEVICE_INVALIDATED,
+                "native/capture/audio/wasapi/source(262): 0x88890004: Audio device is no longer valid for capture."},
+        Failure{AUDCLNT_E_BUFFER_OPERATION_PENDING,
+                "native/capture/audio/wasapi/source(264): 0x8889000b: Audio buffer operation is pending."},
+        Failure{AUDCLNT_E_SERVICE_NOT_RUNNING,
+                "native/capture/audio/wasapi/source(266): 0x88890010: Audio client service is not running."}));
+
+TEST_F(WasapiSource, UnreadableSamplesEndTheThreadAfterTheEncoderHadThePacket) {
+  {
+    std::lock_guard<std::mutex> lock(audio->mutex);
+    audio->mix.SubFormat = KSDATAFORMAT_SUBTYPE_PCM;
+    audio->mix.Format.wBitsPerSample = 24;
+    audio->mix.Format.nBlockAlign = 6;
+  }
+  startCapture();
+  source->startPreview();
+  source->startEncode("clip.mp4");
+  Output output;
+  fakes::Packet packet;
+  packet.bytes.assign(12, 0x10);
+  packet.frames = 2;
+  audio->push(packet);
+  ASSERT_TRUE(audio->waitFor([&] { return audio->packets.empty(); }));
+  std::shared_ptr<fakes::EncoderLog> log = encoders[0];
+  std::weak_ptr<capture::audio::wasapi::Source> watch = source;
+  source.reset();  // the flag stays set, so only the failure can end the thread
+  const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(10);
+  while (!watch.expired() && std::chrono::steady_clock::now() < deadline)
+    std::this_thread::sleep_for(std::chrono::milliseconds(1));
+  EXPECT_TRUE(watch.expired());
+  EXPECT_EQ(count(output.lines(), "Warning: native/capture/audio/wasapi/source(354): Peaks cannot be calculated"), 1);
+  std::lock_guard<std::mutex> lock(audio->mutex);
+  EXPECT_TRUE(audio->captureReleases.empty()) << "the failing packet is not released";
+  std::lock_guard<std::mutex> encoderLock(log->mutex);
+  EXPECT_EQ(log->writes.size(), 1u);
+}
+
+}  // namespace
