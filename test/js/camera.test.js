@@ -89,6 +89,39 @@ test('cameras and capture-device microphones', async (t) => {
     assert.ok(Math.abs(a.format.duration - seconds) / seconds < 0.05, `audio ${a.format.duration} s for ${seconds} s`);
   });
 
+  await t.test('the picture is upright in the preview and in the recorded file', async () => {
+    // A red band across the top 60 rows of a blue 320x240 picture: an upside-down frame puts it at the bottom.
+    const banner = 'Banner=color=c=blue:size=320x240:rate=30,drawbox=x=0:y=0:w=320:h=60:color=red:t=fill';
+    const file = path.join(dir, 'banner.mp4');
+    const rows = [2, 30, 57, 63, 120, 237];
+    const expected = rows.map((y) => (y < 60 ? 'red' : 'blue'));
+    const isRed = ([r, g, b]) => r > 200 && g < 50 && b < 50;
+    const isBlue = ([r, g, b]) => r < 50 && g < 50 && b > 200;
+    const colour = (pixel) => (isRed(pixel) ? 'red' : isBlue(pixel) ? 'blue' : `other ${pixel}`);
+    const { reports, code } = await runAddon(`
+      addon.initialize();
+      await sleep(1000);
+      const picture = addon.getPreview(0, 320, 240);
+      addon.startCapture(0, ${JSON.stringify(file)});
+      await sleep(1500);
+      addon.stopCapture(0);
+      await sleep(1500);
+      report({ length: picture.length, pixels: ${JSON.stringify(rows)}.map((y) => Array.from(picture.slice((y * 320 + 160) * 4, (y * 320 + 160) * 4 + 3))) });
+    `, { env: { ...desktop.env, TAVIO_TEST_CAMERAS: banner } });
+    assert.strictEqual(code, 0);
+    const preview = reports[0];  // RGBA
+    assert.strictEqual(preview.length, 320 * 240 * 4);
+    assert.deepStrictEqual(preview.pixels.map(colour), expected);
+
+    // First and last decoded frames of the file, as packed RGB rows from the top.
+    for (const select of [[], ['-sseof', '-0.3']]) {
+      const raw = execFileSync('ffmpeg', ['-v', 'error', ...select, '-i', file, '-frames:v', '1', '-f', 'rawvideo', '-pix_fmt', 'rgb24', '-']);
+      assert.strictEqual(raw.length, 320 * 240 * 3);
+      assert.deepStrictEqual(rows.map((y) => colour(Array.from(raw.subarray((y * 320 + 160) * 3, (y * 320 + 160) * 3 + 3)))), expected,
+        `frame ${select.join(' ') || 'first'}`);
+    }
+  });
+
   await t.test('a ".MP4" name records nothing and still sends new-clip', async () => {
     const upper = path.join(dir, 'camera.MP4');
     const { reports, code } = await runAddon(`
