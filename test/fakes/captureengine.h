@@ -1,5 +1,5 @@
-// A capture engine whose source reports a chosen device type and whose sinks remember what they
-// were given, for the capture-engine manager's tests.
+// A capture engine whose source reports a chosen device type and whose record and preview sinks
+// remember what they were given, for the capture-engine manager's tests.
 #pragma once
 
 #include <string>
@@ -75,15 +75,58 @@ class FakeSink : public platform::ComObject<IMFCaptureRecordSink, IID_IMFCapture
   HRESULT SetRotation(DWORD, DWORD) override { return E_NOTIMPL; }
 };
 
+class FakePreviewSink
+    : public platform::ComObject<IMFCapturePreviewSink, IID_IMFCaptureSink, IID_IMFCapturePreviewSink> {
+ public:
+  ~FakePreviewSink() override {
+    for (IMFMediaType* type : added) type->Release();
+    for (IMFCaptureEngineOnSampleCallback* callback : callbacks)
+      if (callback) callback->Release();
+  }
+  std::vector<DWORD> sources;
+  std::vector<IMFMediaType*> added;  // one reference each
+  std::vector<IMFCaptureEngineOnSampleCallback*> callbacks;  // by sink stream index, one reference each
+
+  HRESULT GetOutputMediaType(DWORD, IMFMediaType**) override { return E_NOTIMPL; }
+  HRESULT GetService(DWORD, REFGUID, REFIID, IUnknown**) override { return E_NOTIMPL; }
+  HRESULT AddStream(DWORD source, IMFMediaType* type, IMFAttributes*, DWORD* index) override {
+    sources.push_back(source);
+    type->AddRef();
+    added.push_back(type);
+    callbacks.push_back(nullptr);
+    *index = static_cast<DWORD>(added.size() - 1);
+    return S_OK;
+  }
+  HRESULT Prepare() override { return S_OK; }
+  HRESULT RemoveAllStreams() override { return E_NOTIMPL; }
+  HRESULT SetRenderHandle(HANDLE) override { return E_NOTIMPL; }
+  HRESULT SetRenderSurface(IUnknown*) override { return E_NOTIMPL; }
+  HRESULT UpdateVideo(const MFVideoNormalizedRect*, const RECT*, const COLORREF*) override { return E_NOTIMPL; }
+  HRESULT SetSampleCallback(DWORD index, IMFCaptureEngineOnSampleCallback* callback) override {
+    if (index >= callbacks.size()) return MF_E_INVALIDSTREAMNUMBER;
+    if (callbacks[index]) callbacks[index]->Release();
+    callback->AddRef();
+    callbacks[index] = callback;
+    return S_OK;
+  }
+  HRESULT GetMirrorState(BOOL*) override { return E_NOTIMPL; }
+  HRESULT SetMirrorState(BOOL) override { return E_NOTIMPL; }
+  HRESULT GetRotation(DWORD, DWORD*) override { return E_NOTIMPL; }
+  HRESULT SetRotation(DWORD, DWORD) override { return E_NOTIMPL; }
+  HRESULT SetCustomSink(IMFMediaSink*) override { return E_NOTIMPL; }
+};
+
 class FakeCaptureEngine : public platform::ComObject<IMFCaptureEngine, IID_IMFCaptureEngine> {
  public:
-  FakeCaptureEngine() : source(new FakeCaptureSource), sink(new FakeSink) {}
+  FakeCaptureEngine() : source(new FakeCaptureSource), sink(new FakeSink), preview(new FakePreviewSink) {}
   ~FakeCaptureEngine() override {
     source->Release();
     sink->Release();
+    preview->Release();
   }
   FakeCaptureSource* source;
-  FakeSink* sink;
+  FakeSink* sink;  // the record sink
+  FakePreviewSink* preview;
   int startRecordCalls = 0;
   int getSinkCalls = 0;
 
@@ -96,10 +139,12 @@ class FakeCaptureEngine : public platform::ComObject<IMFCaptureEngine, IID_IMFCa
   }
   HRESULT StopRecord(BOOL, BOOL) override { return S_OK; }
   HRESULT TakePhoto() override { return E_NOTIMPL; }
-  HRESULT GetSink(MF_CAPTURE_ENGINE_SINK_TYPE, IMFCaptureSink** result) override {
+  HRESULT GetSink(MF_CAPTURE_ENGINE_SINK_TYPE type, IMFCaptureSink** result) override {
     ++getSinkCalls;
-    sink->AddRef();
-    *result = sink;
+    IMFCaptureSink* chosen = type == MF_CAPTURE_ENGINE_SINK_TYPE_PREVIEW ? static_cast<IMFCaptureSink*>(preview)
+                                                                          : static_cast<IMFCaptureSink*>(sink);
+    chosen->AddRef();
+    *result = chosen;
     return S_OK;
   }
   HRESULT GetSource(IMFCaptureSource** result) override {

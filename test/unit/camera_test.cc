@@ -324,6 +324,81 @@ TEST(CameraCaptureManager, EngineEventsSetFlagsAndSignalEveryTime) {
   EXPECT_EQ(1u, width);
 }
 
+TEST(CameraCaptureManager, PreviewIsConfiguredOnceAndLaterCallsKeepTheCallersSize) {
+  mfce::CaptureManager manager;
+  auto* engine = new fakes::FakeCaptureEngine;
+  manager.engine = engine;
+  manager.hasVideo = 1;
+  IMFMediaType* yuy2 = videoType(MFVideoFormat_YUY2, 1280, 720, 30, 1);
+  engine->source->videoType = yuy2;
+
+  UINT32 width = 640, height = 480;
+  ASSERT_EQ(S_OK, manager.ConfigurePreview(width, height));
+  EXPECT_EQ(1280u, width);
+  EXPECT_EQ(720u, height);
+  ASSERT_NE(nullptr, manager.previewSink);
+  ASSERT_EQ(1u, engine->preview->added.size());
+  EXPECT_EQ(DWORD{MF_CAPTURE_ENGINE_PREFERRED_SOURCE_STREAM_FOR_VIDEO_PREVIEW}, engine->preview->sources[0]);
+  GUID subtype{};
+  UINT32 independent = 0;
+  engine->preview->added[0]->GetGUID(MF_MT_SUBTYPE, &subtype);
+  EXPECT_EQ(MFVideoFormat_ARGB32, subtype);
+  EXPECT_EQ(S_OK, engine->preview->added[0]->GetUINT32(MF_MT_ALL_SAMPLES_INDEPENDENT, &independent));
+  EXPECT_EQ(1u, independent);
+  EXPECT_EQ(static_cast<IMFCaptureEngineOnSampleCallback*>(manager.videoSampleCallback), engine->preview->callbacks[0]);
+  const int sinkCalls = engine->getSinkCalls;
+
+  // Configured: the answer is S_OK and the caller's values come back as they went in.
+  width = 640;
+  height = 480;
+  EXPECT_EQ(S_OK, manager.ConfigurePreview(width, height));
+  EXPECT_EQ(640u, width);
+  EXPECT_EQ(480u, height);
+  EXPECT_EQ(sinkCalls, engine->getSinkCalls);
+  EXPECT_EQ(1u, engine->preview->added.size());
+
+  engine->source->videoType = nullptr;
+  yuy2->Release();
+  manager.DestroyEngine();
+}
+
+TEST(CameraCaptureManager, APreviewThatFailedAfterGettingItsSinkIsNotConfiguredAgain) {
+  mfce::CaptureManager manager;
+  auto* engine = new fakes::FakeCaptureEngine;
+  manager.engine = engine;
+  manager.hasVideo = 1;
+  manager.hasAudio = 1;  // the fake source has no audio stream: the audio part fails
+  IMFMediaType* yuy2 = videoType(MFVideoFormat_YUY2, 1280, 720, 30, 1);
+  engine->source->videoType = yuy2;
+
+  UINT32 width = 640, height = 480;
+  EXPECT_EQ(MF_E_INVALIDSTREAMNUMBER, manager.ConfigurePreview(width, height));
+  EXPECT_NE(nullptr, manager.previewSink);
+  width = 640;
+  height = 480;
+  EXPECT_EQ(S_OK, manager.ConfigurePreview(width, height));
+  EXPECT_EQ(640u, width);
+  EXPECT_EQ(480u, height);
+  EXPECT_EQ(1u, engine->preview->added.size());
+
+  // While previewing nothing is configured either.
+  mfce::CaptureManager previewing;
+  auto* other = new fakes::FakeCaptureEngine;
+  previewing.engine = other;
+  previewing.hasVideo = 1;
+  other->source->videoType = yuy2;
+  previewing.previewing = true;
+  EXPECT_EQ(S_OK, previewing.ConfigurePreview(width, height));
+  EXPECT_EQ(640u, width);
+  EXPECT_EQ(0, other->getSinkCalls);
+  previewing.previewing = false;
+  other->source->videoType = nullptr;
+  engine->source->videoType = nullptr;
+  yuy2->Release();
+  previewing.DestroyEngine();
+  manager.DestroyEngine();
+}
+
 TEST(CameraCaptureManager, CallbacksAnswerTheirOneInterface) {
   auto* callback = new mfce::CaptureManager::CaptureEngineCB(nullptr);
   void* object = nullptr;
