@@ -5,6 +5,7 @@
 #include <stdexcept>
 
 #include "capture/check.h"
+#include "capture/held.h"
 #include "capture/log.h"
 #include "capture/text.h"
 
@@ -13,17 +14,6 @@ namespace capture::audio {
 namespace {
 
 const char* const file = "native/capture/audio/mfencoder";
-
-// Releases a platform object when the scope ends, however it ends.
-template <class T>
-struct Held {
-  T* object = nullptr;
-  ~Held() { release(); }
-  void release() {
-    if (object) object->Release();
-    object = nullptr;
-  }
-};
 
 }  // namespace
 

@@ -6,6 +6,7 @@
 #include <thread>
 
 #include "capture/check.h"
+#include "capture/held.h"
 
 namespace capture::video::encoder {
 
@@ -15,17 +16,6 @@ const char* const file = "native/capture/video/encoder/mftencoder";
 
 constexpr UINT32 bitRate = 10485760;
 constexpr LONGLONG sampleDuration = 166666;  // 1/60 s, while the stream declares 30 fps: both kept on purpose
-
-// Releases a platform object when the scope ends, however it ends.
-template <class T>
-struct Held {
-  T* object = nullptr;
-  ~Held() { release(); }
-  void release() {
-    if (object) object->Release();
-    object = nullptr;
-  }
-};
 
 }  // namespace
 
