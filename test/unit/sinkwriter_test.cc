@@ -192,6 +192,22 @@ TEST(SinkWriter, CreatesTheFileAtOnceAndTakesTheContainerFromTheAttribute) {
   avformat_close_input(&format);
 }
 
+TEST(SinkWriter, FileNamesOutsideTheBasicPlaneArriveAsUtf8) {
+  MediaFoundation started;
+  media::TempFolder folder;
+  const std::string path = folder.file("clip-\xF0\x9F\x8E\xA5-\xC3\xA9.mp4");  // camera emoji, e acute
+  const std::wstring units = wide(path);
+  EXPECT_EQ(units.size(), folder.path().size() + 1 + 13);  // the emoji is a surrogate pair
+  IMFAttributes* attributes = nullptr;
+  MFCreateAttributes(&attributes, 0);
+  attributes->SetGUID(MF_TRANSCODE_CONTAINERTYPE, MFTranscodeContainerType_MPEG4);
+  IMFSinkWriter* writer = nullptr;
+  ASSERT_EQ(MFCreateSinkWriterFromURL(units.c_str(), nullptr, attributes, &writer), S_OK);
+  attributes->Release();
+  writer->Release();
+  EXPECT_TRUE(std::filesystem::exists(std::filesystem::u8path(path)));
+}
+
 TEST(SinkWriter, H264IsReallyMainWithTheTypesSizeRateAndBitRate) {
   MediaFoundation started;
   media::TempFolder folder;
