@@ -136,10 +136,7 @@ class StreamEncoder {
   virtual ~StreamEncoder() = default;
 
   // The codec parameters the muxer needs, once the encoder is open.
-  HRESULT describe() {
-    HRESULT hr = fromAv(avcodec_parameters_from_context(stream_->codecpar, context_.get()));
-    return hr;
-  }
+  HRESULT describe() { return fromAv(avcodec_parameters_from_context(stream_->codecpar, context_.get())); }
   // One sample's bytes. Times are in 100 ns; hasTime false continues from the previous sample.
   virtual HRESULT write(const uint8_t* data, DWORD length, LONGLONG time, bool hasTime, LONGLONG duration,
                         bool hasDuration) = 0;
@@ -503,7 +500,6 @@ class AudioEncoder : public StreamEncoder {
     blockAlign_ = get32(input, MF_MT_AUDIO_BLOCK_ALIGNMENT, inChannels * bits_ / 8);
     if (blockAlign_ < inChannels * bits_ / 8) return MF_E_INVALIDMEDIATYPE;
     inChannels_ = inChannels;
-    inRate_ = inRate;
 
     const AVCodec* codec = avcodec_find_encoder(AV_CODEC_ID_AAC);
     if (!codec) return MF_E_INVALIDMEDIATYPE;
@@ -610,9 +606,7 @@ class AudioEncoder : public StreamEncoder {
     return drainAudio();
   }
 
-  void flush() override {
-    av_audio_fifo_reset(fifo_.get());
-  }
+  void flush() override { av_audio_fifo_reset(fifo_.get()); }
 
  private:
   HRESULT convert(const uint8_t** in, int frames) {
@@ -676,7 +670,6 @@ class AudioEncoder : public StreamEncoder {
   UINT32 bits_ = 0;
   UINT32 blockAlign_ = 0;
   UINT32 inChannels_ = 0;
-  UINT32 inRate_ = 0;
   UINT32 rate_ = 0;
   AVSampleFormat inFormat_ = AV_SAMPLE_FMT_NONE;
   AVChannelLayout inLayout_{};
