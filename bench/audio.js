@@ -3,21 +3,43 @@
 // CPU and latency of one audio endpoint while it records 48 kHz stereo, against FFmpeg recording
 // the same sink's monitor to AAC at 192 kbit/s in the same run.
 //
-// CPU of the add-on is counted per thread (/proc/<pid>/task/<tid>/stat): the endpoint's capture
-// thread (which also runs the encoder), its silence thread and libpulse's main-loop thread, which
-// does the server I/O for both. Those three are the threads made right after libpulse's
-// "threaded-ml" thread appears, in tid order. FFmpeg's CPU is the whole process (user + system).
-// Latency: a low-latency pacat is already playing silence; the time from writing the first tone
-// bytes to it until getPreview first shows a peak above 0.1 (so it includes pacat's 10 ms buffer).
+// CPU is read per thread (/proc/<pid>/task/<tid>/stat) over the recording. Our threads:
+//   threaded-ml  libpulse's main loop: all server I/O of the loopback and the silence stream;
+//   silence      the source's silence thread (keeps the sink running; FFmpeg has no such thing);
+//   capture      the capture thread, which runs the encoder (conversion, AAC, MP4) as well.
+// They are the three threads made right after "threaded-ml" appears during initialize, in tid
+// order. FFmpeg is the whole process (user + system: its pulse thread, AAC encoder and muxer, and
+// its start-up). Two ratios are printed, both per second of wall time:
+//   all three threads / FFmpeg      what one recording endpoint costs in total;
+//   capture + main loop / FFmpeg    the same work FFmpeg does (read the monitor, encode, mux).
+// The capture thread's CPU is also measured for a few seconds with preview on and recording
+// off, so the encoder's share shows. Voluntary context switches count the wake-ups per thread.
+//
+// Latency: test/tools/tonestart.cc (built here with g++) plays silence into the sink through a
+// 5 ms stream, then tones separated by silence. For each tone it prints the monotonic time at
+// which it wrote the first tone bytes and the time the sink plays them (write time plus the
+// stream's latency from timing information fetched just before the write). The add-on's child
+// polls getPreview every millisecond on the same clock (process.hrtime is CLOCK_MONOTONIC) and
+// notes each rise of the left peak from below 0.01 to above 0.1. Each tone pairs with the first
+// rise after its write. "from write" is an upper bound (it includes the tool's own few ms of
+// queued silence); "from play" is what a listener would call the tone's start. A null sink mixes
+// ahead of its nominal play time, so "from play" can come out below the polling step.
 //   node bench/audio.js [seconds=30]
 const { execFileSync, spawnSync } = require('child_process');
 const fs = require('fs');
 const os = require('os');
 const path = require('path');
 const { startDesktop } = require('../scripts/desktop');
-const { runAddon } = require('../test/js/addon');
+const { runAddon, root } = require('../test/js/addon');
 
 const seconds = Number(process.argv[2] || 30);
+const idleSeconds = 5;
+const tones = 8;
+
+const median = (list) => {
+  const s = [...list].sort((a, b) => a - b);
+  return s.length ? s[Math.floor(s.length / 2)] : NaN;
+};
 
 async function main() {
   const desktop = await startDesktop({
@@ -28,6 +50,8 @@ async function main() {
     const env = { ...process.env, ...desktop.env };
     const tone = path.join(dir, 'tone.wav');
     execFileSync('sox', ['-n', '-r', '48000', '-c', '2', '-b', '16', tone, 'synth', String(seconds + 15), 'sine', '440', 'vol', '0.5']);
+    const tonestart = path.join(dir, 'tonestart');
+    execFileSync('g++', ['-O2', '-o', tonestart, path.join(root, 'test/tools/tonestart.cc'), '-lpulse']);
 
     const clip = path.join(dir, 'addon.mp4');
     const { reports, code, stdout, stderr } = await runAddon(`
@@ -38,6 +62,8 @@ async function main() {
         const fields = stat.slice(stat.lastIndexOf(')') + 2).split(' ');
         return Number(fields[11]) + Number(fields[12]);
       };
+      const wakeups = (tid) => Number(/voluntary_ctxt_switches:\\s+(\\d+)/.exec(
+        fs.readFileSync('/proc/self/task/' + tid + '/status', 'utf8'))[1]);
       const tasks = () => fs.readdirSync('/proc/self/task').map(Number).sort((a, b) => a - b);
       const name = (tid) => fs.readFileSync('/proc/self/task/' + tid + '/comm', 'utf8').trim();
       const before = new Set(tasks());
@@ -46,60 +72,82 @@ async function main() {
       const loop = made.findIndex((t) => name(t) === 'threaded-ml');
       const audio = made.slice(loop, loop + 3);
       const uid = events.find((e) => e.source.type === 'wasapi').source.id;
+      await sleep(500);
 
-      // Latency of the preview.
-      const player = spawn('pacat', ['--device=bench', '--latency-msec=10', '--format=s16le', '--rate=48000', '--channels=2'],
-        { stdio: ['pipe', 'ignore', 'ignore'] });
-      const silence = Buffer.alloc(48000 * 4 / 10);
-      for (let i = 0; i < 10; i++) { player.stdin.write(silence); await sleep(100); }
-      const wave = Buffer.alloc(48000 * 4);
-      for (let i = 0; i < 48000; i++) {
-        const v = Math.round(16383 * Math.sin(2 * Math.PI * 440 * i / 48000));
-        wave.writeInt16LE(v, 4 * i); wave.writeInt16LE(v, 4 * i + 2);
+      // Latency: rises of the peak against the tool's tone times.
+      const tool = spawn(${JSON.stringify(tonestart)}, ['bench', '${tones}', '400', '200'], { stdio: ['ignore', 'pipe', 'inherit'] });
+      let text = '';
+      let ended = false;
+      tool.stdout.on('data', (d) => { text += d; });
+      tool.on('exit', () => { ended = true; });
+      const rises = [];
+      let quiet = false;
+      while (!ended) {
+        const left = addon.getPreview(uid).left;
+        if (left < 0.01) quiet = true;
+        else if (quiet && left > 0.1) { rises.push(process.hrtime.bigint()); quiet = false; }
+        await sleep(1);
       }
-      const written = process.hrtime.bigint();
-      player.stdin.write(wave);
-      let latency = null;
-      while (process.hrtime.bigint() - written < 2000000000n) {
-        if (addon.getPreview(uid).left > 0.1) { latency = Number(process.hrtime.bigint() - written) / 1e6; break; }
-        await new Promise((r) => setImmediate(r));
-      }
-      player.stdin.end();
-      await sleep(200);
+      const toneTimes = text.split('\\n').filter((l) => l.startsWith('tone ')).map((l) => l.split(' ').slice(1).map(BigInt));
+      const latency = toneTimes.map(([written, played]) => {
+        const rise = rises.find((r) => r > written);
+        return rise === undefined ? null : { write: Number(rise - written) / 1e6, play: Number(rise - played) / 1e6 };
+      });
 
       const tonePlayer = spawn('paplay', ['--device=bench', ${JSON.stringify(tone)}], { stdio: 'ignore' });
       await sleep(500);
+      const idleStart = audio.map(ticks);
+      await sleep(${idleSeconds * 1000});
+      const idle = audio.map(ticks).map((e, i) => e - idleStart[i]);
       const start = audio.map(ticks);
+      const startWakeups = audio.map(wakeups);
       const wallStart = Date.now();
       addon.startCapture(uid, ${JSON.stringify(clip)});
       await sleep(${seconds * 1000});
       addon.stopCapture(uid);
       const end = audio.map(ticks);
+      const endWakeups = audio.map(wakeups);
       const wall = (Date.now() - wallStart) / 1000;
       await sleep(300);
       tonePlayer.kill();
-      report({ latency, wall, names: audio.map(name), ticks: end.map((e, i) => e - start[i]) });`,
-    { env: desktop.env, timeoutMs: (seconds + 60) * 1000 });
+      report({ latency, wall, idle, names: audio.map(name), ticks: end.map((e, i) => e - start[i]),
+        wakeups: endWakeups.map((e, i) => e - startWakeups[i]) });`,
+    { env: desktop.env, timeoutMs: (seconds + 90) * 1000 });
     if (code !== 0 || !reports.length) throw new Error(`add-on run failed (${code}): ${stdout}\n${stderr}`);
     const addonRun = reports[0];
+    const recorded = spawnSync('ffprobe', ['-v', 'error', '-show_entries', 'format=duration', '-of', 'csv=p=0', clip], { encoding: 'utf8' });
 
     // FFmpeg on the same sink while the same tone plays.
     const player = require('child_process').spawn('paplay', ['--device=bench', tone], { env, stdio: 'ignore' });
     await new Promise((r) => setTimeout(r, 500));
     const out = path.join(dir, 'ffmpeg.mp4');
-    const timed = spawnSync('/usr/bin/time', ['-f', '%U %S %e', 'ffmpeg', '-v', 'error', '-y', '-f', 'pulse', '-i', 'bench.monitor',
+    const timed = spawnSync('/usr/bin/time', ['-f', '%U %S %e %w', 'ffmpeg', '-v', 'error', '-y', '-f', 'pulse', '-i', 'bench.monitor',
       '-t', String(seconds), '-c:a', 'aac', '-b:a', '192k', out], { env, encoding: 'utf8' });
     player.kill();
-    const [user, system, elapsed] = timed.stderr.trim().split('\n').pop().split(' ').map(Number);
+    const [user, system, elapsed, ffmpegWakeups] = timed.stderr.trim().split('\n').pop().split(' ').map(Number);
 
-    const addonCpu = addonRun.ticks.reduce((a, b) => a + b, 0) / 100;
+    // Threads in tid order: main loop, silence, capture.
+    const cpu = addonRun.ticks.map((t) => t / 100);
+    const [mainLoop, silence, capture] = cpu;
+    const total = mainLoop + silence + capture;
     const ffmpegCpu = user + system;
-    const perThread = addonRun.names.map((n, i) => `${n}:${(addonRun.ticks[i] / 100).toFixed(2)}s`).join(' ');
-    console.log(`recorded ${addonRun.wall.toFixed(1)} s of 48 kHz stereo`);
-    console.log(`add-on  CPU ${addonCpu.toFixed(2)} s (${(100 * addonCpu / addonRun.wall).toFixed(2)} % of a core) [${perThread}]`);
-    console.log(`ffmpeg  CPU ${ffmpegCpu.toFixed(2)} s (${(100 * ffmpegCpu / elapsed).toFixed(2)} % of a core, ${elapsed} s)`);
-    console.log(`ratio add-on / ffmpeg: ${(addonCpu / addonRun.wall / (ffmpegCpu / elapsed)).toFixed(2)} (target <= 1)`);
-    console.log(`preview latency, tone written to first peak: ${addonRun.latency === null ? 'none within 2 s' : addonRun.latency.toFixed(1) + ' ms'} (target < 50 ms)`);
+    const rate = (c) => c / addonRun.wall;
+    const ffmpegRate = ffmpegCpu / elapsed;
+    const labels = ['main loop', 'silence', 'capture'];
+    const perThread = labels.map((n, i) => `${n} ${cpu[i].toFixed(2)} s/${addonRun.wakeups[i]} wake-ups`).join(', ');
+    console.log(`load average ${os.loadavg().map((l) => l.toFixed(2)).join(' ')}`);
+    console.log(`recorded ${addonRun.wall.toFixed(1)} s of 48 kHz stereo (file ${Number(recorded.stdout).toFixed(2)} s)`);
+    console.log(`add-on  CPU ${total.toFixed(2)} s (${(100 * rate(total)).toFixed(2)} % of a core) [${perThread}]`);
+    console.log(`        capture thread with preview only: ${(100 * addonRun.idle[2] / 100 / idleSeconds).toFixed(2)} % of a core ` +
+      `(recording: ${(100 * rate(capture)).toFixed(2)} %)`);
+    console.log(`ffmpeg  CPU ${ffmpegCpu.toFixed(2)} s (${(100 * ffmpegRate).toFixed(2)} % of a core, ${elapsed} s, ${ffmpegWakeups} wake-ups)`);
+    console.log(`ratio all three threads / ffmpeg: ${(rate(total) / ffmpegRate).toFixed(2)} (target <= 1)`);
+    console.log(`ratio capture + main loop / ffmpeg: ${(rate(capture + mainLoop) / ffmpegRate).toFixed(2)}`);
+    const seen = addonRun.latency.filter((l) => l);
+    const list = (key) => seen.map((l) => l[key].toFixed(1)).join(' ');
+    console.log(`latency tone -> first peak, ${seen.length}/${addonRun.latency.length} tones seen (target < 50 ms):`);
+    console.log(`  from write: median ${median(seen.map((l) => l.write)).toFixed(1)} ms [${list('write')}]`);
+    console.log(`  from play:  median ${median(seen.map((l) => l.play)).toFixed(1)} ms [${list('play')}]`);
   } finally {
     desktop.stop();
     fs.rmSync(dir, { recursive: true, force: true });
