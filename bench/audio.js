@@ -3,12 +3,12 @@
 // CPU and latency of one audio endpoint while it records 48 kHz stereo, against FFmpeg recording
 // the same sink's monitor to AAC at 192 kbit/s in the same run.
 //
-// CPU is read per thread (/proc/<pid>/task/<tid>/stat) over the recording. Our threads:
-//   threaded-ml  libpulse's main loop: all server I/O of the loopback and the silence stream;
-//   silence      the source's silence thread (keeps the sink running; FFmpeg has no such thing);
-//   capture      the capture thread, which runs the encoder (conversion, AAC, MP4) as well.
-// They are the three threads made right after "threaded-ml" appears during initialize, in tid
-// order. FFmpeg is the whole process (user + system: its pulse thread, AAC encoder and muxer, and
+// CPU is read per thread (/proc/<pid>/task/<tid>/stat) over the recording. Our threads, by name:
+//   tavio-pulse    libpulse's main loop: all server I/O of the loopback and the silence stream;
+//   tavio-silence  the source's silence thread (keeps the sink running; FFmpeg has no such thing);
+//   tavio-capture  the capture thread, which runs the encoder (conversion, AAC, MP4) as well.
+// (Other libraries start PulseAudio loops of their own during initialize, so position in tid
+// order is no guide.) FFmpeg is the whole process (user + system: its pulse thread, AAC encoder and muxer, and
 // its start-up). Two ratios are printed, both per second of wall time:
 //   all three threads / FFmpeg      what one recording endpoint costs in total;
 //   capture + main loop / FFmpeg    the same work FFmpeg does (read the monitor, encode, mux).
@@ -66,11 +66,12 @@ async function main() {
         fs.readFileSync('/proc/self/task/' + tid + '/status', 'utf8'))[1]);
       const tasks = () => fs.readdirSync('/proc/self/task').map(Number).sort((a, b) => a - b);
       const name = (tid) => fs.readFileSync('/proc/self/task/' + tid + '/comm', 'utf8').trim();
-      const before = new Set(tasks());
       addon.initialize();
-      const made = tasks().filter((t) => !before.has(t));
-      const loop = made.findIndex((t) => name(t) === 'threaded-ml');
-      const audio = made.slice(loop, loop + 3);
+      const audio = ['tavio-pulse', 'tavio-silence', 'tavio-capture'].map((n) => {
+        const found = tasks().filter((t) => name(t) === n);
+        if (found.length !== 1) throw new Error(found.length + ' threads named ' + n);
+        return found[0];
+      });
       const uid = events.find((e) => e.source.type === 'wasapi').source.id;
       await sleep(500);
 
@@ -137,6 +138,9 @@ async function main() {
     const perThread = labels.map((n, i) => `${n} ${cpu[i].toFixed(2)} s/${addonRun.wakeups[i]} wake-ups`).join(', ');
     console.log(`load average ${os.loadavg().map((l) => l.toFixed(2)).join(' ')}`);
     console.log(`recorded ${addonRun.wall.toFixed(1)} s of 48 kHz stereo (file ${Number(recorded.stdout).toFixed(2)} s)`);
+    // A capture thread that failed shows up as a warning line; its CPU figures would mean nothing.
+    const warnings = stdout.split('\n').filter((l) => l.includes('Warning'));
+    if (warnings.length) console.log(`add-on warnings:\n${warnings.join('\n')}`);
     console.log(`add-on  CPU ${total.toFixed(2)} s (${(100 * rate(total)).toFixed(2)} % of a core) [${perThread}]`);
     console.log(`        capture thread with preview only: ${(100 * addonRun.idle[2] / 100 / idleSeconds).toFixed(2)} % of a core ` +
       `(recording: ${(100 * rate(capture)).toFixed(2)} %)`);

@@ -46,6 +46,8 @@ void readServer(pa_context*, const pa_server_info* info, void* data) {
 Connection::Connection() {
   loop_ = pa_threaded_mainloop_new();
   if (!loop_) return;
+  // Our own name, so per-thread figures tell this loop from other libraries' PulseAudio loops.
+  pa_threaded_mainloop_set_name(loop_, "tavio-pulse");
   context_ = pa_context_new(pa_threaded_mainloop_get_api(loop_), "tavio_capture");
   if (!context_) return;
   pa_context_set_state_callback(context_, signalLoop, loop_);

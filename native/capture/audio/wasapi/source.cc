@@ -7,6 +7,10 @@
 #include <stdexcept>
 #include <thread>
 
+#ifdef __linux__
+#include <pthread.h>
+#endif
+
 #include "capture/audio/formats.h"
 #include "capture/audio/mfencoder.h"
 #include "capture/audio/peaks.h"
@@ -22,6 +26,16 @@ constexpr const char* kFile = "native/capture/audio/wasapi/source";
 constexpr REFERENCE_TIME kBufferDuration = 1000000;  // 100 ms
 
 void pause() { std::this_thread::sleep_for(std::chrono::microseconds(5000)); }
+
+// Names the calling thread where the system keeps thread names, so per-thread figures (top -H,
+// /proc) can tell the endpoint's threads apart.
+void nameThread(const char* name) {
+#ifdef __linux__
+  pthread_setname_np(pthread_self(), name);
+#else
+  (void)name;
+#endif
+}
 
 // The endpoint's mix format as a 40-byte block of our own, whatever cbSize says.
 WAVEFORMATEXTENSIBLE* readMixFormat(IAudioClient* client) {
@@ -101,7 +115,10 @@ Source::Source(IMMDevice* endpoint, bool isSelected, EncoderFactory makeEncoder)
   silence = std::make_shared<Silence>();
   endpoint->AddRef();
   silence->endpoint = endpoint;
-  std::thread([state = silence] { guarded([&] { state->run(); }); }).detach();
+  std::thread([state = silence] {
+    nameThread("tavio-silence");
+    guarded([&] { state->run(); });
+  }).detach();
 }
 
 Source::~Source() {
@@ -141,7 +158,10 @@ void Source::stopEncode() {
 
 void Source::capture() {
   if (capturing.exchange(true)) return;
-  std::thread([self = shared_from_this()] { guarded([&] { self->runCapture(); }); }).detach();
+  std::thread([self = shared_from_this()] {
+    nameThread("tavio-capture");
+    guarded([&] { self->runCapture(); });
+  }).detach();
 }
 
 void Source::startEncode(std::string filename) {
