@@ -109,13 +109,15 @@ HRESULT CaptureManager::Initialize(IUnknown* audioDevice, IUnknown* videoDevice)
 }
 
 void CaptureManager::DestroyEngine() {
+  // The engine goes first: once it is released no event handler is left signalling the event
+  // or filling the frame queue while the rest is torn down.
+  releaseAndClear(engine);
   if (engineEvent) {
     CloseHandle(engineEvent);
     engineEvent = nullptr;
   }
   releaseAndClear(videoSampleCallback);
   releaseAndClear(previewSink);
-  releaseAndClear(engine);
   releaseAndClear(eventCallback);
   if (dxgiManager) dxgiManager->ResetDevice(d3dDevice, resetToken);
   releaseAndClear(d3dDevice);

@@ -27,7 +27,7 @@ class CaptureManager {
 
     std::atomic<uint32_t> references{1};
     HWND eventWindow;
-    bool direct = false;
+    std::atomic<bool> direct{false};  // set by the source while the engine may already deliver events
     CaptureManager* manager = nullptr;
 
    protected:
@@ -94,9 +94,10 @@ class CaptureManager {
   std::atomic<double> leftPeak{0.0};
   std::atomic<double> rightPeak{0.0};
   CaptureEngineCB* eventCallback = nullptr;
-  bool previewing = false;
-  bool recording = false;
-  bool photoPending = false;
+  // Written on the engine's thread; a stale signal of engineEvent can end a wait before the write.
+  std::atomic<bool> previewing{false};
+  std::atomic<bool> recording{false};
+  std::atomic<bool> photoPending{false};
   uint32_t errorId = 0;
   HANDLE engineEvent = nullptr;
   HANDLE powerRequest = INVALID_HANDLE_VALUE;

@@ -56,14 +56,16 @@ MFCESource::MFCESource(IMFActivate* audioDevice, IMFActivate* videoDevice, bool 
 MFCESource::~MFCESource() {
   log("MFCESource::~MFCESource() enter...");
   if (captureManager) captureManager->StopPreview();
-  if (frameQueue) {
-    delete frameQueue;
-    frameQueue = nullptr;
-  }
+  // The wait in StopPreview can end early on a stale signal, so the engine may still deliver
+  // pictures: the frame queue goes only after the engine.
   if (captureManager) {
     captureManager->DestroyEngine();
     delete captureManager;
     captureManager = nullptr;
+  }
+  if (frameQueue) {
+    delete frameQueue;
+    frameQueue = nullptr;
   }
   if (audioDevice) {
     audioDevice->Release();
