@@ -70,6 +70,7 @@ constexpr HRESULT RPC_E_CHANGED_MODE = hresult(0x80010106);
 constexpr HRESULT CO_E_NOTINITIALIZED = hresult(0x800401F0);
 constexpr HRESULT REGDB_E_CLASSNOTREG = hresult(0x80040154);
 constexpr HRESULT CLASS_E_NOAGGREGATION = hresult(0x80040110);
+constexpr HRESULT CLASS_E_CLASSNOTAVAILABLE = hresult(0x80040111);
 
 constexpr bool SUCCEEDED(HRESULT hr) { return hr >= 0; }
 constexpr bool FAILED(HRESULT hr) { return hr < 0; }

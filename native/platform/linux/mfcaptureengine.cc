@@ -29,7 +29,6 @@ namespace platform {
 namespace {
 
 constexpr LONGLONG ticksPerSecond = 10000000;  // media times are in 100 ns units
-constexpr HRESULT classNotAvailable = hresult(0x80040111);  // CLASS_E_CLASSNOTAVAILABLE
 
 class MediaEvent : public Attributes<IMFMediaEvent, IID_IMFMediaEvent> {
  public:
@@ -954,7 +953,7 @@ class CaptureEngineClassFactory : public ComObject<IMFCaptureEngineClassFactory,
   HRESULT CreateInstance(REFCLSID clsid, REFIID riid, LPVOID* object) override {
     if (!object) return E_POINTER;
     *object = nullptr;
-    if (clsid != CLSID_MFCaptureEngine) return classNotAvailable;
+    if (clsid != CLSID_MFCaptureEngine) return CLASS_E_CLASSNOTAVAILABLE;
     auto* engine = new CaptureEngine;
     HRESULT hr = engine->QueryInterface(riid, object);
     engine->Release();

@@ -5,6 +5,7 @@
 #include "platform/linux/com.h"
 
 constexpr UINT WM_COMMAND = 0x0111;
+constexpr UINT WM_APP = 0x8000;
 constexpr DWORD ENUM_CURRENT_SETTINGS = 0xFFFFFFFFu;
 constexpr DWORD CCHDEVICENAME = 32;
 constexpr DWORD CCHFORMNAME = 32;

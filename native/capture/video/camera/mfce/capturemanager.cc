@@ -9,8 +9,8 @@ namespace capture::video::camera::mfce {
 
 namespace {
 
-// WM_APP + 1: an engine event posted to the event window, the event pointer in wParam.
-constexpr UINT engineEventMessage = 0x8001;
+// An engine event posted to the event window, the event pointer in wParam.
+constexpr UINT engineEventMessage = WM_APP + 1;
 
 wchar_t powerReason[] = L"CaptureEngine is recording!";
 
@@ -54,13 +54,8 @@ HRESULT CaptureManager::Initialize(IUnknown* audioDevice, IUnknown* videoDevice)
 
   IMFAttributes* attributes = nullptr;
   IMFCaptureEngineClassFactory* factory = nullptr;
-  // 9_3 and 9_2 by value (0x9300, 0x9200): the Linux declarations name only the levels they serve.
-  static const D3D_FEATURE_LEVEL levels[] = {D3D_FEATURE_LEVEL_11_1,
-                                             D3D_FEATURE_LEVEL_11_0,
-                                             D3D_FEATURE_LEVEL_10_1,
-                                             D3D_FEATURE_LEVEL_10_0,
-                                             static_cast<D3D_FEATURE_LEVEL>(0x9300),
-                                             static_cast<D3D_FEATURE_LEVEL>(0x9200),
+  static const D3D_FEATURE_LEVEL levels[] = {D3D_FEATURE_LEVEL_11_1, D3D_FEATURE_LEVEL_11_0, D3D_FEATURE_LEVEL_10_1,
+                                             D3D_FEATURE_LEVEL_10_0, D3D_FEATURE_LEVEL_9_3,  D3D_FEATURE_LEVEL_9_2,
                                              D3D_FEATURE_LEVEL_9_1};
   ID3D11DeviceContext* context = nullptr;
   D3D_FEATURE_LEVEL level{};
