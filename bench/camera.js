@@ -1,0 +1,171 @@
+'use strict';
+// A 1280x720 30 fps test camera previewed and recorded through the add-on, against ffmpeg
+// encoding the same lavfi picture with libx264 at the settings the sink writer uses for a
+// camera recording (superfast, zerolatency, Baseline since the record type names no profile,
+// the estimated 9216000 bit/s with a one-second buffer, a key frame every 2 s, no B-frames),
+// for the same number of frames, in the same run.
+//
+// CPU: the add-on's process, read from /proc/self/stat (utime + stime), over a window of preview
+// only and then over the recording; the recording's cost is its CPU minus the preview-only rate
+// over the same time, divided by the frames in the file. Whole-process CPU, not the engine
+// thread's, because libx264 encodes on threads of its own. A private desktop gives the screen
+// pump a display to wait on, so it does not spin. For ffmpeg, the encode's cost is its CPU minus
+// that of the same source run into the null muxer.
+//
+// Latency: a second test camera draws, in 16 columns, the wall clock in milliseconds (Gray code,
+// so a tick while the columns are drawn gives the old or the new time, never a mix) at the moment
+// its frame leaves the pacing filter; polling getPreview, the picture's time is compared with the
+// clock, while previewing and while recording.
+//   node bench/camera.js [seconds]
+const { spawnSync } = require('child_process');
+const fs = require('fs');
+const os = require('os');
+const path = require('path');
+const { startDesktop } = require('../scripts/desktop');
+const { runAddon } = require('../test/js/addon');
+
+const seconds = Number(process.argv[2] || 20);
+const SOURCE = 'testsrc2=size=1280x720:rate=30';
+const BITRATE = 9216000;  // 1280 / 3 * 720 * 30, the estimate the capture manager asks for
+const X264 = ['-c:v', 'libx264', '-preset', 'superfast', '-tune', 'zerolatency', '-profile:v', 'baseline',
+  '-b:v', String(BITRATE), '-maxrate', String(BITRATE), '-bufsize', String(BITRATE), '-g', '60', '-bf', '0',
+  '-pix_fmt', 'yuv420p'];
+// Bit b of the Gray code of the clock's milliseconds (mod 65536) in column b.
+const CLOCK = 'color=c=black:size=16x9:rate=30,realtime,' +
+  "geq=lum='16+219*mod(floor(mod(time(0)*1000,65536)/pow(2,X))+floor(mod(time(0)*1000,65536)/pow(2,X+1)),2)':cb=128:cr=128," +
+  'scale=1280:720:flags=neighbor';
+
+function stream(file) {
+  const r = spawnSync('ffprobe', ['-v', 'error', '-select_streams', 'v:0', '-count_packets', '-show_entries',
+    'stream=nb_read_packets,profile,bit_rate,width,height', '-of', 'json', file], { encoding: 'utf8' });
+  return JSON.parse(r.stdout).streams[0];
+}
+
+// CPU seconds of an ffmpeg run: `times` prints the shell's and then its children's user and system times.
+function ffmpegCpu(args) {
+  const quoted = args.map((a) => `'${a.replace(/'/g, "'\\''")}'`).join(' ');
+  const run = spawnSync('bash', ['-c', `ffmpeg -v error -y ${quoted} && times`], { encoding: 'utf8' });
+  if (run.status !== 0) throw new Error(`ffmpeg failed: ${run.stderr}`);
+  const m = run.stdout.trim().split('\n').pop().match(/(\d+)m([\d.]+)s (\d+)m([\d.]+)s/);
+  return Number(m[1]) * 60 + Number(m[2]) + Number(m[3]) * 60 + Number(m[4]);
+}
+
+const CHILD_HELPERS = `
+const fs = require('fs');
+const ticks = ${Number(spawnSync('getconf', ['CLK_TCK'], { encoding: 'utf8' }).stdout) || 100};
+const cpu = () => {
+  const stat = fs.readFileSync('/proc/self/stat', 'utf8');
+  const fields = stat.slice(stat.lastIndexOf(')') + 2).split(' ');  // fields from the third (state) on
+  return (Number(fields[11]) + Number(fields[12])) / ticks;  // utime, stime
+};
+const wall = () => (performance.timeOrigin + performance.now()) / 1000;
+`;
+
+function stats(values) {
+  const sorted = [...values].sort((a, b) => a - b);
+  const at = (q) => sorted[Math.min(sorted.length - 1, Math.floor(q * sorted.length))];
+  const mean = values.reduce((s, v) => s + v, 0) / values.length;
+  return `mean ${mean.toFixed(1)} ms, median ${at(0.5).toFixed(1)}, p90 ${at(0.9).toFixed(1)}, ` +
+    `min ${sorted[0].toFixed(1)}, max ${sorted[sorted.length - 1].toFixed(1)} (${values.length} new frames seen)`;
+}
+
+async function main() {
+  const dir = fs.mkdtempSync(path.join(os.tmpdir(), 'tavio-bench-camera-'));
+  const desktop = await startDesktop({ width: 1280, height: 720, microphone: null });
+  try {
+    // CPU per recorded frame.
+    const ours = path.join(dir, 'ours.mp4');
+    const cpuRun = await runAddon(`${CHILD_HELPERS}
+      addon.initialize();
+      const camera = events.find((e) => e.type === 'new source' && e.source.type === 'mfce_video').source;
+      await sleep(3000);  // the engine has opened the device and previews
+      let c0 = cpu(), t0 = wall();
+      await sleep(${seconds * 1000});
+      const idleCpu = cpu() - c0, idleTime = wall() - t0;
+      c0 = cpu(); t0 = wall();
+      addon.startCapture(camera.id, ${JSON.stringify(ours)});
+      await sleep(${seconds * 1000});
+      addon.stopCapture(camera.id);
+      await sleep(1000);  // the file is finished on the engine's thread
+      report({ idleCpu, idleTime, recordCpu: cpu() - c0, recordTime: wall() - t0 });
+    `, { env: { ...desktop.env, TAVIO_TEST_CAMERAS: `Bench Camera=${SOURCE}` }, timeoutMs: (2 * seconds + 60) * 1000 });
+    if (!cpuRun.reports.length) throw new Error(`add-on run failed: ${cpuRun.stderr}`);
+    const { idleCpu, idleTime, recordCpu, recordTime } = cpuRun.reports[0];
+    const ourStream = stream(ours);
+    const frames = Number(ourStream.nb_read_packets);
+    const idleRate = idleCpu / idleTime;
+    const ourMarginal = recordCpu - idleRate * recordTime;
+
+    const theirs = path.join(dir, 'ffmpeg.mp4');
+    const input = ['-re', '-f', 'lavfi', '-i', SOURCE, '-frames:v', String(frames)];
+    const theirCpu = ffmpegCpu([...input, ...X264, theirs]);
+    const theirBase = ffmpegCpu([...input, '-pix_fmt', 'yuv420p', '-f', 'null', '-']);
+    const theirStream = stream(theirs);
+    const theirFrames = Number(theirStream.nb_read_packets);
+    const theirMarginal = theirCpu - theirBase;
+
+    const ms = (cpu, n) => (cpu / n * 1000).toFixed(2);
+    console.log(`tavio_capture: ${frames} frames ${ourStream.width}x${ourStream.height} in ${recordTime.toFixed(1)} s, ` +
+      `profile ${ourStream.profile}, ${ourStream.bit_rate} bit/s`);
+    console.log(`  preview only: ${idleCpu.toFixed(2)} CPU s in ${idleTime.toFixed(1)} s (${(idleRate * 100).toFixed(1)} % of a core)`);
+    console.log(`  recording: ${recordCpu.toFixed(2)} CPU s, ${ms(recordCpu, frames)} CPU ms/frame in all; ` +
+      `over preview: ${ourMarginal.toFixed(2)} CPU s, ${ms(ourMarginal, frames)} CPU ms/frame`);
+    console.log(`ffmpeg libx264: ${theirFrames} frames, profile ${theirStream.profile}, ${theirStream.bit_rate} bit/s`);
+    console.log(`  with encoding: ${theirCpu.toFixed(2)} CPU s, ${ms(theirCpu, theirFrames)} CPU ms/frame in all; ` +
+      `source alone: ${theirBase.toFixed(2)} CPU s; encoding: ${theirMarginal.toFixed(2)} CPU s, ${ms(theirMarginal, theirFrames)} CPU ms/frame`);
+    console.log(`CPU per frame of encoding, ours / ffmpeg: ${((ourMarginal / frames) / (theirMarginal / theirFrames)).toFixed(2)}`);
+    console.log(`CPU per frame in all (source, preview and encoding), ours / ffmpeg: ` +
+      `${((recordCpu / frames) / (theirCpu / theirFrames)).toFixed(2)}`);
+
+    // Preview latency.
+    const latencyFile = path.join(dir, 'latency.mp4');
+    const lat = await runAddon(`${CHILD_HELPERS}
+      addon.initialize();
+      const camera = events.find((e) => e.type === 'new source' && e.source.type === 'mfce_video').source;
+      const W = 320, H = 180;
+      // The clock drawn in the picture, as milliseconds mod 65536, or -1 before the first frame.
+      const drawn = () => {
+        const p = addon.getPreview(camera.id, W, H);
+        if (!p || !p.length) return -1;
+        let gray = 0;
+        for (let b = 0; b < 16; b++) if (p[((H >> 1) * W + 10 + 20 * b) * 4] > 128) gray |= 1 << b;
+        let value = 0;
+        for (let g = gray; g; g >>= 1) value ^= g;
+        return value;
+      };
+      const measure = async (ms) => {
+        const delays = [];
+        let last = -1;
+        const end = Date.now() + ms;
+        while (Date.now() < end) {
+          const value = drawn();
+          const now = wall() * 1000;
+          if (value >= 0 && value !== last) {
+            last = value;
+            delays.push((((Math.floor(now) - value) % 65536) + 65536) % 65536 + (now - Math.floor(now)));
+          }
+          await sleep(1);
+        }
+        return delays;
+      };
+      await sleep(3000);
+      const previewing = await measure(${seconds * 500});
+      addon.startCapture(camera.id, ${JSON.stringify(latencyFile)});
+      await sleep(1000);
+      const recording = await measure(${seconds * 500});
+      addon.stopCapture(camera.id);
+      report({ previewing, recording });
+    `, { env: { ...desktop.env, TAVIO_TEST_CAMERAS: `Clock Camera=${CLOCK}` }, timeoutMs: (seconds + 60) * 1000 });
+    if (!lat.reports.length) throw new Error(`add-on run failed: ${lat.stderr}`);
+    const { previewing, recording } = lat.reports[0];
+    // The first poll that sees a frame comes up to one poll interval (about 1 ms) after it is there.
+    console.log(`preview latency, frame leaves the source -> seen through getPreview (1280x720 camera, 320x180 preview):`);
+    console.log(`  previewing: ${stats(previewing)}`);
+    console.log(`  recording:  ${stats(recording)}`);
+  } finally {
+    desktop.stop();
+    fs.rmSync(dir, { recursive: true, force: true });
+  }
+}
+
+main().catch((e) => { console.error(e); process.exit(1); });
