@@ -41,6 +41,11 @@ CaptureManager::CaptureManager() {
   rightPeak.store(0.0);
 }
 
+// DestroyEngine keeps the audio callback for a later engine; it goes with the manager.
+CaptureManager::~CaptureManager() {
+  if (audioSampleCallback) audioSampleCallback->Release();
+}
+
 HRESULT CaptureManager::Initialize(IUnknown* audioDevice, IUnknown* videoDevice) {
   DestroyEngine();
 

@@ -65,6 +65,7 @@ class CaptureManager {
   };
 
   CaptureManager();
+  ~CaptureManager();
   CaptureManager(const CaptureManager&) = delete;
   CaptureManager& operator=(const CaptureManager&) = delete;
 
