@@ -59,6 +59,7 @@ const Message hresultMessages[] = {
     {0x80010106, "Cannot change thread mode after it is set."},
     {0x800401F0, "CoInitialize has not been called."},
     {0x80040110, "Class does not support aggregation (or class object is remote)"},
+    {0x80040111, "ClassFactory cannot supply requested class"},
     {0x80040154, "Class not registered"},
     // DXGI
     {0x887A0001, "The application made a call that is invalid. Either the parameters of the call or the state of "
