@@ -98,6 +98,42 @@ test('getPreview returns the scaled pattern in red, green, blue, alpha order', a
   });
 });
 
+test('a small window changing over a still pattern shows in place, and the rest of the picture stays', async () => {
+  await withDesktop(async (env, children) => {
+    movePointer(env, 1900, 1000);
+    children.push(await pattern(env, [0, 0, 960, 1080]));
+    const { reports, code, stderr } = await runAddon(`${INIT}
+      await preview(left.id, 960, 1080);
+      const { spawn } = require('child_process');
+      // Blocks of 60 columns at rows 400-499 that move 30 times a second, so most grabs fetch only those rows.
+      const small = spawn(${JSON.stringify(xpattern)}, ['480', '400', '240', '100', '30'], { stdio: ['ignore', 'pipe', 'ignore'] });
+      await new Promise((resolve) => small.stdout.on('data', (d) => { if (String(d).includes('ready')) resolve(); }));
+      const at = (p, x, y) => Array.from(p.slice((y * 960 + x) * 4, (y * 960 + x) * 4 + 4));
+      const looks = [];
+      for (let i = 0; i < 5; i++) {
+        await sleep(150);
+        const p = addon.getPreview(left.id, 960, 1080);
+        looks.push({ inside: [510, 570, 630, 690].map((x) => at(p, x, 450)),
+                     outside: [at(p, 100, 450), at(p, 300, 450), at(p, 800, 450), at(p, 600, 50), at(p, 600, 399), at(p, 600, 500), at(p, 600, 1000)] });
+      }
+      small.kill('SIGTERM');
+      await sleep(500);
+      const p = addon.getPreview(left.id, 960, 1080);
+      report(looks);
+      report([510, 690].map((x) => at(p, x, 450)));
+    `, { env });
+    assert.strictEqual(code, 0, stderr);
+    const [red, green, blue, white] = [[255, 0, 0, 255], [0, 255, 0, 255], [0, 0, 255, 255], [255, 255, 255, 255]];
+    for (const look of reports[0]) {
+      assert.deepStrictEqual(look.outside, [red, green, white, blue, blue, blue, blue]);
+      const names = look.inside.map((c) => JSON.stringify(c));
+      for (const c of look.inside) assert.ok([red, green, blue, white].some((k) => JSON.stringify(k) === JSON.stringify(c)), names.join());
+      assert.strictEqual(new Set(names).size, 4, names.join());
+    }
+    assert.deepStrictEqual(reports[1], [blue, blue]);
+  });
+});
+
 test('mouseCapture switches the pointer in and out of the frames', async () => {
   await withDesktop(async (env, children) => {
     children.push(await pattern(env, [0, 0, 960, 1080]));

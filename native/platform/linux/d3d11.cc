@@ -29,7 +29,10 @@ TextureMemory::~TextureMemory() {
 }
 
 void Texture::copyTo(Texture& destination) {
-  if (memory_ && destination.memory()) std::memcpy(destination.memory()->data(), memory_->data(), memory_->size());
+  if (memory_ && destination.memory()) {
+    std::memcpy(destination.memory()->data(), memory_->data(), memory_->size());
+    destination.memory()->written();
+  }
 }
 
 void Context::CopyResource(ID3D11Resource* destination, ID3D11Resource* source) {
@@ -52,6 +55,7 @@ HRESULT Context::Map(ID3D11Resource* resource, UINT subresource, D3D11_MAP mapTy
       (writes && !(desc.CPUAccessFlags & D3D11_CPU_ACCESS_WRITE))) {
     return E_INVALIDARG;
   }
+  if (writes) texture->memory()->written();
   mapped->pData = texture->memory()->data();
   mapped->RowPitch = desc.Width * 4;
   mapped->DepthPitch = desc.Width * desc.Height * 4;

@@ -18,12 +18,16 @@ class TextureMemory {
   uint8_t* data() const { return data_; }
   size_t size() const { return size_; }
   int fd() const { return fd_; }
+  // Counts writes by copies and mappings, so a grab knows whether the pixels are still its own.
+  uint64_t writes() const { return writes_; }
+  void written() { ++writes_; }
 
  private:
   TextureMemory(int fd, uint8_t* data, size_t size) : fd_(fd), data_(data), size_(size) {}
   int fd_;
   uint8_t* data_;
   size_t size_;
+  uint64_t writes_ = 0;
 };
 
 class Texture : public platform::ComObject<ID3D11Texture2D, IID_ID3D11Resource, IID_ID3D11Texture2D> {

@@ -140,7 +140,19 @@ void Duplication::handle(xcb_generic_event_t* event) {
   uint8_t type = event->response_type & 0x7F;
   if (type == damageEvent_ + XCB_DAMAGE_NOTIFY) {
     auto* notify = reinterpret_cast<xcb_damage_notify_event_t*>(event);
-    if (overlaps(notify->area, monitor_)) drawn_ = true;
+    if (overlaps(notify->area, monitor_)) {
+      const int32_t top = std::max<int32_t>(notify->area.y, monitor_.y) - monitor_.y;
+      const int32_t bottom =
+          std::min<int32_t>(notify->area.y + notify->area.height, monitor_.y + monitor_.height) - monitor_.y;
+      if (drawnTop_ >= drawnBottom_) {
+        drawnTop_ = top;
+        drawnBottom_ = bottom;
+      } else {
+        drawnTop_ = std::min(drawnTop_, top);
+        drawnBottom_ = std::max(drawnBottom_, bottom);
+      }
+      drawn_ = true;
+    }
   } else if (type == xfixesEvent_ + XCB_XFIXES_CURSOR_NOTIFY) {
     shapeChanged_ = true;
   } else if (type == randrEvent_ + XCB_RANDR_SCREEN_CHANGE_NOTIFY || type == randrEvent_ + XCB_RANDR_NOTIFY) {
@@ -314,31 +326,57 @@ bool Duplication::attach(const std::shared_ptr<d3d11::TextureMemory>& memory) {
   return true;
 }
 
+// Full-width rows land in the segment at their own place, so a band of rows keeps the layout.
+bool Duplication::fetch(d3d11::TextureMemory& memory, int32_t top, int32_t rows) {
+  xcb_connection_t* c = connection_.get();
+  const size_t rowBytes = static_cast<size_t>(monitor_.width) * 4;
+  uint8_t* at = memory.data() + static_cast<size_t>(top) * rowBytes;
+  if (shm_) {
+    auto image = own(xcb_shm_get_image_reply(
+        c,
+        xcb_shm_get_image(c, root_, monitor_.x, static_cast<int16_t>(monitor_.y + top), monitor_.width,
+                          static_cast<uint16_t>(rows), ~0u, XCB_IMAGE_FORMAT_Z_PIXMAP, segment_,
+                          static_cast<uint32_t>(top * rowBytes)),
+        nullptr));
+    if (!image) return false;
+  } else {
+    auto image = own(xcb_get_image_reply(c,
+                                         xcb_get_image(c, XCB_IMAGE_FORMAT_Z_PIXMAP, root_, monitor_.x,
+                                                       static_cast<int16_t>(monitor_.y + top), monitor_.width,
+                                                       static_cast<uint16_t>(rows), ~0u),
+                                         nullptr));
+    if (!image || static_cast<size_t>(xcb_get_image_data_length(image.get())) < rowBytes * rows) return false;
+    std::memcpy(at, xcb_get_image_data(image.get()), rowBytes * rows);
+  }
+  // The server leaves the padding byte of a 24-bit pixel at 0; the format promises opaque alpha.
+  auto* pixels = reinterpret_cast<uint32_t*>(at);
+  const size_t count = rowBytes / 4 * rows;
+  for (size_t i = 0; i < count; ++i) pixels[i] |= 0xFF000000u;
+  return true;
+}
+
 void Duplication::grab(d3d11::Texture& destination) {
   const auto& memory = destination.memory();
   size_t bytes = static_cast<size_t>(monitor_.width) * monitor_.height * 4;
   if (!memory || memory->size() < bytes) return;
-  xcb_connection_t* c = connection_.get();
   if (shm_ && !attach(memory)) shm_ = false;
-  if (shm_) {
-    auto image = own(xcb_shm_get_image_reply(
-        c,
-        xcb_shm_get_image(c, root_, monitor_.x, monitor_.y, monitor_.width, monitor_.height, ~0u,
-                          XCB_IMAGE_FORMAT_Z_PIXMAP, segment_, 0),
-        nullptr));
-    if (!image) return;
-  } else {
-    auto image = own(xcb_get_image_reply(c,
-                                         xcb_get_image(c, XCB_IMAGE_FORMAT_Z_PIXMAP, root_, monitor_.x, monitor_.y,
-                                                       monitor_.width, monitor_.height, ~0u),
-                                         nullptr));
-    if (!image || static_cast<size_t>(xcb_get_image_data_length(image.get())) < bytes) return;
-    std::memcpy(memory->data(), xcb_get_image_data(image.get()), bytes);
+  // The memory still holds our last grab when nothing else wrote it since: then only the rows
+  // drawn meanwhile are fetched. A whole grab once a second catches anything that changed the
+  // screen without reporting damage.
+  const auto now = std::chrono::steady_clock::now();
+  const bool ours = grabbed_ && grabbedMemory_.lock() == memory && memory->writes() == grabbedWrites_;
+  const bool whole = !ours || now - wholeGrab_ >= std::chrono::seconds(1);
+  int32_t top = whole ? 0 : drawnTop_;
+  int32_t bottom = whole ? static_cast<int32_t>(monitor_.height) : drawnBottom_;
+  drawnTop_ = drawnBottom_ = 0;
+  if (top < bottom && !fetch(*memory, top, bottom - top)) {
+    grabbed_ = false;  // a failed fetch leaves the memory unknown
+    return;
   }
-  // The server leaves the padding byte of a 24-bit pixel at 0; the format promises opaque alpha.
-  auto* pixels = reinterpret_cast<uint32_t*>(memory->data());
-  size_t count = bytes / 4;
-  for (size_t i = 0; i < count; ++i) pixels[i] |= 0xFF000000u;
+  if (whole) wholeGrab_ = now;
+  grabbed_ = true;
+  grabbedMemory_ = memory;
+  grabbedWrites_ = memory->writes();
 }
 
 }  // namespace platform::dxgi

@@ -6,6 +6,7 @@
 
 #include <xcb/xcb.h>
 
+#include <chrono>
 #include <cstdint>
 #include <memory>
 #include <string>
@@ -41,6 +42,7 @@ class Duplication : public platform::ComObject<IDXGIOutputDuplication, IID_IDXGI
   bool pointerMoved();
   void fetchCursor();
   bool attach(const std::shared_ptr<d3d11::TextureMemory>& memory);
+  bool fetch(d3d11::TextureMemory& memory, int32_t top, int32_t rows);
 
   x11::Connection connection_;
   int screen_;
@@ -67,6 +69,13 @@ class Duplication : public platform::ComObject<IDXGIOutputDuplication, IID_IDXGI
   bool shm_ = false;
   uint32_t segment_ = 0;
   std::shared_ptr<d3d11::TextureMemory> attached_;
+  // Rows of the monitor drawn since the last grab (top inclusive, bottom exclusive); only they
+  // are fetched again while the attached memory still holds the last grab.
+  int32_t drawnTop_ = 0, drawnBottom_ = 0;
+  std::weak_ptr<d3d11::TextureMemory> grabbedMemory_;
+  uint64_t grabbedWrites_ = 0;
+  bool grabbed_ = false;
+  std::chrono::steady_clock::time_point wholeGrab_{};
 };
 
 }  // namespace platform::dxgi
