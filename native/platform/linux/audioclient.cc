@@ -1,6 +1,7 @@
 #include "platform/linux/audioclient.h"
 
 #include <algorithm>
+#include <atomic>
 #include <cstring>
 #include <ctime>
 #include <vector>
@@ -15,9 +16,11 @@ using pulse::Connection;
 using pulse::Lock;
 
 constexpr int64_t kUnitsPerSecond = 10000000;
-// Small server buffers keep loopback packets within milliseconds of what the sink plays; an idle
-// null sink otherwise holds its monitor data back for up to two seconds.
-constexpr int64_t kPlaybackTarget = 200000;   // 20 ms queued ahead of the sink
+// Small record fragments keep loopback packets within milliseconds of what the sink plays; an idle
+// null sink otherwise holds its monitor data back for up to two seconds. The playback target only
+// sets how much silence waits in the server: 100 ms needs far fewer refills (each one a server
+// request and a write the main loop must send) than 20 ms.
+constexpr int64_t kPlaybackTarget = 1000000;  // 100 ms queued ahead of the sink
 constexpr int64_t kRecordFragment = 100000;   // 10 ms fragments from the monitor
 constexpr int64_t kShortestBuffer = 100000;
 // Packet times follow the sample count; when they drift this far from the clock, samples were lost
@@ -28,6 +31,8 @@ constexpr int64_t kDriftLimit = 2000000;
 struct Stream {
   std::shared_ptr<Connection> connection;
   pa_stream* stream = nullptr;
+  // Kept by the state callback, so the checks on every poll cost no libpulse call.
+  std::atomic<pa_stream_state_t> state{PA_STREAM_UNCONNECTED};
   bool loopback = false;
   pa_sample_spec spec{};
   uint32_t frameBytes = 0;
@@ -36,7 +41,13 @@ struct Stream {
   // A packet handed out by GetBuffer and not yet released.
   bool holding = false;
   uint32_t heldFrames = 0;
+  size_t heldBytes = 0;
   std::vector<uint8_t> bytes;
+  // What libpulse would report, kept under the loop lock: the record queue's length, set by the
+  // read callback and lowered by our drops; the bytes the server asked for, set by the write
+  // callback and lowered by our writes.
+  size_t readable = 0;
+  size_t writable = 0;
   // Capture timing: frames released so far, and the time line they lie on.
   UINT64 position = 0;
   bool anchored = false;
@@ -46,23 +57,33 @@ struct Stream {
   ~Stream() {
     if (!stream) return;
     Lock lock(*connection);
-    pa_stream_set_state_callback(stream, nullptr, nullptr);
+    clearCallbacks(stream);
     pa_stream_disconnect(stream);
     pa_stream_unref(stream);
   }
 
-  // The sink or the server went away.
-  bool invalid() {
-    return pa_context_get_state(connection->context()) != PA_CONTEXT_READY ||
-           !PA_STREAM_IS_GOOD(pa_stream_get_state(stream));
+  static void clearCallbacks(pa_stream* stream) {
+    pa_stream_set_state_callback(stream, nullptr, nullptr);
+    pa_stream_set_read_callback(stream, nullptr, nullptr);
+    pa_stream_set_write_callback(stream, nullptr, nullptr);
   }
+
+  // The sink or the server went away.
+  bool invalid() const { return !connection->ready() || !PA_STREAM_IS_GOOD(state.load(std::memory_order_acquire)); }
 
   uint32_t bytesOf(int64_t units) const {
     return static_cast<uint32_t>(units * spec.rate / kUnitsPerSecond) * frameBytes;
   }
 };
 
-void signalStream(pa_stream*, void* loop) { pa_threaded_mainloop_signal(static_cast<pa_threaded_mainloop*>(loop), 0); }
+// These run on the main loop's thread, which holds the loop lock.
+void streamStateChanged(pa_stream* stream, void* data) {
+  auto* s = static_cast<Stream*>(data);
+  s->state.store(pa_stream_get_state(stream), std::memory_order_release);
+  pa_threaded_mainloop_signal(s->connection->loop(), 0);
+}
+void streamReadable(pa_stream*, size_t bytes, void* data) { static_cast<Stream*>(data)->readable = bytes; }
+void streamWritable(pa_stream*, size_t bytes, void* data) { static_cast<Stream*>(data)->writable = bytes; }
 
 class CaptureClient : public ComObject<IAudioCaptureClient, IID_IAudioCaptureClient> {
  public:
@@ -78,7 +99,8 @@ class CaptureClient : public ComObject<IAudioCaptureClient, IID_IAudioCaptureCli
     if (s_->holding) return AUDCLNT_E_OUT_OF_ORDER;
     const void* bytes = nullptr;
     size_t size = 0;
-    if (pa_stream_peek(s_->stream, &bytes, &size) < 0) return AUDCLNT_E_DEVICE_INVALIDATED;
+    // Most polls find the queue empty; those need not ask libpulse.
+    if (s_->readable > 0 && pa_stream_peek(s_->stream, &bytes, &size) < 0) return AUDCLNT_E_DEVICE_INVALIDATED;
     const UINT64 now = performanceCounterPosition();
     if (devicePosition) *devicePosition = s_->position;
     if (size == 0) {
@@ -96,6 +118,7 @@ class CaptureClient : public ComObject<IAudioCaptureClient, IID_IAudioCaptureCli
     }
     // The first frame of this packet arrived as long ago as everything queued behind it lasts.
     const size_t queued = pa_stream_readable_size(s_->stream);
+    s_->readable = queued;
     const int64_t queuedUnits = static_cast<int64_t>(queued / s_->frameBytes) * kUnitsPerSecond / s_->spec.rate;
     const UINT64 measured = now - static_cast<UINT64>(std::max<int64_t>(queuedUnits, 0));
     UINT64 time = s_->anchorTime + (s_->position - s_->anchorPosition) * kUnitsPerSecond / s_->spec.rate;
@@ -110,6 +133,7 @@ class CaptureClient : public ComObject<IAudioCaptureClient, IID_IAudioCaptureCli
     *frames = count;
     s_->holding = true;
     s_->heldFrames = count;
+    s_->heldBytes = size;
     return S_OK;
   }
 
@@ -125,6 +149,7 @@ class CaptureClient : public ComObject<IAudioCaptureClient, IID_IAudioCaptureCli
     s_->holding = false;
     if (s_->invalid()) return AUDCLNT_E_DEVICE_INVALIDATED;
     pa_stream_drop(s_->stream);
+    s_->readable -= std::min(s_->readable, s_->heldBytes);
     s_->position += framesRead;
     return S_OK;
   }
@@ -154,7 +179,7 @@ class RenderClient : public ComObject<IAudioRenderClient, IID_IAudioRenderClient
     Lock lock(*s_->connection);
     if (s_->invalid()) return AUDCLNT_E_DEVICE_INVALIDATED;
     if (s_->holding) return AUDCLNT_E_OUT_OF_ORDER;
-    const size_t writable = pa_stream_writable_size(s_->stream) / s_->frameBytes;
+    const size_t writable = s_->writable / s_->frameBytes;
     if (framesRequested > std::min<size_t>(writable, s_->bufferFrames)) return AUDCLNT_E_BUFFER_TOO_LARGE;
     if (s_->bytes.size() < static_cast<size_t>(framesRequested) * s_->frameBytes)
       s_->bytes.resize(static_cast<size_t>(framesRequested) * s_->frameBytes);
@@ -175,6 +200,7 @@ class RenderClient : public ComObject<IAudioRenderClient, IID_IAudioRenderClient
     if (flags & AUDCLNT_BUFFERFLAGS_SILENT) std::memset(s_->bytes.data(), 0, size);
     if (pa_stream_write(s_->stream, s_->bytes.data(), size, nullptr, 0, PA_SEEK_RELATIVE) < 0)
       return AUDCLNT_E_DEVICE_INVALIDATED;
+    s_->writable -= std::min(s_->writable, size);
     return S_OK;
   }
 
@@ -213,7 +239,9 @@ class AudioClient : public ComObject<IAudioClient, IID_IAudioClient> {
     if (pa_context_get_state(s.connection->context()) != PA_CONTEXT_READY) return AUDCLNT_E_DEVICE_INVALIDATED;
     pa_stream* stream = pa_stream_new(s.connection->context(), s.loopback ? "Loopback" : "Playback", &spec, &map);
     if (!stream) return AUDCLNT_E_UNSUPPORTED_FORMAT;
-    pa_stream_set_state_callback(stream, signalStream, s.connection->loop());
+    pa_stream_set_state_callback(stream, streamStateChanged, &s);
+    if (s.loopback) pa_stream_set_read_callback(stream, streamReadable, &s);
+    else pa_stream_set_write_callback(stream, streamWritable, &s);
     pa_buffer_attr attr;
     attr.maxlength = static_cast<uint32_t>(-1);
     attr.prebuf = static_cast<uint32_t>(-1);
@@ -232,11 +260,12 @@ class AudioClient : public ComObject<IAudioClient, IID_IAudioClient> {
       state = pa_stream_get_state(stream);
     }
     if (state != PA_STREAM_READY) {
-      pa_stream_set_state_callback(stream, nullptr, nullptr);
+      Stream::clearCallbacks(stream);
       pa_stream_disconnect(stream);
       pa_stream_unref(stream);
       return AUDCLNT_E_DEVICE_INVALIDATED;
     }
+    s.state.store(state, std::memory_order_release);
     s.stream = stream;
     return S_OK;
   }
@@ -265,7 +294,7 @@ class AudioClient : public ComObject<IAudioClient, IID_IAudioClient> {
     if (s_->loopback) {
       *frames = static_cast<UINT32>(pa_stream_readable_size(s_->stream) / s_->frameBytes);
     } else {
-      const size_t writable = pa_stream_writable_size(s_->stream) / s_->frameBytes;
+      const size_t writable = s_->writable / s_->frameBytes;
       *frames = s_->bufferFrames - static_cast<UINT32>(std::min<size_t>(writable, s_->bufferFrames));
     }
     return S_OK;
@@ -307,6 +336,8 @@ class AudioClient : public ComObject<IAudioClient, IID_IAudioClient> {
     if (s_->holding) return AUDCLNT_E_BUFFER_OPERATION_PENDING;
     if (s_->invalid()) return AUDCLNT_E_DEVICE_INVALIDATED;
     s_->connection->wait(pa_stream_flush(s_->stream, nullptr, nullptr));
+    if (s_->loopback) s_->readable = pa_stream_readable_size(s_->stream);
+    else s_->writable = pa_stream_writable_size(s_->stream);
     s_->position = 0;
     s_->anchored = false;
     return S_OK;

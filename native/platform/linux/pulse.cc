@@ -4,7 +4,6 @@ namespace platform::pulse {
 
 namespace {
 
-void signalLoop(pa_context*, void* loop) { pa_threaded_mainloop_signal(static_cast<pa_threaded_mainloop*>(loop), 0); }
 void signalOperation(pa_operation*, void* loop) {
   pa_threaded_mainloop_signal(static_cast<pa_threaded_mainloop*>(loop), 0);
 }
@@ -43,6 +42,12 @@ void readServer(pa_context*, const pa_server_info* info, void* data) {
 
 }  // namespace
 
+void Connection::stateChanged(pa_context* context, void* data) {
+  auto* connection = static_cast<Connection*>(data);
+  connection->state_.store(pa_context_get_state(context), std::memory_order_release);
+  pa_threaded_mainloop_signal(connection->loop_, 0);
+}
+
 Connection::Connection() {
   loop_ = pa_threaded_mainloop_new();
   if (!loop_) return;
@@ -50,7 +55,7 @@ Connection::Connection() {
   pa_threaded_mainloop_set_name(loop_, "tavio-pulse");
   context_ = pa_context_new(pa_threaded_mainloop_get_api(loop_), "tavio_capture");
   if (!context_) return;
-  pa_context_set_state_callback(context_, signalLoop, loop_);
+  pa_context_set_state_callback(context_, stateChanged, this);
   if (pa_context_connect(context_, nullptr, PA_CONTEXT_NOAUTOSPAWN, nullptr) < 0) return;
   if (pa_threaded_mainloop_start(loop_) < 0) return;
   pa_threaded_mainloop_lock(loop_);
@@ -73,9 +78,7 @@ Connection::~Connection() {
 }
 
 bool Connection::connected() {
-  if (!context_) return false;
-  Lock lock(*this);
-  return pa_context_get_state(context_) == PA_CONTEXT_READY;
+  return context_ && ready();
 }
 
 bool Connection::wait(pa_operation* operation) {

@@ -5,6 +5,7 @@
 
 #include <pulse/pulseaudio.h>
 
+#include <atomic>
 #include <memory>
 #include <string>
 #include <vector>
@@ -29,6 +30,9 @@ class Connection {
   Connection& operator=(const Connection&) = delete;
 
   bool connected();
+  // The context's state as its callback last saw it: callers on every poll need no libpulse call
+  // (each one checks for a fork with a system call).
+  bool ready() const { return state_.load(std::memory_order_acquire) == PA_CONTEXT_READY; }
   // Both false when the server is gone or not there.
   bool defaultSink(Sink& sink);
   bool findSink(const std::string& name, Sink& sink);
@@ -43,6 +47,9 @@ class Connection {
  private:
   pa_threaded_mainloop* loop_ = nullptr;
   pa_context* context_ = nullptr;
+  std::atomic<pa_context_state_t> state_{PA_CONTEXT_UNCONNECTED};
+
+  static void stateChanged(pa_context* context, void* connection);
 };
 
 // Holds the main loop lock for a scope.
