@@ -3,6 +3,7 @@
 #include <iomanip>
 #include <iostream>
 #include <limits>
+#include <mutex>
 #include <sstream>
 
 #include "capture/clock.h"
@@ -11,8 +12,14 @@ namespace capture {
 
 namespace {
 
+// Threads that fail together (an endpoint's capture and silence threads when its sink goes) must
+// not interleave their lines.
 void logLine(const char* label, const char* text) {
-  std::cout << currentTimeMillis() << label << (text ? text : "unknown exception") << std::endl;
+  std::ostringstream line;
+  line << currentTimeMillis() << label << (text ? text : "unknown exception") << '\n';
+  static std::mutex writing;
+  std::lock_guard<std::mutex> hold(writing);
+  std::cout << line.str() << std::flush;
 }
 
 }  // namespace
