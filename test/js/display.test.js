@@ -214,6 +214,42 @@ test('a recording is H.264 Main at the monitor size, 30/1, timed by capture time
   });
 });
 
+test('a recording is upright and its colours are the BT.709 limited-range levels it declares', async () => {
+  await withDesktop(async (env, children) => {
+    movePointer(env, 1900, 1000);
+    // The pattern fills the top half only; the bottom half is the black root window.
+    children.push(await pattern(env, [0, 0, 960, 540, 30]));
+    const file = path.join(tools, 'levels.mp4');
+    const { code, stderr, stdout } = await runAddon(`${INIT}
+      addon.startCapture(left.id, ${JSON.stringify(file)});
+      await sleep(1500);
+      addon.stopCapture(left.id);
+      await sleep(1500);
+    `, { env });
+    assert.strictEqual(code, 0, stderr + stdout);
+    assert.strictEqual(decodeErrors(file), '', 'decoding');
+    const raw = spawnSync('ffmpeg', ['-v', 'error', '-i', file, '-frames:v', '1', '-pix_fmt', 'yuv420p', '-f', 'rawvideo', '-'],
+      { maxBuffer: 1 << 24 });
+    assert.strictEqual(raw.status, 0, String(raw.stderr));
+    const w = 960, h = 1080, yuv = raw.stdout;
+    assert.strictEqual(yuv.length, w * h * 3 / 2);
+    const at = (x, y) => [yuv[y * w + x], yuv[w * h + (y >> 1) * (w / 2) + (x >> 1)],
+      yuv[w * h * 5 / 4 + (y >> 1) * (w / 2) + (x >> 1)]];
+    // Block centres at row 270 (from the left, whichever step the pattern is at), then the black half.
+    const blocks = [120, 360, 600, 840].map((x) => at(x, 270));
+    const levels = { red: [63, 102, 240], green: [173, 42, 26], blue: [32, 240, 118], white: [235, 128, 128] };
+    const near = (got, want) => got.every((v, i) => Math.abs(v - want[i]) <= 6);
+    const names = blocks.map((b) => Object.keys(levels).find((k) => near(b, levels[k])));
+    assert.ok(names.every(Boolean), JSON.stringify(blocks));
+    assert.strictEqual(new Set(names).size, 4, names.join());
+    // Consecutive blocks follow the pattern's order red, green, blue, white, rotated.
+    const order = ['red', 'green', 'blue', 'white'];
+    const first = order.indexOf(names[0]);
+    assert.deepStrictEqual(names, [0, 1, 2, 3].map((i) => order[(first + i) % 4]));
+    for (const x of [120, 480, 840]) assert.ok(near(at(x, 810), [16, 128, 128]), JSON.stringify(at(x, 810)));
+  });
+});
+
 test('a recording into a missing folder is a warning and the host records again afterwards', async () => {
   await withDesktop(async (env, children) => {
     children.push(await pattern(env, [0, 0, 960, 1080, 30]));
