@@ -3,7 +3,6 @@
 #include <iomanip>
 #include <iostream>
 #include <limits>
-#include <mutex>
 #include <sstream>
 
 #include "capture/clock.h"
@@ -13,12 +12,11 @@ namespace capture {
 namespace {
 
 // Threads that fail together (an endpoint's capture and silence threads when its sink goes) must
-// not interleave their lines.
+// not interleave their lines: the line is made first and written in one insertion, which the
+// standard stream hands to stdio as one locked write.
 void logLine(const char* label, const char* text) {
   std::ostringstream line;
   line << currentTimeMillis() << label << (text ? text : "unknown exception") << '\n';
-  static std::mutex writing;
-  std::lock_guard<std::mutex> hold(writing);
   std::cout << line.str() << std::flush;
 }
 
