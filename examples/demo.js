@@ -53,7 +53,7 @@ async function main() {
   }
   const finish = (code) => {
     helpers.forEach((h) => h.kill());
-    desktop.stop();
+    desktop.stopAfterExit();
     process.exit(code);
   };
   await sleep(1000);

@@ -93,7 +93,7 @@ async function startDesktop(options = {}) {
     stopAll(xvfb, dir);
     throw e;
   }
-  return { env, dir, stop: () => stopAll(xvfb, dir) };
+  return { env, dir, stop: () => stopAll(xvfb, dir), stopAfterExit: () => stopAfterExit(xvfb, dir) };
 }
 
 function stopAll(xvfb, dir) {
@@ -118,6 +118,17 @@ function stopAll(xvfb, dir) {
   fs.rmSync(dir, { recursive: true, force: true, maxRetries: 5, retryDelay: 50 });
 }
 
+// For a process whose capture threads use the servers until it ends: a detached helper stops
+// them once this process is gone, so the threads never see their servers vanish.
+function stopAfterExit(xvfb, dir) {
+  const pidFile = path.join(dir, 'pulse', 'pid');
+  const pids = [xvfb && xvfb.process.pid, fs.existsSync(pidFile) && fs.readFileSync(pidFile, 'utf8').trim()]
+    .filter(Boolean).join(' ');
+  const script = `while kill -0 ${process.pid} 2>/dev/null; do sleep 0.1; done; kill ${pids} 2>/dev/null; sleep 0.5; rm -rf '${dir}'`;
+  spawn('sh', ['-c', script], { detached: true, stdio: 'ignore' }).unref();
+  if (xvfb) xvfb.process.unref();
+}
+
 // A moving test picture in a borderless window at (x, y); returns the child process.
 function startAnimation(env, { x = 100, y = 100, width = 640, height = 360, rate = 30 } = {}) {
   return spawn('ffmpeg', ['-loglevel', 'error', '-re', '-f', 'lavfi', '-i', `testsrc2=size=${width}x${height}:rate=${rate}`,
@@ -127,8 +138,9 @@ function startAnimation(env, { x = 100, y = 100, width = 640, height = 360, rate
 
 // A sine tone played into a sink (the default one when none is named); returns the child process.
 function playTone(env, { frequency = 440, amplitude = 0.5, sink } = {}) {
+  // lavfi's sine has amplitude 1/8; both channels carry it at full level (no -3 dB upmix).
   const args = ['-loglevel', 'error', '-re', '-f', 'lavfi', '-i',
-    `sine=frequency=${frequency}:sample_rate=48000,volume=${amplitude * 8}`, '-ac', '2', '-f', 'pulse'];
+    `sine=frequency=${frequency}:sample_rate=48000,volume=${amplitude * 8},pan=stereo|c0=c0|c1=c0`, '-f', 'pulse'];
   if (sink) args.push('-device', sink);
   args.push('tavio tone');
   return spawn('ffmpeg', args, { env: { ...process.env, ...env }, stdio: 'ignore' });
