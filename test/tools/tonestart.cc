@@ -59,14 +59,14 @@ int main(int argc, char** argv) {
     pa_threaded_mainloop_wait(loop);
   }
 
-  const pa_sample_spec spec{PA_SAMPLE_S16LE, kRate, kChannels};
-  pa_stream* stream = pa_stream_new(context, "tonestart", &spec, nullptr);
+  const pa_sample_spec sampleSpec{PA_SAMPLE_S16LE, kRate, kChannels};
+  pa_stream* stream = pa_stream_new(context, "tonestart", &sampleSpec, nullptr);
   pa_stream_set_state_callback(stream, signalStream, loop);
   pa_stream_set_write_callback(stream, signalRequest, loop);
   // 5 ms queued ahead of the sink: the tone follows little silence that is already on its way.
   pa_buffer_attr attr;
   attr.maxlength = static_cast<uint32_t>(-1);
-  attr.tlength = static_cast<uint32_t>(pa_usec_to_bytes(5000, &spec));
+  attr.tlength = static_cast<uint32_t>(pa_usec_to_bytes(5000, &sampleSpec));
   attr.prebuf = static_cast<uint32_t>(-1);
   attr.minreq = static_cast<uint32_t>(-1);
   attr.fragsize = static_cast<uint32_t>(-1);

@@ -34,7 +34,7 @@ struct Stream {
   // Kept by the state callback, so the checks on every poll cost no libpulse call.
   std::atomic<pa_stream_state_t> state{PA_STREAM_UNCONNECTED};
   bool loopback = false;
-  pa_sample_spec spec{};
+  pa_sample_spec sampleSpec{};
   uint32_t frameBytes = 0;
   uint32_t bufferFrames = 0;
   bool started = false;
@@ -72,7 +72,7 @@ struct Stream {
   bool invalid() const { return !connection->ready() || !PA_STREAM_IS_GOOD(state.load(std::memory_order_acquire)); }
 
   uint32_t bytesOf(int64_t units) const {
-    return static_cast<uint32_t>(units * spec.rate / kUnitsPerSecond) * frameBytes;
+    return static_cast<uint32_t>(units * sampleSpec.rate / kUnitsPerSecond) * frameBytes;
   }
 };
 
@@ -119,9 +119,9 @@ class CaptureClient : public ComObject<IAudioCaptureClient, IID_IAudioCaptureCli
     // The first frame of this packet arrived as long ago as everything queued behind it lasts.
     const size_t queued = pa_stream_readable_size(s_->stream);
     s_->readable = queued;
-    const int64_t queuedUnits = static_cast<int64_t>(queued / s_->frameBytes) * kUnitsPerSecond / s_->spec.rate;
+    const int64_t queuedUnits = static_cast<int64_t>(queued / s_->frameBytes) * kUnitsPerSecond / s_->sampleSpec.rate;
     const UINT64 measured = now - static_cast<UINT64>(std::max<int64_t>(queuedUnits, 0));
-    UINT64 time = s_->anchorTime + (s_->position - s_->anchorPosition) * kUnitsPerSecond / s_->spec.rate;
+    UINT64 time = s_->anchorTime + (s_->position - s_->anchorPosition) * kUnitsPerSecond / s_->sampleSpec.rate;
     const int64_t drift = static_cast<int64_t>(measured - time);
     if (!s_->anchored || drift > kDriftLimit || drift < -kDriftLimit) {
       if (s_->anchored) *flags |= AUDCLNT_BUFFERFLAGS_DATA_DISCONTINUITY;
@@ -224,20 +224,20 @@ class AudioClient : public ComObject<IAudioClient, IID_IAudioClient> {
     if (streamFlags & AUDCLNT_STREAMFLAGS_EVENTCALLBACK) return E_NOTIMPL;
     if (streamFlags & ~(AUDCLNT_STREAMFLAGS_LOOPBACK | AUDCLNT_STREAMFLAGS_CROSSPROCESS | AUDCLNT_STREAMFLAGS_NOPERSIST))
       return E_INVALIDARG;
-    pa_sample_spec spec;
+    pa_sample_spec sampleSpec;
     pa_channel_map map;
-    if (!pulse::specOf(format, spec, map) || spec.rate != sink_.spec.rate || spec.channels != sink_.spec.channels)
+    if (!pulse::specOf(format, sampleSpec, map) || sampleSpec.rate != sink_.sampleSpec.rate || sampleSpec.channels != sink_.sampleSpec.channels)
       return AUDCLNT_E_UNSUPPORTED_FORMAT;
 
     Stream& s = *s_;
     s.loopback = (streamFlags & AUDCLNT_STREAMFLAGS_LOOPBACK) != 0;
-    s.spec = spec;
-    s.frameBytes = static_cast<uint32_t>(pa_frame_size(&spec));
-    s.bufferFrames = static_cast<uint32_t>(std::max<int64_t>(bufferDuration, kShortestBuffer) * spec.rate / kUnitsPerSecond);
+    s.sampleSpec = sampleSpec;
+    s.frameBytes = static_cast<uint32_t>(pa_frame_size(&sampleSpec));
+    s.bufferFrames = static_cast<uint32_t>(std::max<int64_t>(bufferDuration, kShortestBuffer) * sampleSpec.rate / kUnitsPerSecond);
 
     Lock lock(*s.connection);
     if (pa_context_get_state(s.connection->context()) != PA_CONTEXT_READY) return AUDCLNT_E_DEVICE_INVALIDATED;
-    pa_stream* stream = pa_stream_new(s.connection->context(), s.loopback ? "Loopback" : "Playback", &spec, &map);
+    pa_stream* stream = pa_stream_new(s.connection->context(), s.loopback ? "Loopback" : "Playback", &sampleSpec, &map);
     if (!stream) return AUDCLNT_E_UNSUPPORTED_FORMAT;
     pa_stream_set_state_callback(stream, streamStateChanged, &s);
     if (s.loopback) pa_stream_set_read_callback(stream, streamReadable, &s);
@@ -305,17 +305,17 @@ class AudioClient : public ComObject<IAudioClient, IID_IAudioClient> {
     if (closestMatch) *closestMatch = nullptr;
     if (!format || (shareMode == AUDCLNT_SHAREMODE_SHARED && !closestMatch)) return E_POINTER;
     if (shareMode != AUDCLNT_SHAREMODE_SHARED) return AUDCLNT_E_UNSUPPORTED_FORMAT;
-    pa_sample_spec spec;
+    pa_sample_spec sampleSpec;
     pa_channel_map map;
-    if (!pulse::specOf(format, spec, map)) return AUDCLNT_E_UNSUPPORTED_FORMAT;
-    if (spec.rate == sink_.spec.rate && spec.channels == sink_.spec.channels) return S_OK;
-    *closestMatch = pulse::mixFormat(sink_.spec, sink_.map);
+    if (!pulse::specOf(format, sampleSpec, map)) return AUDCLNT_E_UNSUPPORTED_FORMAT;
+    if (sampleSpec.rate == sink_.sampleSpec.rate && sampleSpec.channels == sink_.sampleSpec.channels) return S_OK;
+    *closestMatch = pulse::mixFormat(sink_.sampleSpec, sink_.map);
     return S_FALSE;
   }
 
   HRESULT GetMixFormat(WAVEFORMATEX** format) override {
     if (!format) return E_POINTER;
-    *format = pulse::mixFormat(sink_.spec, sink_.map);
+    *format = pulse::mixFormat(sink_.sampleSpec, sink_.map);
     return S_OK;
   }
 

@@ -13,7 +13,7 @@ Sink sinkOf(const pa_sink_info* info) {
   sink.name = info->name ? info->name : "";
   sink.description = info->description ? info->description : sink.name;
   sink.monitor = info->monitor_source_name ? info->monitor_source_name : "";
-  sink.spec = info->sample_spec;
+  sink.sampleSpec = info->sample_spec;
   sink.map = info->channel_map;
   return sink;
 }

@@ -17,7 +17,7 @@ struct Sink {
   std::string name;
   std::string description;
   std::string monitor;
-  pa_sample_spec spec{};
+  pa_sample_spec sampleSpec{};
   pa_channel_map map{};
 };
 

@@ -64,15 +64,15 @@ DWORD channelMask(const pa_channel_map& map) {
   return mask;
 }
 
-WAVEFORMATEX* mixFormat(const pa_sample_spec& spec, const pa_channel_map& map) {
+WAVEFORMATEX* mixFormat(const pa_sample_spec& sampleSpec, const pa_channel_map& map) {
   auto* format = static_cast<WAVEFORMATEXTENSIBLE*>(CoTaskMemAlloc(sizeof(WAVEFORMATEXTENSIBLE)));
   std::memset(format, 0, sizeof(WAVEFORMATEXTENSIBLE));
   format->Format.wFormatTag = WAVE_FORMAT_EXTENSIBLE;
-  format->Format.nChannels = spec.channels;
-  format->Format.nSamplesPerSec = spec.rate;
+  format->Format.nChannels = sampleSpec.channels;
+  format->Format.nSamplesPerSec = sampleSpec.rate;
   format->Format.wBitsPerSample = 32;
-  format->Format.nBlockAlign = static_cast<WORD>(spec.channels * 4);
-  format->Format.nAvgBytesPerSec = spec.rate * format->Format.nBlockAlign;
+  format->Format.nBlockAlign = static_cast<WORD>(sampleSpec.channels * 4);
+  format->Format.nAvgBytesPerSec = sampleSpec.rate * format->Format.nBlockAlign;
   format->Format.cbSize = sizeof(WAVEFORMATEXTENSIBLE) - sizeof(WAVEFORMATEX);
   format->Samples.wValidBitsPerSample = 32;
   format->dwChannelMask = channelMask(map);
@@ -80,7 +80,7 @@ WAVEFORMATEX* mixFormat(const pa_sample_spec& spec, const pa_channel_map& map) {
   return &format->Format;
 }
 
-bool specOf(const WAVEFORMATEX* format, pa_sample_spec& spec, pa_channel_map& map) {
+bool specOf(const WAVEFORMATEX* format, pa_sample_spec& sampleSpec, pa_channel_map& map) {
   if (!format || format->nChannels == 0 || format->nChannels > PA_CHANNELS_MAX) return false;
   bool isFloat = false;
   const bool extensible = format->wFormatTag == WAVE_FORMAT_EXTENSIBLE &&
@@ -96,18 +96,18 @@ bool specOf(const WAVEFORMATEX* format, pa_sample_spec& spec, pa_channel_map& ma
   }
   const unsigned bits = format->wBitsPerSample;
   if (format->nBlockAlign != format->nChannels * bits / 8) return false;
-  if (isFloat && bits == 32) spec.format = PA_SAMPLE_FLOAT32LE;
-  else if (!isFloat && bits == 8) spec.format = PA_SAMPLE_U8;
-  else if (!isFloat && bits == 16) spec.format = PA_SAMPLE_S16LE;
-  else if (!isFloat && bits == 24) spec.format = PA_SAMPLE_S24LE;
-  else if (!isFloat && bits == 32) spec.format = PA_SAMPLE_S32LE;
+  if (isFloat && bits == 32) sampleSpec.format = PA_SAMPLE_FLOAT32LE;
+  else if (!isFloat && bits == 8) sampleSpec.format = PA_SAMPLE_U8;
+  else if (!isFloat && bits == 16) sampleSpec.format = PA_SAMPLE_S16LE;
+  else if (!isFloat && bits == 24) sampleSpec.format = PA_SAMPLE_S24LE;
+  else if (!isFloat && bits == 32) sampleSpec.format = PA_SAMPLE_S32LE;
   else return false;
-  spec.rate = format->nSamplesPerSec;
-  spec.channels = static_cast<uint8_t>(format->nChannels);
-  if (!pa_sample_spec_valid(&spec)) return false;
+  sampleSpec.rate = format->nSamplesPerSec;
+  sampleSpec.channels = static_cast<uint8_t>(format->nChannels);
+  if (!pa_sample_spec_valid(&sampleSpec)) return false;
   if (extensible && wide->dwChannelMask != 0) {
-    if (!mapOf(wide->dwChannelMask, spec.channels, map)) return false;
-  } else if (!pa_channel_map_init_auto(&map, spec.channels, PA_CHANNEL_MAP_WAVEEX)) {
+    if (!mapOf(wide->dwChannelMask, sampleSpec.channels, map)) return false;
+  } else if (!pa_channel_map_init_auto(&map, sampleSpec.channels, PA_CHANNEL_MAP_WAVEEX)) {
     return false;
   }
   return true;
