@@ -1,7 +1,7 @@
 #include "capture/video/screen/dxgi/capturemethod.h"
 
 #include "capture/video/screen/dxgi/factory.h"
-#include "capture/video/screen/dxgi/held.h"
+#include "capture/held.h"
 #include "capture/video/screen/dxgi/source.h"
 #include "capture/video/screen/dxgi/texture.h"
 

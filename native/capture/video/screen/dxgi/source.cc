@@ -7,7 +7,7 @@
 #include "capture/text.h"
 #include "capture/video/scale.h"
 #include "capture/video/screen/dxgi/duplicate.h"
-#include "capture/video/screen/dxgi/held.h"
+#include "capture/held.h"
 #include "capture/video/screen/dxgi/recording.h"
 #include "capture/video/screen/dxgi/texture.h"
 #include "platform/user32.h"
@@ -94,7 +94,7 @@ void Source::capture() {
 
   ID3D11Texture2D* texture = nullptr;
   hr = resource ? resource->QueryInterface(IID_ID3D11Texture2D, reinterpret_cast<void**>(&texture)) : E_POINTER;
-  resource.reset();
+  resource.release();
   capture::checkResult("native/capture/video/screen/dxgi/source", 85, hr, "Could not create temporary texture.");
   context->CopyResource(stagingTexture, texture);
   texture->Release();
