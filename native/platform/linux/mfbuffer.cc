@@ -1,7 +1,6 @@
 // Memory buffers, samples and collections on Linux.
 #include <cstdlib>
 #include <cstring>
-#include <mutex>
 #include <vector>
 
 #include "platform/linux/mfattributes.h"
@@ -10,67 +9,14 @@ namespace platform {
 
 namespace {
 
-// Large blocks come back for reuse: a recording makes one frame-sized buffer per frame, and a
-// fresh block of megabytes faults every page in again (a millisecond or more at 1080p). A
-// couple of blocks are enough for that pattern and bound what is kept.
-class BlockPool {
- public:
-  static constexpr size_t large = 1 << 20;
-  static constexpr size_t kept = 2;
-
-  BYTE* take(size_t bytes) {
-    if (bytes >= large) {
-      std::lock_guard<std::mutex> lock(mutex_);
-      for (size_t i = 0; i < count_; ++i) {
-        if (blocks_[i].bytes != bytes) continue;
-        BYTE* data = blocks_[i].data;
-        blocks_[i] = blocks_[--count_];
-        return data;
-      }
-    }
-    return static_cast<BYTE*>(std::aligned_alloc(64, bytes));
-  }
-
-  void give(BYTE* data, size_t bytes) {
-    if (data && bytes >= large) {
-      std::lock_guard<std::mutex> lock(mutex_);
-      if (count_ < kept) {
-        blocks_[count_++] = {data, bytes};
-        return;
-      }
-      // Full: the oldest block makes room, so a new frame size takes over from an old one.
-      std::free(blocks_[0].data);
-      blocks_[0] = {data, bytes};
-      return;
-    }
-    std::free(data);
-  }
-
- private:
-  struct Block {
-    BYTE* data;
-    size_t bytes;
-  };
-  std::mutex mutex_;
-  Block blocks_[kept]{};
-  size_t count_ = 0;
-};
-
-// Never destroyed: buffers may still be released while the process exits.
-BlockPool& blockPool() {
-  static BlockPool* pool = new BlockPool();
-  return *pool;
-}
-
 // A block of system memory, aligned as Media Foundation aligns its memory buffers (at least
 // 16 bytes; 64 here, which also suits the SIMD paths of the converters that read it).
 class MemoryBuffer : public ComObject<IMFMediaBuffer, IID_IMFMediaBuffer> {
  public:
   explicit MemoryBuffer(DWORD maxLength)
-      : bytes_((static_cast<size_t>(maxLength) + 63) / 64 * 64 + 64),
-        data_(blockPool().take(bytes_)),
+      : data_(static_cast<BYTE*>(std::aligned_alloc(64, (static_cast<size_t>(maxLength) + 63) / 64 * 64 + 64))),
         maxLength_(maxLength) {}
-  ~MemoryBuffer() override { blockPool().give(data_, bytes_); }
+  ~MemoryBuffer() override { std::free(data_); }
 
   bool valid() const { return data_ != nullptr; }
 
@@ -99,7 +45,6 @@ class MemoryBuffer : public ComObject<IMFMediaBuffer, IID_IMFMediaBuffer> {
   }
 
  private:
-  const size_t bytes_;
   BYTE* data_;
   const DWORD maxLength_;
   DWORD currentLength_ = 0;
