@@ -237,11 +237,12 @@ class Endpoint : public platform::ComObject<IMMDevice, IID_IMMDevice> {
  public:
   Endpoint(std::shared_ptr<AudioLog> log, std::wstring name) : log_(std::move(log)), name_(std::move(name)) {}
   HRESULT Activate(REFIID iid, DWORD, PROPVARIANT*, void** object) override {
+    *object = static_cast<IAudioClient*>(new AudioClient(log_));
     {
       std::lock_guard<std::mutex> lock(log_->mutex);
       ++log_->activations;
     }
-    *object = static_cast<IAudioClient*>(new AudioClient(log_));
+    log_->changed.notify_all();
     return S_OK;
   }
   HRESULT OpenPropertyStore(DWORD, IPropertyStore** store) override {

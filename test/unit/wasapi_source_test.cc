@@ -190,6 +190,8 @@ TEST_F(WasapiSource, CaptureOpensLoopbackOnceAndPreviewsPeaks) {
     EXPECT_EQ(audio->captureReleases, (std::vector<UINT32>{1, 2, 1}));
   }
   endCapture();
+  // The silence thread activates its client on its own schedule.
+  ASSERT_TRUE(audio->waitFor([&] { return audio->activations >= 2; }));
   std::lock_guard<std::mutex> lock(audio->mutex);
   EXPECT_EQ(audio->activations, 2) << "one client for silence, one for capture";
 }
