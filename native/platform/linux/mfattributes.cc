@@ -160,48 +160,23 @@ HRESULT AttributeStore::compare(IMFAttributes* self, IMFAttributes* theirs, MF_A
 }
 
 HRESULT AttributeStore::getUINT32(REFGUID key, UINT32* value) {
-  if (!value) return E_POINTER;
-  std::lock_guard<std::recursive_mutex> lock(mutex_);
-  const PROPVARIANT* found;
-  HRESULT hr = typed(key, VT_UI4, &found);
-  if (SUCCEEDED(hr)) *value = found->ulVal;
-  return hr;
+  return read(key, VT_UI4, value, [](const PROPVARIANT& v) { return v.ulVal; });
 }
 
 HRESULT AttributeStore::getUINT64(REFGUID key, UINT64* value) {
-  if (!value) return E_POINTER;
-  std::lock_guard<std::recursive_mutex> lock(mutex_);
-  const PROPVARIANT* found;
-  HRESULT hr = typed(key, VT_UI8, &found);
-  if (SUCCEEDED(hr)) *value = found->uhVal;
-  return hr;
+  return read(key, VT_UI8, value, [](const PROPVARIANT& v) { return v.uhVal; });
 }
 
 HRESULT AttributeStore::getDouble(REFGUID key, double* value) {
-  if (!value) return E_POINTER;
-  std::lock_guard<std::recursive_mutex> lock(mutex_);
-  const PROPVARIANT* found;
-  HRESULT hr = typed(key, VT_R8, &found);
-  if (SUCCEEDED(hr)) *value = found->dblVal;
-  return hr;
+  return read(key, VT_R8, value, [](const PROPVARIANT& v) { return v.dblVal; });
 }
 
 HRESULT AttributeStore::getGUID(REFGUID key, GUID* value) {
-  if (!value) return E_POINTER;
-  std::lock_guard<std::recursive_mutex> lock(mutex_);
-  const PROPVARIANT* found;
-  HRESULT hr = typed(key, VT_CLSID, &found);
-  if (SUCCEEDED(hr)) *value = *found->puuid;
-  return hr;
+  return read(key, VT_CLSID, value, [](const PROPVARIANT& v) { return *v.puuid; });
 }
 
 HRESULT AttributeStore::getStringLength(REFGUID key, UINT32* length) {
-  if (!length) return E_POINTER;
-  std::lock_guard<std::recursive_mutex> lock(mutex_);
-  const PROPVARIANT* found;
-  HRESULT hr = typed(key, VT_LPWSTR, &found);
-  if (SUCCEEDED(hr)) *length = static_cast<UINT32>(units(found->pwszVal));
-  return hr;
+  return read(key, VT_LPWSTR, length, [](const PROPVARIANT& v) { return static_cast<UINT32>(units(v.pwszVal)); });
 }
 
 HRESULT AttributeStore::getString(REFGUID key, LPWSTR value, UINT32 bufferSize, UINT32* length) {

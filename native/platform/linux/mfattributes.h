@@ -58,6 +58,16 @@ class AttributeStore {
   HRESULT store(REFGUID key, const PROPVARIANT& value);
   // The item of key if its type is vt: S_OK, MF_E_ATTRIBUTENOTFOUND or MF_E_INVALIDTYPE.
   HRESULT typed(REFGUID key, VARTYPE vt, const PROPVARIANT** value) const;
+  // Reads one value of kind vt under the lock; take(value) gives what goes to the caller.
+  template <class Out, class Take>
+  HRESULT read(REFGUID key, VARTYPE vt, Out* out, Take take) {
+    if (!out) return E_POINTER;
+    std::lock_guard<std::recursive_mutex> lock(mutex_);
+    const PROPVARIANT* found;
+    HRESULT hr = typed(key, vt, &found);
+    if (SUCCEEDED(hr)) *out = take(*found);
+    return hr;
+  }
 
   std::recursive_mutex mutex_;
   std::vector<std::pair<GUID, PROPVARIANT>> items_;

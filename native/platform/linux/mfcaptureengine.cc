@@ -718,14 +718,16 @@ HRESULT addSinkStream(EngineState& state, std::vector<SinkStream>& streams, DWOR
   return S_OK;
 }
 
-class PreviewSink : public ComObject<IMFCapturePreviewSink, IID_IMFCaptureSink, IID_IMFCapturePreviewSink> {
+// What the two sinks share: the engine's state, their own list of streams and the plain answers.
+template <class I, const GUID& Iid, std::vector<SinkStream> EngineState::*List>
+class Sink : public ComObject<I, IID_IMFCaptureSink, Iid> {
  public:
-  explicit PreviewSink(std::shared_ptr<EngineState> state) : state_(std::move(state)) {}
+  explicit Sink(std::shared_ptr<EngineState> state) : state_(std::move(state)) {}
   HRESULT GetOutputMediaType(DWORD index, IMFMediaType** type) override {
     if (!type) return E_POINTER;
     std::lock_guard<std::mutex> lock(state_->mutex);
-    if (index >= state_->previewStreams.size()) return MF_E_INVALIDSTREAMNUMBER;
-    *type = state_->previewStreams[index].type.p;
+    if (index >= streams().size()) return MF_E_INVALIDSTREAMNUMBER;
+    *type = streams()[index].type.p;
     (*type)->AddRef();
     return S_OK;
   }
@@ -733,6 +735,27 @@ class PreviewSink : public ComObject<IMFCapturePreviewSink, IID_IMFCaptureSink, 
     if (object) *object = nullptr;
     return MF_E_UNSUPPORTED_SERVICE;
   }
+  HRESULT Prepare() override { return S_OK; }
+  HRESULT SetCustomSink(IMFMediaSink*) override { return E_NOTIMPL; }
+  HRESULT GetRotation(DWORD, DWORD* rotation) override {
+    if (!rotation) return E_POINTER;
+    *rotation = 0;
+    return S_OK;
+  }
+  HRESULT SetRotation(DWORD, DWORD) override { return E_NOTIMPL; }
+
+ protected:
+  std::vector<SinkStream>& streams() { return (*state_).*List; }
+  HRESULT add(DWORD source, IMFMediaType* type, DWORD* index) {
+    return addSinkStream(*state_, streams(), source, type, index);
+  }
+
+  std::shared_ptr<EngineState> state_;
+};
+
+class PreviewSink : public Sink<IMFCapturePreviewSink, IID_IMFCapturePreviewSink, &EngineState::previewStreams> {
+ public:
+  using Sink::Sink;
   HRESULT AddStream(DWORD source, IMFMediaType* type, IMFAttributes*, DWORD* index) override {
     if (type) {
       GUID subtype = GUID_NULL;
@@ -741,12 +764,11 @@ class PreviewSink : public ComObject<IMFCapturePreviewSink, IID_IMFCaptureSink, 
       if (subtype != MFVideoFormat_ARGB32 && subtype != MFVideoFormat_RGB32 && subtype != MFAudioFormat_PCM)
         return MF_E_INVALIDMEDIATYPE;
     }
-    return addSinkStream(*state_, state_->previewStreams, source, type, index);
+    return add(source, type, index);
   }
-  HRESULT Prepare() override { return S_OK; }
   HRESULT RemoveAllStreams() override {
     std::lock_guard<std::mutex> lock(state_->mutex);
-    state_->previewStreams.clear();
+    streams().clear();
     return S_OK;
   }
   HRESULT SetRenderHandle(HANDLE) override { return E_NOTIMPL; }
@@ -754,8 +776,8 @@ class PreviewSink : public ComObject<IMFCapturePreviewSink, IID_IMFCaptureSink, 
   HRESULT UpdateVideo(const MFVideoNormalizedRect*, const RECT*, const COLORREF*) override { return E_NOTIMPL; }
   HRESULT SetSampleCallback(DWORD index, IMFCaptureEngineOnSampleCallback* callback) override {
     std::lock_guard<std::mutex> lock(state_->mutex);
-    if (index >= state_->previewStreams.size()) return MF_E_INVALIDSTREAMNUMBER;
-    state_->previewStreams[index].callback = ComPtr<IMFCaptureEngineOnSampleCallback>(callback, true);
+    if (index >= streams().size()) return MF_E_INVALIDSTREAMNUMBER;
+    streams()[index].callback = ComPtr<IMFCaptureEngineOnSampleCallback>(callback, true);
     return S_OK;
   }
   HRESULT GetMirrorState(BOOL* mirrored) override {
@@ -764,41 +786,18 @@ class PreviewSink : public ComObject<IMFCapturePreviewSink, IID_IMFCaptureSink, 
     return S_OK;
   }
   HRESULT SetMirrorState(BOOL) override { return E_NOTIMPL; }
-  HRESULT GetRotation(DWORD, DWORD* rotation) override {
-    if (!rotation) return E_POINTER;
-    *rotation = 0;
-    return S_OK;
-  }
-  HRESULT SetRotation(DWORD, DWORD) override { return E_NOTIMPL; }
-  HRESULT SetCustomSink(IMFMediaSink*) override { return E_NOTIMPL; }
-
- private:
-  std::shared_ptr<EngineState> state_;
 };
 
-class RecordSink : public ComObject<IMFCaptureRecordSink, IID_IMFCaptureSink, IID_IMFCaptureRecordSink> {
+class RecordSink : public Sink<IMFCaptureRecordSink, IID_IMFCaptureRecordSink, &EngineState::recordStreams> {
  public:
-  explicit RecordSink(std::shared_ptr<EngineState> state) : state_(std::move(state)) {}
-  HRESULT GetOutputMediaType(DWORD index, IMFMediaType** type) override {
-    if (!type) return E_POINTER;
-    std::lock_guard<std::mutex> lock(state_->mutex);
-    if (index >= state_->recordStreams.size()) return MF_E_INVALIDSTREAMNUMBER;
-    *type = state_->recordStreams[index].type.p;
-    (*type)->AddRef();
-    return S_OK;
-  }
-  HRESULT GetService(DWORD, REFGUID, REFIID, IUnknown** object) override {
-    if (object) *object = nullptr;
-    return MF_E_UNSUPPORTED_SERVICE;
-  }
+  using Sink::Sink;
   HRESULT AddStream(DWORD source, IMFMediaType* type, IMFAttributes*, DWORD* index) override {
-    return addSinkStream(*state_, state_->recordStreams, source, type, index);
+    return add(source, type, index);
   }
-  HRESULT Prepare() override { return S_OK; }
   HRESULT RemoveAllStreams() override {
     std::lock_guard<std::mutex> lock(state_->mutex);
     if (state_->recording) return MF_E_INVALIDREQUEST;
-    state_->recordStreams.clear();
+    streams().clear();
     return S_OK;
   }
   HRESULT SetOutputByteStream(IMFByteStream*, REFGUID) override { return E_NOTIMPL; }
@@ -809,16 +808,6 @@ class RecordSink : public ComObject<IMFCaptureRecordSink, IID_IMFCaptureSink, II
     return S_OK;
   }
   HRESULT SetSampleCallback(DWORD, IMFCaptureEngineOnSampleCallback*) override { return E_NOTIMPL; }
-  HRESULT SetCustomSink(IMFMediaSink*) override { return E_NOTIMPL; }
-  HRESULT GetRotation(DWORD, DWORD* rotation) override {
-    if (!rotation) return E_POINTER;
-    *rotation = 0;
-    return S_OK;
-  }
-  HRESULT SetRotation(DWORD, DWORD) override { return E_NOTIMPL; }
-
- private:
-  std::shared_ptr<EngineState> state_;
 };
 
 // A device object's link: "v4l2:<path>", "lavfi:<graph>" for cameras; a PulseAudio source name.

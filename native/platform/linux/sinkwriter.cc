@@ -11,6 +11,7 @@
 #include <cerrno>
 #include <cstring>
 #include <deque>
+#include <initializer_list>
 #include <memory>
 #include <mutex>
 #include <string>
@@ -386,34 +387,27 @@ class VideoEncoder : public StreamEncoder {
   // Baseline whatever is asked), and encodes 1080p well above 30 fps on two cores;
   // zerolatency gives one packet per frame at once (no lookahead, no B-frames).
   bool openX264(UINT32 width, UINT32 height, int64_t bitRate, UINT32 profile) {
-    const AVCodec* codec = avcodec_find_encoder_by_name("libx264");
+    return openSoftwareInput("libx264", width, height, bitRate,
+                             {{"preset", "superfast"}, {"tune", "zerolatency"}, {"profile", profileName(profile)}});
+  }
+
+  bool openNvenc(UINT32 width, UINT32 height, int64_t bitRate, UINT32 profile) {
+    if (access("/dev/nvidiactl", R_OK | W_OK) != 0) return false;
+    return openSoftwareInput("h264_nvenc", width, height, bitRate,
+                             {{"preset", "p2"}, {"tune", "ll"}, {"zerolatency", "1"}, {"profile", profileName(profile)}});
+  }
+
+  // Opens an encoder that takes yuv420p frames from memory, with its private options.
+  bool openSoftwareInput(const char* name, UINT32 width, UINT32 height, int64_t bitRate,
+                         std::initializer_list<std::pair<const char*, const char*>> settings) {
+    const AVCodec* codec = avcodec_find_encoder_by_name(name);
     if (!codec) return false;
     CodecContextPtr context(avcodec_alloc_context3(codec));
     configureCommon(context.get(), width, height, bitRate);
     context->pix_fmt = AV_PIX_FMT_YUV420P;
     context->thread_count = 0;
     AVDictionary* options = nullptr;
-    av_dict_set(&options, "preset", "superfast", 0);
-    av_dict_set(&options, "tune", "zerolatency", 0);
-    av_dict_set(&options, "profile", profileName(profile), 0);
-    const int result = avcodec_open2(context.get(), codec, &options);
-    av_dict_free(&options);
-    if (result < 0) return false;
-    context_ = std::move(context);
-    return true;
-  }
-
-  bool openNvenc(UINT32 width, UINT32 height, int64_t bitRate, UINT32 profile) {
-    const AVCodec* codec = avcodec_find_encoder_by_name("h264_nvenc");
-    if (!codec || access("/dev/nvidiactl", R_OK | W_OK) != 0) return false;
-    CodecContextPtr context(avcodec_alloc_context3(codec));
-    configureCommon(context.get(), width, height, bitRate);
-    context->pix_fmt = AV_PIX_FMT_YUV420P;
-    AVDictionary* options = nullptr;
-    av_dict_set(&options, "preset", "p2", 0);
-    av_dict_set(&options, "tune", "ll", 0);
-    av_dict_set(&options, "zerolatency", "1", 0);
-    av_dict_set(&options, "profile", profileName(profile), 0);
+    for (const auto& [key, value] : settings) av_dict_set(&options, key, value, 0);
     const int result = avcodec_open2(context.get(), codec, &options);
     av_dict_free(&options);
     if (result < 0) return false;
