@@ -1,6 +1,6 @@
 {
   'variables': {
-    'linux_packages': 'libavformat libavcodec libavdevice libavutil libswscale libswresample xcb xcb-shm xcb-damage xcb-xfixes xcb-randr libpulse dbus-1',
+    'linux_packages': 'libavformat libavcodec libavdevice libavutil libswscale libswresample xcb xcb-shm xcb-damage xcb-xfixes xcb-randr xcb-render libpulse dbus-1',
   },
   'targets': [{
     'target_name': 'tavio_capture',

@@ -12,9 +12,9 @@ function sleep(ms) {
 }
 
 // Starts Xvfb and resolves with its display name (":N"), read from -displayfd.
-function startXvfb(width, height) {
+function startXvfb(width, height, extra) {
   return new Promise((resolve, reject) => {
-    const xvfb = spawn('Xvfb', ['-displayfd', '3', '-screen', '0', `${width}x${height}x24`, '-noreset', '-nolisten', 'tcp'], {
+    const xvfb = spawn('Xvfb', ['-displayfd', '3', '-screen', '0', `${width}x${height}x24`, '-noreset', '-nolisten', 'tcp', ...extra], {
       stdio: ['ignore', 'ignore', 'pipe', 'pipe'],
     });
     let text = '';
@@ -61,12 +61,12 @@ async function startPulse(dir, sinks, microphone) {
  * Starts what the environment does not already give (or everything, with `private: true`).
  * Options: width, height, monitors (xrandr --setmonitor arguments, e.g. ['LEFT 960/254x1080/286+0+0 screen']),
  * sinks ([{name, description, rate, channels, default}]), microphone ({name, description, frequency}),
- * display (false: no X server), audio (false: no sound server).
+ * display (false: no X server), xvfbArguments (more Xvfb arguments), audio (false: no sound server).
  * Resolves with { env, dir, stop() }: env holds DISPLAY and PULSE_SERVER for child processes.
  */
 async function startDesktop(options = {}) {
   const {
-    width = 1920, height = 1080, monitors = [], display = true, audio = true,
+    width = 1920, height = 1080, monitors = [], display = true, xvfbArguments = [], audio = true,
     sinks = [{ name: 'tavio_speakers', description: 'Tavio Speakers', default: true }],
     microphone = { name: 'tavio_mic', description: 'Tavio Microphone', frequency: 440 },
   } = options;
@@ -76,7 +76,7 @@ async function startDesktop(options = {}) {
   let xvfb = null;
   try {
     if (display && (own || !process.env.DISPLAY)) {
-      xvfb = await startXvfb(width, height);
+      xvfb = await startXvfb(width, height, xvfbArguments);
       env.DISPLAY = xvfb.display;
       for (const monitor of monitors) {
         execFileSync('xrandr', ['--setmonitor', ...monitor.split(' ')], { env: { ...process.env, DISPLAY: env.DISPLAY } });

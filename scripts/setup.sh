@@ -7,7 +7,7 @@ packages=(
   build-essential python3 pkg-config cmake git
   libgtest-dev libgmock-dev
   libavformat-dev libavcodec-dev libavdevice-dev libavutil-dev libswscale-dev libswresample-dev
-  libxcb1-dev libxcb-shm0-dev libxcb-damage0-dev libxcb-xfixes0-dev libxcb-randr0-dev
+  libxcb1-dev libxcb-shm0-dev libxcb-damage0-dev libxcb-xfixes0-dev libxcb-randr0-dev libxcb-render0-dev
   libpulse-dev libdbus-1-dev
   xvfb x11-xserver-utils xdotool pulseaudio pulseaudio-utils ffmpeg sox
   g++-mingw-w64-x86-64-posix mingw-w64-x86-64-dev

@@ -36,8 +36,8 @@ function movePointer(env, x, y) {
   execFileSync('xdotool', ['mousemove', String(x), String(y)], { env: { ...process.env, ...env } });
 }
 
-async function withDesktop(fn) {
-  const desktop = await startDesktop({ monitors: MONITORS });
+async function withDesktop(fn, xvfbArguments = []) {
+  const desktop = await startDesktop({ monitors: MONITORS, xvfbArguments });
   const children = [];
   try {
     await fn(desktop.env, children);
@@ -80,59 +80,62 @@ test('two monitors give two display sources in server order, the first selected'
   });
 });
 
-test('getPreview returns the scaled pattern in red, green, blue, alpha order', async () => {
-  await withDesktop(async (env, children) => {
-    movePointer(env, 1900, 1000);  // on the right monitor, out of the picture
-    children.push(await pattern(env, [0, 0, 960, 1080]));
-    const { reports, code, stderr } = await runAddon(`${INIT}
-      const p = await preview(left.id, 96, 108);
-      // Block centres (quarters of 96 columns), row 54.
-      report([12, 36, 60, 84].map((x) => Array.from(p.slice((54 * 96 + x) * 4, (54 * 96 + x) * 4 + 4))));
-      report(p.length);
-      report(addon.getPreview(left.id, 0, 0).length);
-    `, { env });
-    assert.strictEqual(code, 0, stderr);
-    assert.deepStrictEqual(reports[0], [[255, 0, 0, 255], [0, 255, 0, 255], [0, 0, 255, 255], [255, 255, 255, 255]]);
-    assert.strictEqual(reports[1], 96 * 108 * 4);
-    assert.strictEqual(reports[2], 0);
+// Servers with RENDER get the picture composited into shared memory; without it, GetImage.
+for (const [server, xvfbArguments] of [['', []], [', X server without RENDER', ['-extension', 'RENDER']]]) {
+  test(`getPreview returns the scaled pattern in red, green, blue, alpha order${server}`, async () => {
+    await withDesktop(async (env, children) => {
+      movePointer(env, 1900, 1000);  // on the right monitor, out of the picture
+      children.push(await pattern(env, [0, 0, 960, 1080]));
+      const { reports, code, stderr } = await runAddon(`${INIT}
+        const p = await preview(left.id, 96, 108);
+        // Block centres (quarters of 96 columns), row 54.
+        report([12, 36, 60, 84].map((x) => Array.from(p.slice((54 * 96 + x) * 4, (54 * 96 + x) * 4 + 4))));
+        report(p.length);
+        report(addon.getPreview(left.id, 0, 0).length);
+      `, { env });
+      assert.strictEqual(code, 0, stderr);
+      assert.deepStrictEqual(reports[0], [[255, 0, 0, 255], [0, 255, 0, 255], [0, 0, 255, 255], [255, 255, 255, 255]]);
+      assert.strictEqual(reports[1], 96 * 108 * 4);
+      assert.strictEqual(reports[2], 0);
+    }, xvfbArguments);
   });
-});
 
-test('a small window changing over a still pattern shows in place, and the rest of the picture stays', async () => {
-  await withDesktop(async (env, children) => {
-    movePointer(env, 1900, 1000);
-    children.push(await pattern(env, [0, 0, 960, 1080]));
-    const { reports, code, stderr } = await runAddon(`${INIT}
-      await preview(left.id, 960, 1080);
-      const { spawn } = require('child_process');
-      // Blocks of 60 columns at rows 400-499 that move 30 times a second, so most grabs fetch only those rows.
-      const small = spawn(${JSON.stringify(xpattern)}, ['480', '400', '240', '100', '30'], { stdio: ['ignore', 'pipe', 'ignore'] });
-      await new Promise((resolve) => small.stdout.on('data', (d) => { if (String(d).includes('ready')) resolve(); }));
-      const at = (p, x, y) => Array.from(p.slice((y * 960 + x) * 4, (y * 960 + x) * 4 + 4));
-      const looks = [];
-      for (let i = 0; i < 5; i++) {
-        await sleep(150);
+  test(`a small window changing over a still pattern shows in place, and the rest of the picture stays${server}`, async () => {
+    await withDesktop(async (env, children) => {
+      movePointer(env, 1900, 1000);
+      children.push(await pattern(env, [0, 0, 960, 1080]));
+      const { reports, code, stderr } = await runAddon(`${INIT}
+        await preview(left.id, 960, 1080);
+        const { spawn } = require('child_process');
+        // Blocks of 60 columns at rows 400-499 that move 30 times a second, so most grabs fetch only those rows.
+        const small = spawn(${JSON.stringify(xpattern)}, ['480', '400', '240', '100', '30'], { stdio: ['ignore', 'pipe', 'ignore'] });
+        await new Promise((resolve) => small.stdout.on('data', (d) => { if (String(d).includes('ready')) resolve(); }));
+        const at = (p, x, y) => Array.from(p.slice((y * 960 + x) * 4, (y * 960 + x) * 4 + 4));
+        const looks = [];
+        for (let i = 0; i < 5; i++) {
+          await sleep(150);
+          const p = addon.getPreview(left.id, 960, 1080);
+          looks.push({ inside: [510, 570, 630, 690].map((x) => at(p, x, 450)),
+                       outside: [at(p, 100, 450), at(p, 300, 450), at(p, 800, 450), at(p, 600, 50), at(p, 600, 399), at(p, 600, 500), at(p, 600, 1000)] });
+        }
+        small.kill('SIGTERM');
+        await sleep(500);
         const p = addon.getPreview(left.id, 960, 1080);
-        looks.push({ inside: [510, 570, 630, 690].map((x) => at(p, x, 450)),
-                     outside: [at(p, 100, 450), at(p, 300, 450), at(p, 800, 450), at(p, 600, 50), at(p, 600, 399), at(p, 600, 500), at(p, 600, 1000)] });
+        report(looks);
+        report([510, 690].map((x) => at(p, x, 450)));
+      `, { env });
+      assert.strictEqual(code, 0, stderr);
+      const [red, green, blue, white] = [[255, 0, 0, 255], [0, 255, 0, 255], [0, 0, 255, 255], [255, 255, 255, 255]];
+      for (const look of reports[0]) {
+        assert.deepStrictEqual(look.outside, [red, green, white, blue, blue, blue, blue]);
+        const names = look.inside.map((c) => JSON.stringify(c));
+        for (const c of look.inside) assert.ok([red, green, blue, white].some((k) => JSON.stringify(k) === JSON.stringify(c)), names.join());
+        assert.strictEqual(new Set(names).size, 4, names.join());
       }
-      small.kill('SIGTERM');
-      await sleep(500);
-      const p = addon.getPreview(left.id, 960, 1080);
-      report(looks);
-      report([510, 690].map((x) => at(p, x, 450)));
-    `, { env });
-    assert.strictEqual(code, 0, stderr);
-    const [red, green, blue, white] = [[255, 0, 0, 255], [0, 255, 0, 255], [0, 0, 255, 255], [255, 255, 255, 255]];
-    for (const look of reports[0]) {
-      assert.deepStrictEqual(look.outside, [red, green, white, blue, blue, blue, blue]);
-      const names = look.inside.map((c) => JSON.stringify(c));
-      for (const c of look.inside) assert.ok([red, green, blue, white].some((k) => JSON.stringify(k) === JSON.stringify(c)), names.join());
-      assert.strictEqual(new Set(names).size, 4, names.join());
-    }
-    assert.deepStrictEqual(reports[1], [blue, blue]);
+      assert.deepStrictEqual(reports[1], [blue, blue]);
+    }, xvfbArguments);
   });
-});
+}
 
 test('mouseCapture switches the pointer in and out of the frames', async () => {
   await withDesktop(async (env, children) => {

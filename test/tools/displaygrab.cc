@@ -1,14 +1,10 @@
 // Measures one display grab (capture() of a changed output) against one memcpy of the same
-// number of bytes, both in this process, and prints the medians and their ratio. Also prints
-// the X server's part alone (a bare MIT-SHM fetch of the same area into a segment of this
-// process) and the page faults a grab costs.
+// number of bytes, both in this process, and prints the medians and their ratio, and the page
+// faults a grab costs.
 //   displaygrab [ROUNDS] [full]   (grabs the first display of $DISPLAY)
 // Each round draws a 64x64 square at the top left, or with "full" fills the whole output, so
 // the grab has that much changed picture to fetch.
-#include <sys/mman.h>
 #include <sys/resource.h>
-#include <unistd.h>
-#include <xcb/shm.h>
 #include <xcb/xcb.h>
 
 #include <algorithm>
@@ -52,7 +48,7 @@ int main(int argc, char** argv) {
   xcb_change_gc(c, gc, XCB_GC_SUBWINDOW_MODE, &subwindows);
 
   size_t bytes = static_cast<size_t>(source->size());
-  std::vector<double> grabs, copies, fetches;
+  std::vector<double> grabs, copies;
   int missed = 0;
   long faults = 0;
   for (int i = 0; i < rounds; ++i) {
@@ -90,35 +86,10 @@ int main(int argc, char** argv) {
     auto end = Clock::now();
     copies.push_back(std::chrono::duration<double, std::milli>(end - start).count());
   }
-  // The server's part: the same fetch into a segment of our own, round trip included.
-  int fd = memfd_create("displaygrab", MFD_CLOEXEC);
-  if (fd >= 0 && ftruncate(fd, static_cast<off_t>(bytes)) == 0) {
-    uint32_t segment = xcb_generate_id(c);
-    xcb_generic_error_t* error = xcb_request_check(c, xcb_shm_attach_fd_checked(c, segment, dup(fd), 0));
-    if (!error) {
-      for (int i = 0; i < rounds; ++i) {
-        auto start = Clock::now();
-        free(xcb_shm_get_image_reply(
-            c,
-            xcb_shm_get_image(c, screen->root, 0, 0, static_cast<uint16_t>(source->width()),
-                              static_cast<uint16_t>(source->height()), ~0u, XCB_IMAGE_FORMAT_Z_PIXMAP, segment, 0),
-            nullptr));
-        auto end = Clock::now();
-        fetches.push_back(std::chrono::duration<double, std::milli>(end - start).count());
-      }
-      xcb_shm_detach(c, segment);
-    }
-    free(error);
-  }
-  if (fd >= 0) close(fd);
-
   std::printf("output %ux%u, %d rounds changing %s, %d without a new frame\n", source->width(), source->height(),
               rounds, full ? "the whole output" : "64x64 pixels", missed);
   std::printf("grab median %.3f ms, memcpy of %zu bytes median %.3f ms, ratio %.2f\n", median(grabs), bytes,
               median(copies), median(grabs) / median(copies));
-  if (!fetches.empty())
-    std::printf("X server's fetch alone median %.3f ms; grab minus fetch %.3f ms, %.2f memcpys\n", median(fetches),
-                median(grabs) - median(fetches), (median(grabs) - median(fetches)) / median(copies));
   std::printf("page faults per grab %.1f\n", static_cast<double>(faults) / rounds);
   xcb_disconnect(c);
   return missed == 0 ? 0 : 1;

@@ -4,6 +4,7 @@
 #include <unistd.h>
 #include <xcb/damage.h>
 #include <xcb/randr.h>
+#include <xcb/render.h>
 #include <xcb/shm.h>
 #include <xcb/xfixes.h>
 
@@ -61,6 +62,36 @@ class DesktopTexture : public d3d11::Texture {
   Duplication* duplication_;
   Resource resource_{this};
 };
+
+// An X error of a checked request, or none.
+bool failed(xcb_connection_t* c, xcb_void_cookie_t cookie) {
+  xcb_generic_error_t* error = xcb_request_check(c, cookie);
+  free(error);
+  return error != nullptr;
+}
+
+// The 32-bit B, G, R, A format the texture promises, and the format of the root's visual.
+bool findFormats(xcb_connection_t* c, const xcb_screen_t* screen, xcb_render_pictformat_t* argb,
+                 xcb_render_pictformat_t* root) {
+  auto formats = own(xcb_render_query_pict_formats_reply(c, xcb_render_query_pict_formats(c), nullptr));
+  if (!formats) return false;
+  *argb = *root = 0;
+  for (auto it = xcb_render_query_pict_formats_formats_iterator(formats.get()); it.rem;
+       xcb_render_pictforminfo_next(&it)) {
+    const xcb_render_pictforminfo_t& f = *it.data;
+    const xcb_render_directformat_t& d = f.direct;
+    if (f.type == XCB_RENDER_PICT_TYPE_DIRECT && f.depth == 32 && d.alpha_shift == 24 && d.alpha_mask == 0xFF &&
+        d.red_shift == 16 && d.red_mask == 0xFF && d.green_shift == 8 && d.green_mask == 0xFF && d.blue_shift == 0 &&
+        d.blue_mask == 0xFF) {
+      *argb = f.id;
+    }
+  }
+  for (auto s = xcb_render_query_pict_formats_screens_iterator(formats.get()); s.rem; xcb_render_pictscreen_next(&s))
+    for (auto d = xcb_render_pictscreen_depths_iterator(s.data); d.rem; xcb_render_pictdepth_next(&d))
+      for (auto v = xcb_render_pictdepth_visuals_iterator(d.data); v.rem; xcb_render_pictvisual_next(&v))
+        if (v.data->visual == screen->root_visual) *root = v.data->format;
+  return *argb && *root;
+}
 
 bool overlaps(const xcb_rectangle_t& a, const x11::Monitor& m) {
   return a.x < m.x + m.width && m.x < a.x + a.width && a.y < m.y + m.height && m.y < a.y + a.height;
@@ -122,6 +153,20 @@ bool Duplication::setUp() {
   // Version 1.2 passes file descriptors, so the texture's memfd can be shared.
   auto shm = own(xcb_shm_query_version_reply(c, xcb_shm_query_version(c), nullptr));
   shm_ = shm && (shm->major_version > 1 || (shm->major_version == 1 && shm->minor_version >= 2));
+
+  // RENDER writes the monitor into a 32-bit pixmap in the texture's memory: one pass of the
+  // server that also makes alpha opaque. That needs pixmaps in shared memory.
+  const xcb_query_extension_reply_t* render = xcb_get_extension_data(c, &xcb_render_id);
+  xcb_render_pictformat_t rootFormat = 0;
+  if (shm_ && shm->shared_pixmaps && shm->pixmap_format == XCB_IMAGE_FORMAT_Z_PIXMAP && render && render->present) {
+    free(xcb_render_query_version_reply(c, xcb_render_query_version(c, 0, 11), nullptr));
+    if (findFormats(c, screen, &argbFormat_, &rootFormat)) {
+      rootPicture_ = xcb_generate_id(c);
+      const uint32_t inferiors = XCB_SUBWINDOW_MODE_INCLUDE_INFERIORS;
+      composite_ = !failed(c, xcb_render_create_picture_checked(c, rootPicture_, root_, rootFormat,
+                                                                XCB_RENDER_CP_SUBWINDOW_MODE, &inferiors));
+    }
+  }
   xcb_flush(c);
   return !xcb_connection_has_error(c);
 }
@@ -311,18 +356,40 @@ HRESULT Duplication::ReleaseFrame() {
 
 bool Duplication::attach(const std::shared_ptr<d3d11::TextureMemory>& memory) {
   if (attached_ == memory) return true;
-  xcb_connection_t* c = connection_.get();
-  if (attached_) xcb_shm_detach(c, segment_);
-  attached_.reset();
+  detach();
   int fd = dup(memory->fd());  // xcb closes the descriptor it sends
   if (fd < 0) return false;
+  xcb_connection_t* c = connection_.get();
   segment_ = xcb_generate_id(c);
-  xcb_generic_error_t* error = xcb_request_check(c, xcb_shm_attach_fd_checked(c, segment_, fd, 0));
-  if (error) {
-    free(error);
+  if (failed(c, xcb_shm_attach_fd_checked(c, segment_, fd, 0))) return false;
+  attached_ = memory;
+  if (composite_ && !makePicture()) composite_ = false;  // GetImage still works
+  return true;
+}
+
+void Duplication::detach() {
+  if (!attached_) return;
+  xcb_connection_t* c = connection_.get();
+  if (picture_) xcb_render_free_picture(c, picture_);
+  if (pixmap_) xcb_free_pixmap(c, pixmap_);
+  xcb_shm_detach(c, segment_);
+  picture_ = pixmap_ = 0;
+  attached_.reset();
+}
+
+// The attached segment as a pixmap of the monitor's size, rows packed at width * 4 bytes.
+bool Duplication::makePicture() {
+  xcb_connection_t* c = connection_.get();
+  pixmap_ = xcb_generate_id(c);
+  if (failed(c, xcb_shm_create_pixmap_checked(c, pixmap_, root_, monitor_.width, monitor_.height, 32, segment_, 0))) {
+    pixmap_ = 0;
     return false;
   }
-  attached_ = memory;
+  picture_ = xcb_generate_id(c);
+  if (failed(c, xcb_render_create_picture_checked(c, picture_, pixmap_, argbFormat_, 0, nullptr))) {
+    picture_ = 0;
+    return false;
+  }
   return true;
 }
 
@@ -331,6 +398,13 @@ bool Duplication::fetch(d3d11::TextureMemory& memory, int32_t top, int32_t rows)
   xcb_connection_t* c = connection_.get();
   const size_t rowBytes = static_cast<size_t>(monitor_.width) * 4;
   uint8_t* at = memory.data() + static_cast<size_t>(top) * rowBytes;
+  if (picture_) {
+    // The check's round trip also tells that the server has written the rows.
+    return !failed(c, xcb_render_composite_checked(c, XCB_RENDER_PICT_OP_SRC, rootPicture_, XCB_NONE, picture_,
+                                                   monitor_.x, static_cast<int16_t>(monitor_.y + top), 0, 0, 0,
+                                                   static_cast<int16_t>(top), monitor_.width,
+                                                   static_cast<uint16_t>(rows)));
+  }
   if (shm_) {
     auto image = own(xcb_shm_get_image_reply(
         c,

@@ -1,9 +1,11 @@
 // Desktop duplication of one RandR monitor. The duplication has an X connection of its own,
 // used only by the thread that acquires frames: DAMAGE tells it about drawing, XFIXES about
-// cursor shapes, RandR about geometry changes, and MIT-SHM writes the monitor's rectangle
-// straight into the staging texture's memory.
+// cursor shapes, RandR about geometry changes. The staging texture's memory is shared with the
+// server through MIT-SHM: RENDER copies the monitor's rectangle into it as a 32-bit picture,
+// which sets alpha on the way, or, where the server cannot do that, GetImage fills it.
 #pragma once
 
+#include <xcb/render.h>
 #include <xcb/xcb.h>
 
 #include <chrono>
@@ -42,6 +44,8 @@ class Duplication : public platform::ComObject<IDXGIOutputDuplication, IID_IDXGI
   bool pointerMoved();
   void fetchCursor();
   bool attach(const std::shared_ptr<d3d11::TextureMemory>& memory);
+  void detach();
+  bool makePicture();
   bool fetch(d3d11::TextureMemory& memory, int32_t top, int32_t rows);
 
   x11::Connection connection_;
@@ -68,6 +72,12 @@ class Duplication : public platform::ComObject<IDXGIOutputDuplication, IID_IDXGI
 
   bool shm_ = false;
   uint32_t segment_ = 0;
+  // RENDER: the root as a picture, and an ARGB picture on a pixmap in the attached segment.
+  bool composite_ = false;
+  xcb_render_pictformat_t argbFormat_ = 0;
+  xcb_render_picture_t rootPicture_ = 0;
+  xcb_pixmap_t pixmap_ = 0;
+  xcb_render_picture_t picture_ = 0;
   std::shared_ptr<d3d11::TextureMemory> attached_;
   // Rows of the monitor drawn since the last grab (top inclusive, bottom exclusive); only they
   // are fetched again while the attached memory still holds the last grab.
