@@ -5,6 +5,7 @@
 #include "capture/check.h"
 #include "capture/clock.h"
 #include "capture/text.h"
+#include "capture/video/copy.h"
 #include "capture/video/scale.h"
 #include "capture/video/screen/dxgi/duplicate.h"
 #include "capture/held.h"
@@ -108,7 +109,7 @@ void Source::capture() {
 
   auto frame = capture::video::Frame::make(outputWidth, outputHeight, 0, capture::currentTimeMillis());
   // Rows are taken as packed at outputWidth * 4 bytes; RowPitch is not consulted.
-  std::memcpy(frame->data.get(), mapped.pData, frame->size);
+  capture::video::copyPicture(frame->data.get(), mapped.pData, frame->size);
   if (captureMouse) drawPointer(pointer, *frame);
 
   std::lock_guard<std::mutex> lock(queue->mutex);
