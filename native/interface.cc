@@ -15,6 +15,7 @@
 #include "capture/check.h"
 #include "capture/clock.h"
 #include "capture/log.h"
+#include "capture/threadname.h"
 #include "capture/video/camera/mfce/mfcecapturemethod.h"
 #include "capture/video/screen/dxgi/capturemethod.h"
 #include "capture/video/screen/dxgi/source.h"
@@ -83,6 +84,7 @@ void append(SourceList found) {
 
 // Keeps every display capturing; its pace is the displays' own acquisition time-out.
 void screenPump() {
+  capture::nameThread("tavio-screen");
   for (;;) {
     try {
       for (size_t i = 0; i < sources.size(); ++i) {

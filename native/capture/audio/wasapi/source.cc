@@ -7,16 +7,13 @@
 #include <stdexcept>
 #include <thread>
 
-#ifdef __linux__
-#include <pthread.h>
-#endif
-
 #include "capture/audio/formats.h"
 #include "capture/audio/mfencoder.h"
 #include "capture/audio/peaks.h"
 #include "capture/check.h"
 #include "capture/log.h"
 #include "capture/text.h"
+#include "capture/threadname.h"
 
 namespace capture::audio::wasapi {
 
@@ -26,16 +23,6 @@ constexpr const char* kFile = "native/capture/audio/wasapi/source";
 constexpr REFERENCE_TIME kBufferDuration = 1000000;  // 100 ms
 
 void pause() { std::this_thread::sleep_for(std::chrono::microseconds(5000)); }
-
-// Names the calling thread where the system keeps thread names, so per-thread figures (top -H,
-// /proc) can tell the endpoint's threads apart.
-void nameThread(const char* name) {
-#ifdef __linux__
-  pthread_setname_np(pthread_self(), name);
-#else
-  (void)name;
-#endif
-}
 
 // The endpoint's mix format as a 40-byte block of our own, whatever cbSize says.
 WAVEFORMATEXTENSIBLE* readMixFormat(IAudioClient* client) {
@@ -116,7 +103,7 @@ Source::Source(IMMDevice* endpoint, bool isSelected, EncoderFactory makeEncoder)
   endpoint->AddRef();
   silence->endpoint = endpoint;
   std::thread([state = silence] {
-    nameThread("tavio-silence");
+    capture::nameThread("tavio-silence");
     guarded([&] { state->run(); });
   }).detach();
 }
@@ -159,7 +146,7 @@ void Source::stopEncode() {
 void Source::capture() {
   if (capturing.exchange(true)) return;
   std::thread([self = shared_from_this()] {
-    nameThread("tavio-capture");
+    capture::nameThread("tavio-capture");
     guarded([&] { self->runCapture(); });
   }).detach();
 }

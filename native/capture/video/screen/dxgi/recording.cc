@@ -4,12 +4,14 @@
 #include <thread>
 
 #include "capture/log.h"
+#include "capture/threadname.h"
 #include "capture/video/encoder/mftencoder.h"
 
 namespace capture::video::screen::dxgi {
 
 void startRecording(std::shared_ptr<capture::video::FrameQueue> queue) {
   std::thread([queue] {
+    capture::nameThread("tavio-record");
     capture::video::encoder::MFTEncoder encoder;
     queue->stopped = false;
     // A failed clip is reported as a warning and ends only this thread, not the host process.
