@@ -20,7 +20,7 @@ std::string asctimeNow() {
 #else
   localtime_r(&now, &local);
 #endif
-  char text[32];
+  char text[64];  // 26 bytes in practice; room for any int the compiler can imagine
   std::snprintf(text, sizeof text, "%.3s %.3s%3d %.2d:%.2d:%.2d %d\n", days[local.tm_wday], months[local.tm_mon],
                 local.tm_mday, local.tm_hour, local.tm_min, local.tm_sec, 1900 + local.tm_year);
   return text;

@@ -28,7 +28,7 @@ bool windowExists(xcb_connection_t* connection, xcb_window_t window) {
 
 xcb_atom_t atom(xcb_connection_t* connection, const char* name) {
   auto* reply = xcb_intern_atom_reply(connection, xcb_intern_atom(connection, 0, std::strlen(name), name), nullptr);
-  xcb_atom_t result = reply ? reply->atom : XCB_ATOM_NONE;
+  const xcb_atom_t result = reply ? reply->atom : static_cast<xcb_atom_t>(XCB_ATOM_NONE);
   std::free(reply);
   return result;
 }
