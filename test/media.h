@@ -100,6 +100,24 @@ inline File probe(const std::string& path) {
   return file;
 }
 
+// The key-frame marks the container itself gives the packets of its first stream (an MP4's
+// sync-sample table), read without the parser that would find key frames in the bit stream.
+inline std::vector<bool> containerKeys(const std::string& path) {
+  std::vector<bool> keys;
+  AVFormatContext* format = avformat_alloc_context();
+  if (!format) return keys;
+  format->flags |= AVFMT_FLAG_NOPARSE;
+  if (avformat_open_input(&format, path.c_str(), nullptr, nullptr) < 0) return keys;  // frees the context
+  AVPacket* packet = av_packet_alloc();
+  while (av_read_frame(format, packet) >= 0) {
+    if (packet->stream_index == 0) keys.push_back((packet->flags & AV_PKT_FLAG_KEY) != 0);
+    av_packet_unref(packet);
+  }
+  av_packet_free(&packet);
+  avformat_close_input(&format);
+  return keys;
+}
+
 // Decodes every frame of the first stream of the given kind. Video frames come out as packed
 // B, G, R, A rows (top-down), audio as interleaved float samples; errors counts decoder failures.
 struct Decoded {
@@ -175,6 +193,79 @@ inline Decoded decode(const std::string& path, AVMediaType kind) {
   avcodec_free_context(&context);
   avformat_close_input(&format);
   return out;
+}
+
+// What a camera that encodes H.264 itself sends: start-code packets of a red-over-blue picture
+// from libx264 at High profile (what the add-on's own encoding never asks for), a key frame every
+// `keyInterval` frames. With `globalHeader` the parameter sets come apart, in `header`, and not
+// in the packets; without, every key frame carries them.
+struct CameraStream {
+  std::vector<uint8_t> header;
+  std::vector<std::vector<uint8_t>> packets;
+  std::vector<bool> keys;
+};
+
+inline CameraStream cameraStream(int width, int height, int frames, int keyInterval, bool globalHeader) {
+  CameraStream made;
+  const AVCodec* codec = avcodec_find_encoder_by_name("libx264");
+  if (!codec) return made;
+  AVCodecContext* encoder = avcodec_alloc_context3(codec);
+  encoder->width = width;
+  encoder->height = height;
+  encoder->time_base = {1, 30};
+  encoder->framerate = {30, 1};
+  encoder->pix_fmt = AV_PIX_FMT_YUV420P;
+  encoder->gop_size = keyInterval;
+  encoder->max_b_frames = 0;
+  encoder->thread_count = 1;
+  if (globalHeader) encoder->flags |= AV_CODEC_FLAG_GLOBAL_HEADER;
+  AVDictionary* options = nullptr;
+  av_dict_set(&options, "preset", "superfast", 0);
+  av_dict_set(&options, "tune", "zerolatency", 0);
+  av_dict_set(&options, "profile", "high", 0);
+  av_dict_set(&options, "x264-params", "scenecut=0", 0);
+  const int opened = avcodec_open2(encoder, codec, &options);
+  av_dict_free(&options);
+  if (opened < 0) {
+    avcodec_free_context(&encoder);
+    return made;
+  }
+  if (encoder->extradata_size > 0) made.header.assign(encoder->extradata, encoder->extradata + encoder->extradata_size);
+  AVFrame* frame = av_frame_alloc();
+  frame->format = AV_PIX_FMT_YUV420P;
+  frame->width = width;
+  frame->height = height;
+  av_frame_get_buffer(frame, 0);
+  AVPacket* packet = av_packet_alloc();
+  auto take = [&] {
+    while (avcodec_receive_packet(encoder, packet) == 0) {
+      made.packets.emplace_back(packet->data, packet->data + packet->size);
+      made.keys.push_back((packet->flags & AV_PKT_FLAG_KEY) != 0);
+      av_packet_unref(packet);
+    }
+  };
+  for (int i = 0; i < frames; ++i) {
+    av_frame_make_writable(frame);
+    // BT.601 limited range: red Y 81 U 90 V 240, blue Y 41 U 240 V 110; a moving stripe so
+    // that the frames differ.
+    for (int y = 0; y < height; ++y)
+      for (int x = 0; x < width; ++x)
+        frame->data[0][y * frame->linesize[0] + x] = x == i % width ? 200 : y < height / 2 ? 81 : 41;
+    for (int y = 0; y < height / 2; ++y)
+      for (int x = 0; x < width / 2; ++x) {
+        frame->data[1][y * frame->linesize[1] + x] = y < height / 4 ? 90 : 240;
+        frame->data[2][y * frame->linesize[2] + x] = y < height / 4 ? 240 : 110;
+      }
+    frame->pts = i;
+    avcodec_send_frame(encoder, frame);
+    take();
+  }
+  avcodec_send_frame(encoder, nullptr);
+  take();
+  av_packet_free(&packet);
+  av_frame_free(&frame);
+  avcodec_free_context(&encoder);
+  return made;
 }
 
 // The power of one frequency in a block of mono samples (Goertzel).

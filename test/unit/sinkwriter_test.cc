@@ -1,6 +1,7 @@
 // The Linux sink writer: real files written through FFmpeg, read back with libavformat.
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <cstring>
 #include <fstream>
 #include <random>
@@ -398,6 +399,99 @@ TEST(SinkWriter, FinalizeWithoutSamplesFails) {
   IMFSinkWriter* writer = videoWriter(folder.file("empty.mp4"), 64, 64, &stream);
   ASSERT_NE(writer, nullptr);
   EXPECT_EQ(writer->Finalize(), MF_E_SINK_NO_SAMPLES_PROCESSED);
+  writer->Release();
+}
+
+// ---- H.264 input: copied, not encoded ----
+
+// Writes a camera stream through a writer whose input type is H.264; the sequence header is
+// given on the input type when `withHeader`.
+HRESULT copyStream(const std::string& path, const media::CameraStream& camera, int width, int height, bool withHeader) {
+  IMFSinkWriter* writer = createWriter(path);
+  if (!writer) return E_FAIL;
+  DWORD stream = 0;
+  IMFMediaType* out = h264Type(width, height);
+  HRESULT hr = writer->AddStream(out, &stream);
+  out->Release();
+  IMFMediaType* in = h264Type(width, height);
+  in->DeleteItem(MF_MT_AVG_BITRATE);
+  if (withHeader) in->SetBlob(MF_MT_MPEG_SEQUENCE_HEADER, camera.header.data(), static_cast<UINT32>(camera.header.size()));
+  if (SUCCEEDED(hr)) hr = writer->SetInputMediaType(stream, in, nullptr);
+  in->Release();
+  if (SUCCEEDED(hr)) hr = writer->BeginWriting();
+  for (size_t i = 0; SUCCEEDED(hr) && i < camera.packets.size(); ++i) {
+    const auto& bytes = camera.packets[i];
+    IMFSample* sample = sampleOf(bytes.data(), static_cast<DWORD>(bytes.size()), i * 10000000LL / 30, 333333);
+    if (camera.keys[i]) sample->SetUINT32(MFSampleExtension_CleanPoint, TRUE);
+    hr = writer->WriteSample(stream, sample);
+    sample->Release();
+  }
+  if (SUCCEEDED(hr)) hr = writer->Finalize();
+  writer->Release();
+  return hr;
+}
+
+// The file holds the camera's own stream: its profile (High, where the writer's output type
+// asks for Main), its key frames, its times and pictures.
+void expectCameraStreamIn(const std::string& path, const media::CameraStream& camera) {
+  const media::File file = media::probe(path);
+  ASSERT_TRUE(file.opened);
+  ASSERT_EQ(file.streams.size(), 1u);
+  const media::Stream& video = file.streams[0];
+  EXPECT_EQ(video.codec, "h264");
+  EXPECT_EQ(video.profile, FF_PROFILE_H264_HIGH);
+  EXPECT_EQ(video.width, 160);
+  EXPECT_EQ(video.height, 120);
+  ASSERT_EQ(video.packets.size(), camera.packets.size());
+  for (size_t i = 0; i < video.packets.size(); ++i) EXPECT_NEAR(video.packets[i].time, i / 30.0, 1e-4) << "packet " << i;
+  EXPECT_EQ(media::containerKeys(path), camera.keys);  // the file's own sync samples, from the clean points
+  EXPECT_NEAR(file.duration, camera.packets.size() / 30.0, 1e-3);
+  // The decoder needs the parameter sets from the file's avcC or the packets: no errors, every frame.
+  const media::Decoded decoded = media::decode(path, AVMEDIA_TYPE_VIDEO);
+  EXPECT_EQ(decoded.errors, 0);
+  EXPECT_EQ(decoded.frames, static_cast<int>(camera.packets.size()));
+  ASSERT_EQ(decoded.width, 160);
+  EXPECT_EQ(colourAt(decoded, 80, 20), 'r');
+  EXPECT_EQ(colourAt(decoded, 80, 100), 'b');
+}
+
+TEST(SinkWriter, H264InputIsCopiedWithTheSequenceHeaderOfItsType) {
+  MediaFoundation started;
+  media::TempFolder folder;
+  const media::CameraStream camera = media::cameraStream(160, 120, 45, 15, true);
+  ASSERT_EQ(camera.packets.size(), 45u);
+  ASSERT_FALSE(camera.header.empty());
+  ASSERT_EQ(std::count(camera.keys.begin(), camera.keys.end(), true), 3);
+  const std::string path = folder.file("copy.mp4");
+  ASSERT_EQ(copyStream(path, camera, 160, 120, true), S_OK);
+  expectCameraStreamIn(path, camera);
+}
+
+TEST(SinkWriter, H264InputWithoutSequenceHeaderUsesTheFirstKeyFramesParameterSets) {
+  MediaFoundation started;
+  media::TempFolder folder;
+  const media::CameraStream camera = media::cameraStream(160, 120, 45, 15, false);
+  ASSERT_EQ(camera.packets.size(), 45u);
+  ASSERT_TRUE(camera.header.empty());
+  const std::string path = folder.file("inband.mp4");
+  ASSERT_EQ(copyStream(path, camera, 160, 120, false), S_OK);
+  expectCameraStreamIn(path, camera);
+}
+
+TEST(SinkWriter, H264InputMustHaveTheOutputsSize) {
+  MediaFoundation started;
+  media::TempFolder folder;
+  IMFSinkWriter* writer = createWriter(folder.file("sizes.mp4"));
+  ASSERT_NE(writer, nullptr);
+  DWORD stream = 0;
+  IMFMediaType* out = h264Type(64, 64);
+  ASSERT_EQ(writer->AddStream(out, &stream), S_OK);
+  IMFMediaType* in = h264Type(32, 32);
+  EXPECT_EQ(writer->SetInputMediaType(stream, in, nullptr), MF_E_INVALIDMEDIATYPE);  // a copy cannot scale
+  MFSetAttributeSize(in, MF_MT_FRAME_SIZE, 64, 64);
+  EXPECT_EQ(writer->SetInputMediaType(stream, in, nullptr), S_OK);
+  out->Release();
+  in->Release();
   writer->Release();
 }
 

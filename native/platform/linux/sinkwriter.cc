@@ -1,9 +1,9 @@
 // The Media Foundation sink writer on Linux, over FFmpeg. The container comes from
 // MF_TRANSCODE_CONTAINERTYPE (else from the file's extension); H.264 output is encoded by a
-// hardware encoder when hardware transforms are allowed and one opens, else by libx264; AAC by
-// FFmpeg's own encoder. Encoding happens inside WriteSample on the caller's thread, so there is
-// nothing to throttle and no queue to wait for; Finalize drains the encoders, writes the
-// trailer and closes the file.
+// hardware encoder when hardware transforms are allowed and one opens, else by libx264 (H.264
+// input is copied as it is); AAC by FFmpeg's own encoder. Encoding happens inside WriteSample on
+// the caller's thread, so there is nothing to throttle and no queue to wait for; Finalize drains
+// the encoders, writes the trailer and closes the file.
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -131,7 +131,7 @@ using FramePtr = std::unique_ptr<AVFrame, FrameDeleter>;
 using PacketPtr = std::unique_ptr<AVPacket, PacketDeleter>;
 using BufferRefPtr = std::unique_ptr<AVBufferRef, BufferRefDeleter>;
 
-// One stream's encoder; it hands every packet it makes to the muxer through mux().
+// One stream's encoder (or copier); it hands every packet it makes to the muxer through mux().
 class StreamEncoder {
  public:
   StreamEncoder(AVFormatContext* format, AVStream* stream) : format_(format), stream_(stream) {}
@@ -140,8 +140,9 @@ class StreamEncoder {
   // The codec parameters the muxer needs, once the encoder is open.
   HRESULT describe() { return fromAv(avcodec_parameters_from_context(stream_->codecpar, context_.get())); }
   // One sample's bytes. Times are in 100 ns; hasTime false continues from the previous sample.
+  // cleanPoint: the sample can be decoded on its own (it matters only to copied streams).
   virtual HRESULT write(const uint8_t* data, DWORD length, LONGLONG time, bool hasTime, LONGLONG duration,
-                        bool hasDuration) = 0;
+                        bool hasDuration, bool cleanPoint) = 0;
   // Drains the encoder into the muxer.
   virtual HRESULT finish() = 0;
   // Forgets buffered input that has not been encoded yet.
@@ -264,7 +265,7 @@ class VideoEncoder : public StreamEncoder {
   }
 
   HRESULT write(const uint8_t* data, DWORD length, LONGLONG time, bool hasTime, LONGLONG duration,
-                bool hasDuration) override {
+                bool hasDuration, bool) override {
     if (!hasTime) time = nextTime_;
     if (!hasDuration) duration = frameInterval_;
     nextTime_ = time + duration;
@@ -459,6 +460,72 @@ class VideoEncoder : public StreamEncoder {
   BufferRefPtr hardwareFrames_;
 };
 
+// ---- H.264 in, H.264 out ----
+
+// Writes samples that are H.264 already (a camera that encodes its own stream) into the file as
+// they are. The parameter sets come from MF_MT_MPEG_SEQUENCE_HEADER (start-code form, as cameras
+// send them), on the input type or else the output type; without one the MP4 muxer takes them
+// from the first sample, which must then be a key frame that carries them.
+class VideoCopy : public StreamEncoder {
+ public:
+  using StreamEncoder::StreamEncoder;
+
+  HRESULT open(IMFMediaType* output, IMFMediaType* input) {
+    UINT32 width = 0, height = 0, inWidth = 0, inHeight = 0;
+    if (!getPair(output, MF_MT_FRAME_SIZE, &width, &height) || !width || !height) return MF_E_INVALIDMEDIATYPE;
+    if (!getPair(input, MF_MT_FRAME_SIZE, &inWidth, &inHeight) || inWidth != width || inHeight != height)
+      return MF_E_INVALIDMEDIATYPE;  // a copy cannot scale
+    UINT32 rateNum = 30, rateDen = 1;
+    if (!getPair(output, MF_MT_FRAME_RATE, &rateNum, &rateDen) || !rateNum || !rateDen) rateNum = 30, rateDen = 1;
+    const AVRational rate{static_cast<int>(rateNum), static_cast<int>(rateDen)};
+    frameInterval_ = av_rescale_q(1, av_inv_q(rate), hundredNanoseconds);
+
+    AVCodecParameters* codec = stream_->codecpar;
+    codec->codec_type = AVMEDIA_TYPE_VIDEO;
+    codec->codec_id = AV_CODEC_ID_H264;
+    codec->width = static_cast<int>(width);
+    codec->height = static_cast<int>(height);
+    codec->sample_aspect_ratio = {1, 1};
+    UINT32 size = 0;
+    IMFMediaType* withHeader = SUCCEEDED(input->GetBlobSize(MF_MT_MPEG_SEQUENCE_HEADER, &size)) ? input : output;
+    if (SUCCEEDED(withHeader->GetBlobSize(MF_MT_MPEG_SEQUENCE_HEADER, &size)) && size > 0) {
+      codec->extradata = static_cast<uint8_t*>(av_mallocz(size + AV_INPUT_BUFFER_PADDING_SIZE));
+      if (!codec->extradata) return E_OUTOFMEMORY;
+      codec->extradata_size = static_cast<int>(size);
+      HRESULT hr = withHeader->GetBlob(MF_MT_MPEG_SEQUENCE_HEADER, codec->extradata, size, nullptr);
+      if (FAILED(hr)) return hr;
+    }
+    stream_->time_base = {1, videoTimescale};
+    stream_->avg_frame_rate = rate;
+    stream_->r_frame_rate = rate;
+    return S_OK;
+  }
+
+  HRESULT write(const uint8_t* data, DWORD length, LONGLONG time, bool hasTime, LONGLONG duration,
+                bool hasDuration, bool cleanPoint) override {
+    if (!hasTime) time = nextTime_;
+    if (!hasDuration) duration = frameInterval_;
+    nextTime_ = time + duration;
+    if (length == 0) return S_OK;  // nothing to copy
+    int result = av_new_packet(packet_.get(), static_cast<int>(length));
+    if (result < 0) return fromAv(result);
+    std::memcpy(packet_->data, data, length);
+    if (cleanPoint) packet_->flags |= AV_PKT_FLAG_KEY;
+    // Cameras send no reordered frames, so decoding order is presentation order.
+    packet_->pts = packet_->dts = av_rescale_q(time, hundredNanoseconds, stream_->time_base);
+    packet_->duration = av_rescale_q(duration, hundredNanoseconds, stream_->time_base);
+    HRESULT hr = mux(packet_.get());
+    av_packet_unref(packet_.get());
+    return hr;
+  }
+
+  HRESULT finish() override { return S_OK; }  // nothing is held back
+
+ private:
+  LONGLONG frameInterval_ = 333333;
+  LONGLONG nextTime_ = 0;
+};
+
 // ---- AAC ----
 
 bool inputSamples(REFGUID subtype, UINT32 bits, AVSampleFormat* format) {
@@ -561,7 +628,7 @@ class AudioEncoder : public StreamEncoder {
   // The samples go through the converter into the FIFO, which the encoder empties in frames of
   // its own size. A sample time well ahead of where the audio has got to (a gap in capture)
   // is filled with silence, so the file keeps the samples' times.
-  HRESULT write(const uint8_t* data, DWORD length, LONGLONG time, bool hasTime, LONGLONG, bool) override {
+  HRESULT write(const uint8_t* data, DWORD length, LONGLONG time, bool hasTime, LONGLONG, bool, bool) override {
     const int frames = static_cast<int>(length / blockAlign_);
     if (hasTime) {
       const int64_t position = av_rescale_q(time, hundredNanoseconds, {1, static_cast<int>(rate_)});
@@ -762,7 +829,11 @@ class SinkWriter : public ComObject<IMFSinkWriter, IID_IMFSinkWriter> {
     if (getGuid(input, MF_MT_MAJOR_TYPE) != outMajor) return MF_E_INVALIDMEDIATYPE;
     HRESULT hr;
     std::unique_ptr<StreamEncoder> encoder;
-    if (outMajor == MFMediaType_Video) {
+    if (outMajor == MFMediaType_Video && getGuid(input, MF_MT_SUBTYPE) == MFVideoFormat_H264) {
+      auto copy = std::make_unique<VideoCopy>(format_, slot.stream);
+      hr = copy->open(slot.output, input);
+      encoder = std::move(copy);
+    } else if (outMajor == MFMediaType_Video) {
       auto video = std::make_unique<VideoEncoder>(format_, slot.stream);
       hr = video->open(slot.output, input, hardware_);
       encoder = std::move(video);
@@ -817,7 +888,8 @@ class SinkWriter : public ComObject<IMFSinkWriter, IID_IMFSinkWriter> {
         return hr;
       }
     }
-    hr = slot.encoder->write(data, length, time, hasTime, duration, hasDuration);
+    hr = slot.encoder->write(data, length, time, hasTime, duration, hasDuration,
+                             get32(sample, MFSampleExtension_CleanPoint, FALSE) != FALSE);
     if (buffer) {
       buffer->Unlock();
       buffer->Release();
