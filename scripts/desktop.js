@@ -37,6 +37,8 @@ function pulseConfig(dir, sinks, microphone) {
   }
   if (sinks.length) lines.push(`set-default-sink ${sinks.find((s) => s.default)?.name || sinks[0].name}`);
   if (microphone) {
+    // A sine source renders two seconds ahead at a time, whatever latency its readers ask for:
+    // a microphone whose sound arrives in two-second lumps, stamped as if just captured.
     lines.push(`load-module module-sine-source source_name=${microphone.name} rate=${microphone.rate || 48000} ` +
       `frequency=${microphone.frequency || 440} source_properties="device.description='${microphone.description}'"`);
   }

@@ -69,10 +69,12 @@ test('cameras and capture-device microphones', async (t) => {
       const started = Date.now();
       addon.startCapture(0, ${JSON.stringify(video)});
       addon.startCapture(2, ${JSON.stringify(audio)});
-      await sleep(4000);
-      addon.stopCapture(0);
-      addon.stopCapture(2);
+      // Not a multiple of two seconds: the test microphone hands over its sound two seconds at a
+      // time, so only a cut inside its buffers gives the right length.
+      await sleep(3000);
       const seconds = (Date.now() - started) / 1000;
+      addon.stopCapture(0);
+      addon.stopCapture(2);  // waits until the microphone's sound has reached the stop
       await sleep(3000);  // the files are finished on the engines' threads
       report({ seconds, clips: events.filter((e) => e.type === 'new-clip') });
     `, { env });

@@ -197,8 +197,9 @@ inline constexpr GUID deviceAudioRate = {0x7d1c2a40, 0x5b3e, 0x4c61, {0x9f, 0x20
 inline constexpr GUID deviceAudioChannels = {0x7d1c2a40, 0x5b3e, 0x4c61, {0x9f, 0x20, 0x3a, 0x11, 0x6e, 0x52, 0x90, 0x02}};
 
 // Makes a device object with the given category, friendly name and link (the symbolic link of a
-// camera, e.g. "v4l2:/dev/video0" or "lavfi:testsrc2=size=640x480:rate=30"; the PulseAudio source
-// name of a microphone).
+// camera, e.g. "v4l2:/dev/video0", "lavfi:testsrc2=size=640x480:rate=30", or, for a test camera
+// that sends H.264 as it encodes it itself, "lavfi:h264:testsrc2=size=640x480:rate=30"; the
+// PulseAudio source name of a microphone).
 HRESULT createDeviceActivate(REFGUID category, const std::wstring& friendlyName, const std::wstring& link,
                              IMFActivate** activate);
 

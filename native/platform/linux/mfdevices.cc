@@ -62,7 +62,8 @@ std::vector<Device> videoDevices() {
     }
     close(fd);
   }
-  // Test cameras: "Name=lavfi graph" entries separated by ';'.
+  // Test cameras: "Name=lavfi graph" entries separated by ';'; a graph written "h264:<graph>"
+  // makes a camera that sends H.264 (the engine reads the link "lavfi:h264:<graph>").
   if (const char* list = std::getenv("TAVIO_TEST_CAMERAS")) {
     std::string text = list;
     size_t start = 0;

@@ -1,0 +1,301 @@
+// The Linux capture engine with cameras that send H.264. One is a raw H.264 file read through
+// FFmpeg's h264 demuxer, as a V4L2 camera's stream is read: start-code packets with the parameter
+// sets before each key frame, no key frame on request, and a first packet that is not a key frame
+// (the stream was joined between two). The other is the lavfi test camera that encodes itself.
+#include <gtest/gtest.h>
+
+#include <chrono>
+#include <condition_variable>
+#include <fstream>
+#include <mutex>
+#include <thread>
+#include <vector>
+
+#include "capture/video/camera/mfce/capturemanager.h"
+#include "capture/video/camera/mfce/mfcesource.h"
+#include "media.h"
+#include "platform/linux/mfcapture.h"
+
+namespace {
+
+struct MediaFoundation {
+  MediaFoundation() { EXPECT_EQ(MFStartup(MF_VERSION, MFSTARTUP_FULL), S_OK); }
+  ~MediaFoundation() { EXPECT_EQ(MFShutdown(), S_OK); }
+};
+
+class Events : public platform::ComObject<IMFCaptureEngineOnEventCallback, IID_IMFCaptureEngineOnEventCallback> {
+ public:
+  HRESULT OnEvent(IMFMediaEvent* event) override {
+    GUID type = GUID_NULL;
+    HRESULT status = S_OK;
+    event->GetExtendedType(&type);
+    event->GetStatus(&status);
+    std::lock_guard<std::mutex> lock(mutex_);
+    seen_.push_back({type, status});
+    changed_.notify_all();
+    return S_OK;
+  }
+
+  // The status of the first event of this type, waiting up to 20 seconds for it; S_FALSE if none came.
+  HRESULT waitFor(const GUID& type) {
+    std::unique_lock<std::mutex> lock(mutex_);
+    HRESULT status = S_FALSE;
+    changed_.wait_for(lock, std::chrono::seconds(20), [&] {
+      for (const auto& [seenType, seenStatus] : seen_)
+        if (seenType == type) {
+          status = seenStatus;
+          return true;
+        }
+      return false;
+    });
+    return status;
+  }
+
+ private:
+  std::mutex mutex_;
+  std::condition_variable changed_;
+  std::vector<std::pair<GUID, HRESULT>> seen_;
+};
+
+// The camera's packets from `first` on, one after the other in a raw H.264 file.
+void writeRawStream(const std::string& path, const media::CameraStream& camera, size_t first) {
+  std::ofstream file(path, std::ios::binary);
+  for (size_t i = first; i < camera.packets.size(); ++i)
+    file.write(reinterpret_cast<const char*>(camera.packets[i].data()), camera.packets[i].size());
+}
+
+// Records the camera file with an engine whose record stream asks for H.264 of the camera's
+// size, with `bitRate` when it is not 0; returns once the engine has read the whole file (the
+// end of a device ends the recording and finishes the file).
+void record(const std::string& camera, const std::string& clip, UINT32 bitRate) {
+  IMFCaptureEngineClassFactory* factory = nullptr;
+  ASSERT_EQ(platform::createCaptureEngineClassFactory(IID_IMFCaptureEngineClassFactory,
+                                                       reinterpret_cast<void**>(&factory)),
+            S_OK);
+  IMFCaptureEngine* engine = nullptr;
+  ASSERT_EQ(factory->CreateInstance(CLSID_MFCaptureEngine, IID_IMFCaptureEngine, reinterpret_cast<void**>(&engine)),
+            S_OK);
+  factory->Release();
+  IMFActivate* device = nullptr;
+  ASSERT_EQ(platform::createDeviceActivate(MF_DEVSOURCE_ATTRIBUTE_SOURCE_TYPE_VIDCAP_GUID, L"H.264 Camera",
+                                           platform::widen("h264:" + camera), &device),
+            S_OK);
+  auto* events = new Events;
+  EXPECT_EQ(engine->Initialize(events, nullptr, nullptr, device), S_OK);
+  EXPECT_EQ(events->waitFor(MF_CAPTURE_ENGINE_INITIALIZED), S_OK);
+
+  IMFCaptureSource* source = nullptr;
+  IMFMediaType* deviceType = nullptr;
+  EXPECT_EQ(engine->GetSource(&source), S_OK);
+  EXPECT_EQ(source->GetCurrentDeviceMediaType(MF_CAPTURE_ENGINE_PREFERRED_SOURCE_STREAM_FOR_VIDEO_RECORD, &deviceType),
+            S_OK);
+  GUID subtype = GUID_NULL;
+  deviceType->GetGUID(MF_MT_SUBTYPE, &subtype);
+  EXPECT_EQ(subtype, MFVideoFormat_H264);
+
+  IMFMediaType* recordType = nullptr;
+  MFCreateMediaType(&recordType);
+  deviceType->CopyAllItems(recordType);
+  if (bitRate) recordType->SetUINT32(MF_MT_AVG_BITRATE, bitRate);
+  IMFCaptureSink* sink = nullptr;
+  IMFCaptureRecordSink* recordSink = nullptr;
+  EXPECT_EQ(engine->GetSink(MF_CAPTURE_ENGINE_SINK_TYPE_RECORD, &sink), S_OK);
+  EXPECT_EQ(sink->QueryInterface(IID_IMFCaptureRecordSink, reinterpret_cast<void**>(&recordSink)), S_OK);
+  DWORD index = 0;
+  EXPECT_EQ(recordSink->AddStream(MF_CAPTURE_ENGINE_PREFERRED_SOURCE_STREAM_FOR_VIDEO_RECORD, recordType, nullptr, &index),
+            S_OK);
+  EXPECT_EQ(recordSink->SetOutputFileName(platform::widen(clip).c_str()), S_OK);
+  EXPECT_EQ(engine->StartRecord(), S_OK);
+  EXPECT_EQ(events->waitFor(MF_CAPTURE_ENGINE_RECORD_STARTED), S_OK);
+  EXPECT_EQ(events->waitFor(MF_CAPTURE_ENGINE_ERROR), MF_E_VIDEO_RECORDING_DEVICE_INVALIDATED);
+
+  for (IUnknown* object : std::initializer_list<IUnknown*>{recordSink, sink, recordType, deviceType, source, engine,
+                                                           device, events})
+    object->Release();
+}
+
+TEST(LinuxCaptureEngine, H264CameraIsRecordedAsItSendsItFromItsFirstKeyFrame) {
+  MediaFoundation started;
+  media::TempFolder folder;
+  const media::CameraStream camera = media::cameraStream(160, 120, 75, 30, false);
+  ASSERT_EQ(camera.packets.size(), 75u);
+  writeRawStream(folder.file("camera.h264"), camera, 10);  // joined a third into its first group
+  const std::string clip = folder.file("clip.mp4");
+  record(folder.file("camera.h264"), clip, 0);
+
+  // Packets 30 to 74 of the camera: the first key frame on, at 0 and a frame apart.
+  const std::vector<bool> keys(camera.keys.begin() + 30, camera.keys.end());
+  ASSERT_TRUE(keys[0]);
+  const media::File file = media::probe(clip);
+  ASSERT_TRUE(file.opened);
+  ASSERT_EQ(file.streams.size(), 1u);
+  const media::Stream& video = file.streams[0];
+  EXPECT_EQ(video.codec, "h264");
+  EXPECT_EQ(video.profile, FF_PROFILE_H264_HIGH);  // the camera's; the engine's own encoding is Baseline
+  ASSERT_EQ(video.packets.size(), keys.size());
+  for (size_t i = 0; i < video.packets.size(); ++i) EXPECT_NEAR(video.packets[i].time, i / 30.0, 1e-3) << "packet " << i;
+  EXPECT_EQ(media::containerKeys(clip), keys);
+  const media::Decoded decoded = media::decode(clip, AVMEDIA_TYPE_VIDEO);
+  EXPECT_EQ(decoded.errors, 0);
+  EXPECT_EQ(decoded.frames, static_cast<int>(keys.size()));
+}
+
+TEST(LinuxCaptureEngine, H264CameraIsEncodedAgainWhenTheRecordStreamHasABitRate) {
+  MediaFoundation started;
+  media::TempFolder folder;
+  const media::CameraStream camera = media::cameraStream(160, 120, 75, 30, false);
+  ASSERT_EQ(camera.packets.size(), 75u);
+  writeRawStream(folder.file("camera.h264"), camera, 10);
+  const std::string clip = folder.file("clip.mp4");
+  record(folder.file("camera.h264"), clip, 500000);
+
+  const media::File file = media::probe(clip);
+  ASSERT_TRUE(file.opened);
+  ASSERT_EQ(file.streams.size(), 1u);
+  EXPECT_EQ(file.streams[0].codec, "h264");
+  EXPECT_EQ(file.streams[0].profile & ~FF_PROFILE_H264_CONSTRAINED, FF_PROFILE_H264_BASELINE);
+  const media::Decoded decoded = media::decode(clip, AVMEDIA_TYPE_VIDEO);
+  EXPECT_EQ(decoded.errors, 0);
+  EXPECT_EQ(decoded.frames, 45);  // every picture from the first the engine could decode
+}
+
+template <class Condition>
+bool eventually(Condition condition) {
+  for (int i = 0; i < 500 && !condition(); ++i) std::this_thread::sleep_for(std::chrono::milliseconds(10));
+  return condition();
+}
+
+// The test camera that encodes its pictures itself, through the camera source as the add-on
+// uses it: a decoded preview, and a recording of its own packets.
+TEST(LinuxCaptureEngine, H264TestCameraPreviewsItsPictureAndRecordsItsOwnStream) {
+  IMFActivate* camera = nullptr;
+  ASSERT_EQ(platform::createDeviceActivate(MF_DEVSOURCE_ATTRIBUTE_SOURCE_TYPE_VIDCAP_GUID, L"H.264 Camera",
+                                           L"lavfi:h264:color=c=red:size=160x120:rate=30", &camera),
+            S_OK);
+  capture::video::camera::mfce::MFCESource source(nullptr, camera, false);
+  camera->Release();
+  source.startPreview();
+  EXPECT_EQ(160u, source.width());
+  EXPECT_EQ(120u, source.height());
+  std::vector<uint8_t> picture(16 * 12 * 4, 0);
+  ASSERT_TRUE(eventually([&] { return source.preview(picture.data(), 0, 16, 12); }));
+  EXPECT_LT(picture[0], 30);  // B, G, R, A
+  EXPECT_LT(picture[1], 30);
+  EXPECT_GT(picture[2], 220);
+
+  media::TempFolder folder;
+  const std::string clip = folder.file("clip.mp4");
+  source.startEncode(clip);
+  EXPECT_TRUE(eventually([&] { return source.manager()->IsRecording(); }));
+  std::this_thread::sleep_for(std::chrono::milliseconds(1500));
+  source.stopEncode();
+  EXPECT_TRUE(eventually([&] { return !source.manager()->IsRecording(); }));
+  source.stopPreview();
+
+  const media::File file = media::probe(clip);
+  ASSERT_TRUE(file.opened);
+  ASSERT_EQ(file.streams.size(), 1u);
+  EXPECT_EQ(file.streams[0].profile, FF_PROFILE_H264_MAIN);  // the camera's; the engine's own is Baseline
+  const std::vector<bool> keys = media::containerKeys(clip);
+  ASSERT_GE(keys.size(), 30u);
+  EXPECT_TRUE(keys[0]);  // asked for at the start
+  EXPECT_TRUE(keys[30]);  // the camera's own, every second
+  const media::Decoded decoded = media::decode(clip, AVMEDIA_TYPE_VIDEO);
+  EXPECT_EQ(decoded.errors, 0);
+  EXPECT_EQ(decoded.frames, static_cast<int>(keys.size()));
+}
+
+// Keeps the first picture it is given and remembers its bytes as they were then; counts the rest.
+class KeepFirstPicture
+    : public platform::ComObject<IMFCaptureEngineOnSampleCallback, IID_IMFCaptureEngineOnSampleCallback> {
+ public:
+  ~KeepFirstPicture() override {
+    if (kept_) kept_->Release();
+  }
+  HRESULT OnSample(IMFSample* sample) override {
+    std::lock_guard<std::mutex> lock(mutex_);
+    if (!kept_) {
+      kept_ = sample;
+      kept_->AddRef();
+      bytesAtDelivery_ = bytes(sample);
+    }
+    ++pictures_;
+    return S_OK;
+  }
+  int pictures() {
+    std::lock_guard<std::mutex> lock(mutex_);
+    return pictures_;
+  }
+  // The kept picture's bytes now, and as they were when it came.
+  std::pair<std::vector<uint8_t>, std::vector<uint8_t>> kept() {
+    std::lock_guard<std::mutex> lock(mutex_);
+    return {kept_ ? bytes(kept_) : std::vector<uint8_t>{}, bytesAtDelivery_};
+  }
+
+ private:
+  static std::vector<uint8_t> bytes(IMFSample* sample) {
+    IMFMediaBuffer* buffer = nullptr;
+    if (FAILED(sample->GetBufferByIndex(0, &buffer))) return {};
+    BYTE* data = nullptr;
+    DWORD length = 0;
+    buffer->Lock(&data, nullptr, &length);
+    std::vector<uint8_t> copy(data, data + length);
+    buffer->Unlock();
+    buffer->Release();
+    return copy;
+  }
+
+  std::mutex mutex_;
+  IMFSample* kept_ = nullptr;
+  std::vector<uint8_t> bytesAtDelivery_;
+  int pictures_ = 0;
+};
+
+// The engine writes picture after picture into one buffer when it can; a picture that a preview
+// callback still holds must keep its bytes.
+TEST(LinuxCaptureEngine, APictureACallbackKeepsIsNotOverwrittenByTheNextOnes) {
+  MediaFoundation started;
+  IMFCaptureEngineClassFactory* factory = nullptr;
+  ASSERT_EQ(platform::createCaptureEngineClassFactory(IID_IMFCaptureEngineClassFactory,
+                                                       reinterpret_cast<void**>(&factory)),
+            S_OK);
+  IMFCaptureEngine* engine = nullptr;
+  ASSERT_EQ(factory->CreateInstance(CLSID_MFCaptureEngine, IID_IMFCaptureEngine, reinterpret_cast<void**>(&engine)),
+            S_OK);
+  factory->Release();
+  IMFActivate* device = nullptr;
+  // Every picture differs from the one before: the pattern moves.
+  ASSERT_EQ(platform::createDeviceActivate(MF_DEVSOURCE_ATTRIBUTE_SOURCE_TYPE_VIDCAP_GUID, L"Moving Camera",
+                                           L"lavfi:testsrc2=size=64x48:rate=30", &device),
+            S_OK);
+  auto* events = new Events;
+  EXPECT_EQ(engine->Initialize(events, nullptr, nullptr, device), S_OK);
+  EXPECT_EQ(events->waitFor(MF_CAPTURE_ENGINE_INITIALIZED), S_OK);
+
+  IMFCaptureSink* sink = nullptr;
+  IMFCapturePreviewSink* previewSink = nullptr;
+  IMFMediaType* type = nullptr;
+  EXPECT_EQ(engine->GetSink(MF_CAPTURE_ENGINE_SINK_TYPE_PREVIEW, &sink), S_OK);
+  EXPECT_EQ(sink->QueryInterface(IID_IMFCapturePreviewSink, reinterpret_cast<void**>(&previewSink)), S_OK);
+  MFCreateMediaType(&type);
+  type->SetGUID(MF_MT_MAJOR_TYPE, MFMediaType_Video);
+  type->SetGUID(MF_MT_SUBTYPE, MFVideoFormat_ARGB32);
+  DWORD index = 0;
+  EXPECT_EQ(previewSink->AddStream(MF_CAPTURE_ENGINE_PREFERRED_SOURCE_STREAM_FOR_VIDEO_PREVIEW, type, nullptr, &index),
+            S_OK);
+  auto* callback = new KeepFirstPicture;
+  EXPECT_EQ(previewSink->SetSampleCallback(index, callback), S_OK);
+  EXPECT_EQ(engine->StartPreview(), S_OK);
+  EXPECT_EQ(events->waitFor(MF_CAPTURE_ENGINE_PREVIEW_STARTED), S_OK);
+  EXPECT_TRUE(eventually([&] { return callback->pictures() >= 10; }));
+  EXPECT_EQ(engine->StopPreview(), S_OK);
+  EXPECT_EQ(events->waitFor(MF_CAPTURE_ENGINE_PREVIEW_STOPPED), S_OK);
+
+  const auto [now, atDelivery] = callback->kept();
+  ASSERT_EQ(atDelivery.size(), 64u * 48u * 4u);
+  EXPECT_TRUE(now == atDelivery);
+  for (IUnknown* object : std::initializer_list<IUnknown*>{type, previewSink, sink, engine, device, events, callback})
+    object->Release();
+}
+
+}  // namespace
