@@ -3,7 +3,8 @@
 // Finds every capture device, saves a preview picture of each display and camera, records a
 // few seconds of every source into MP4 files and prints the events. Without DISPLAY or
 // PULSE_SERVER in the environment it starts a private virtual desktop with a moving picture
-// and a tone playing, and (unless TAVIO_TEST_CAMERAS says otherwise) a test camera. Files go to
+// and a tone playing, and (unless TAVIO_TEST_CAMERAS says otherwise) two test cameras, one of
+// them sending H.264. Files go to
 // ./out (or the folder named as the first argument).
 const { execFileSync, spawnSync } = require('child_process');
 const fs = require('fs');
@@ -43,8 +44,10 @@ async function main() {
     helpers.push(startAnimation(desktop.env, { x: 200, y: 150 }));
     console.log(`demo: private display ${desktop.env.DISPLAY} with a moving picture`);
     if (process.env.TAVIO_TEST_CAMERAS === undefined) {
-      process.env.TAVIO_TEST_CAMERAS = 'Demo Test Camera=testsrc2=size=640x480:rate=30';
-      console.log('demo: test camera "Demo Test Camera" (an FFmpeg test pattern)');
+      process.env.TAVIO_TEST_CAMERAS =
+        'Demo Test Camera=testsrc2=size=640x480:rate=30;Demo H.264 Camera=h264:smptebars=size=640x360:rate=30';
+      console.log('demo: test cameras "Demo Test Camera" (an FFmpeg test pattern) and "Demo H.264 Camera"'
+        + ' (colour bars sent as H.264, recorded as sent)');
     }
   }
   if (!givenSound) {
