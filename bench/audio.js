@@ -14,6 +14,9 @@
 //   capture + main loop / FFmpeg    the same work FFmpeg does (read the monitor, encode, mux).
 // The capture thread's CPU is also measured for a few seconds with preview on and recording
 // off, so the encoder's share shows. Voluntary context switches count the wake-ups per thread.
+// A floor is printed as well: FFmpeg's AAC encoder on the same tone from a file (the encoder both
+// sides use) plus a bare loop of 5 ms sleeps (test/tools/sleeploop.cc, the capture loop's wait
+// while its buffer is empty); a recording that polls cannot cost less than the two together.
 //
 // Latency: test/tools/tonestart.cc (built here with g++) plays silence into the sink through a
 // 5 ms stream, then tones separated by silence. For each tone it prints the monotonic time at
@@ -52,6 +55,8 @@ async function main() {
     execFileSync('sox', ['-n', '-r', '48000', '-c', '2', '-b', '16', tone, 'synth', String(seconds + 15), 'sine', '440', 'vol', '0.5']);
     const tonestart = path.join(dir, 'tonestart');
     execFileSync('g++', ['-O2', '-o', tonestart, path.join(root, 'test/tools/tonestart.cc'), '-lpulse']);
+    const sleeploop = path.join(dir, 'sleeploop');
+    execFileSync('g++', ['-O2', '-o', sleeploop, path.join(root, 'test/tools/sleeploop.cc')]);
 
     const clip = path.join(dir, 'addon.mp4');
     const { reports, code, stdout, stderr } = await runAddon(`
@@ -127,6 +132,17 @@ async function main() {
     player.kill();
     const [user, system, elapsed, ffmpegWakeups] = timed.stderr.trim().split('\n').pop().split(' ').map(Number);
 
+    // What no recording here can go below: the encoder's own work (FFmpeg's AAC encoder, which
+    // both sides use, on the same tone read from a file, less FFmpeg's start-up measured on a
+    // tenth of a second of it) and the cost of polling every 5 ms.
+    const cpuOf = (args) => {
+      const run = spawnSync('/usr/bin/time', ['-f', '%U %S', 'ffmpeg', '-v', 'error', '-y', ...args], { encoding: 'utf8' });
+      return run.stderr.trim().split('\n').pop().split(' ').map(Number).reduce((a, b) => a + b, 0);
+    };
+    const aacArgs = (length) => ['-t', String(length), '-i', tone, '-c:a', 'aac', '-b:a', '192k', path.join(dir, 'file.mp4')];
+    const aacOnly = Math.max(0, cpuOf(aacArgs(seconds)) - cpuOf(aacArgs(0.1)));
+    const [polls, pollCpu, pollWall] = execFileSync(sleeploop, ['5'], { encoding: 'utf8' }).trim().split(' ').map(Number);
+
     // Threads in tid order: main loop, silence, capture.
     const cpu = addonRun.ticks.map((t) => t / 100);
     const [mainLoop, silence, capture] = cpu;
@@ -147,6 +163,11 @@ async function main() {
     console.log(`ffmpeg  CPU ${ffmpegCpu.toFixed(2)} s (${(100 * ffmpegRate).toFixed(2)} % of a core, ${elapsed} s, ${ffmpegWakeups} wake-ups)`);
     console.log(`ratio all three threads / ffmpeg: ${(rate(total) / ffmpegRate).toFixed(2)} (target <= 1)`);
     console.log(`ratio capture + main loop / ffmpeg: ${(rate(capture + mainLoop) / ffmpegRate).toFixed(2)}`);
+    const aacRate = aacOnly / seconds;
+    const pollRate = pollCpu / pollWall;
+    console.log(`floor: AAC alone ${(100 * aacRate).toFixed(2)} % of a core (${aacOnly.toFixed(2)} s for ${seconds} s from a file), ` +
+      `a bare 5 ms polling loop ${(100 * pollRate).toFixed(2)} % (${(1e6 * pollCpu / polls).toFixed(0)} us a wake-up); ` +
+      `their sum / ffmpeg: ${((aacRate + pollRate) / ffmpegRate).toFixed(2)}`);
     const seen = addonRun.latency.filter((l) => l);
     const list = (key) => seen.map((l) => l[key].toFixed(1)).join(' ');
     console.log(`latency tone -> first peak, ${seen.length}/${addonRun.latency.length} tones seen (target < 50 ms):`);

@@ -17,11 +17,13 @@ using pulse::Lock;
 
 constexpr int64_t kUnitsPerSecond = 10000000;
 // Small record fragments keep loopback packets within milliseconds of what the sink plays; an idle
-// null sink otherwise holds its monitor data back for up to two seconds. The playback target only
+// null sink otherwise holds its monitor data back for up to two seconds. Each fragment costs the
+// main loop two wake-ups (the data, and the release of its shared memory): 20 ms fragments need a
+// third fewer than 10 ms ones and still show a tone within about 10 ms. The playback target only
 // sets how much silence waits in the server: 100 ms needs far fewer refills (each one a server
 // request and a write the main loop must send) than 20 ms.
 constexpr int64_t kPlaybackTarget = 1000000;  // 100 ms queued ahead of the sink
-constexpr int64_t kRecordFragment = 100000;   // 10 ms fragments from the monitor
+constexpr int64_t kRecordFragment = 200000;   // 20 ms fragments from the monitor
 constexpr int64_t kShortestBuffer = 100000;
 // Packet times follow the sample count; when they drift this far from the clock, samples were lost
 // (or the sink stalled) and the next packet starts a new time line with a discontinuity.
