@@ -67,22 +67,35 @@ void writeRawStream(const std::string& path, const media::CameraStream& camera, 
 // Records the camera file with an engine whose record stream asks for H.264 of the camera's
 // size, with `bitRate` when it is not 0; returns once the engine has read the whole file (the
 // end of a device ends the recording and finishes the file).
-void record(const std::string& camera, const std::string& clip, UINT32 bitRate) {
-  IMFCaptureEngineClassFactory* factory = nullptr;
-  ASSERT_EQ(platform::createCaptureEngineClassFactory(IID_IMFCaptureEngineClassFactory,
-                                                       reinterpret_cast<void**>(&factory)),
-            S_OK);
+// An engine initialised for the camera behind `link`, with its event callback; released at the end.
+struct InitializedEngine {
+  explicit InitializedEngine(const std::wstring& link) {
+    IMFCaptureEngineClassFactory* factory = nullptr;
+    EXPECT_EQ(platform::createCaptureEngineClassFactory(IID_IMFCaptureEngineClassFactory,
+                                                         reinterpret_cast<void**>(&factory)),
+              S_OK);
+    EXPECT_EQ(factory->CreateInstance(CLSID_MFCaptureEngine, IID_IMFCaptureEngine, reinterpret_cast<void**>(&engine)),
+              S_OK);
+    factory->Release();
+    EXPECT_EQ(platform::createDeviceActivate(MF_DEVSOURCE_ATTRIBUTE_SOURCE_TYPE_VIDCAP_GUID, L"Camera", link, &device),
+              S_OK);
+    EXPECT_EQ(engine->Initialize(events, nullptr, nullptr, device), S_OK);
+    EXPECT_EQ(events->waitFor(MF_CAPTURE_ENGINE_INITIALIZED), S_OK);
+  }
+  ~InitializedEngine() {
+    engine->Release();
+    device->Release();
+    events->Release();
+  }
   IMFCaptureEngine* engine = nullptr;
-  ASSERT_EQ(factory->CreateInstance(CLSID_MFCaptureEngine, IID_IMFCaptureEngine, reinterpret_cast<void**>(&engine)),
-            S_OK);
-  factory->Release();
   IMFActivate* device = nullptr;
-  ASSERT_EQ(platform::createDeviceActivate(MF_DEVSOURCE_ATTRIBUTE_SOURCE_TYPE_VIDCAP_GUID, L"H.264 Camera",
-                                           platform::widen("h264:" + camera), &device),
-            S_OK);
-  auto* events = new Events;
-  EXPECT_EQ(engine->Initialize(events, nullptr, nullptr, device), S_OK);
-  EXPECT_EQ(events->waitFor(MF_CAPTURE_ENGINE_INITIALIZED), S_OK);
+  Events* events = new Events;
+};
+
+void record(const std::string& camera, const std::string& clip, UINT32 bitRate) {
+  InitializedEngine initialized(platform::widen("h264:" + camera));
+  IMFCaptureEngine* engine = initialized.engine;
+  Events* events = initialized.events;
 
   IMFCaptureSource* source = nullptr;
   IMFMediaType* deviceType = nullptr;
@@ -109,8 +122,7 @@ void record(const std::string& camera, const std::string& clip, UINT32 bitRate) 
   EXPECT_EQ(events->waitFor(MF_CAPTURE_ENGINE_RECORD_STARTED), S_OK);
   EXPECT_EQ(events->waitFor(MF_CAPTURE_ENGINE_ERROR), MF_E_VIDEO_RECORDING_DEVICE_INVALIDATED);
 
-  for (IUnknown* object : std::initializer_list<IUnknown*>{recordSink, sink, recordType, deviceType, source, engine,
-                                                           device, events})
+  for (IUnknown* object : std::initializer_list<IUnknown*>{recordSink, sink, recordType, deviceType, source})
     object->Release();
 }
 
@@ -255,22 +267,10 @@ class KeepFirstPicture
 // callback still holds must keep its bytes.
 TEST(LinuxCaptureEngine, APictureACallbackKeepsIsNotOverwrittenByTheNextOnes) {
   MediaFoundation started;
-  IMFCaptureEngineClassFactory* factory = nullptr;
-  ASSERT_EQ(platform::createCaptureEngineClassFactory(IID_IMFCaptureEngineClassFactory,
-                                                       reinterpret_cast<void**>(&factory)),
-            S_OK);
-  IMFCaptureEngine* engine = nullptr;
-  ASSERT_EQ(factory->CreateInstance(CLSID_MFCaptureEngine, IID_IMFCaptureEngine, reinterpret_cast<void**>(&engine)),
-            S_OK);
-  factory->Release();
-  IMFActivate* device = nullptr;
   // Every picture differs from the one before: the pattern moves.
-  ASSERT_EQ(platform::createDeviceActivate(MF_DEVSOURCE_ATTRIBUTE_SOURCE_TYPE_VIDCAP_GUID, L"Moving Camera",
-                                           L"lavfi:testsrc2=size=64x48:rate=30", &device),
-            S_OK);
-  auto* events = new Events;
-  EXPECT_EQ(engine->Initialize(events, nullptr, nullptr, device), S_OK);
-  EXPECT_EQ(events->waitFor(MF_CAPTURE_ENGINE_INITIALIZED), S_OK);
+  InitializedEngine initialized(L"lavfi:testsrc2=size=64x48:rate=30");
+  IMFCaptureEngine* engine = initialized.engine;
+  Events* events = initialized.events;
 
   IMFCaptureSink* sink = nullptr;
   IMFCapturePreviewSink* previewSink = nullptr;
@@ -294,7 +294,7 @@ TEST(LinuxCaptureEngine, APictureACallbackKeepsIsNotOverwrittenByTheNextOnes) {
   const auto [now, atDelivery] = callback->kept();
   ASSERT_EQ(atDelivery.size(), 64u * 48u * 4u);
   EXPECT_TRUE(now == atDelivery);
-  for (IUnknown* object : std::initializer_list<IUnknown*>{type, previewSink, sink, engine, device, events, callback})
+  for (IUnknown* object : std::initializer_list<IUnknown*>{type, previewSink, sink, callback})
     object->Release();
 }
 
