@@ -188,6 +188,38 @@ class StreamEncoder {
 
 // ---- H.264 ----
 
+// A video stream's sample times. The rate is the output type's (30/1 when it names none); a
+// sample without a time follows the one before, one without a duration lasts one frame.
+class VideoClock {
+ public:
+  // Reads the rate and declares it on the stream, whose times are in 1/90000 s.
+  void open(IMFMediaType* output, AVStream* stream) {
+    UINT32 num = 30, den = 1;
+    if (!getPair(output, MF_MT_FRAME_RATE, &num, &den) || !num || !den) num = 30, den = 1;
+    rate_ = {static_cast<int>(num), static_cast<int>(den)};
+    interval_ = av_rescale_q(1, av_inv_q(rate_), hundredNanoseconds);
+    stream->time_base = {1, videoTimescale};
+    stream->avg_frame_rate = rate_;
+    stream->r_frame_rate = rate_;
+  }
+
+  // Fills in what the sample left out, and moves on past it.
+  void stamp(LONGLONG& time, bool hasTime, LONGLONG& duration, bool hasDuration) {
+    if (!hasTime) time = next_;
+    if (!hasDuration) duration = interval_;
+    next_ = time + duration;
+  }
+
+  AVRational rate() const { return rate_; }
+  LONGLONG interval() const { return interval_; }
+  LONGLONG next() const { return next_; }
+
+ private:
+  AVRational rate_{30, 1};
+  LONGLONG interval_ = 333333;
+  LONGLONG next_ = 0;
+};
+
 struct InputPicture {
   AVPixelFormat format;
   int bytesPerPixel;  // of the first plane's packed pixels; 0 for planar YUV
@@ -227,10 +259,7 @@ class VideoEncoder : public StreamEncoder {
     else
       stride_ = picture_.bottomUpByDefault ? -packedStride : packedStride;
 
-    UINT32 rateNum = 30, rateDen = 1;
-    if (!getPair(output, MF_MT_FRAME_RATE, &rateNum, &rateDen) || !rateNum || !rateDen) rateNum = 30, rateDen = 1;
-    frameRate_ = {static_cast<int>(rateNum), static_cast<int>(rateDen)};
-    frameInterval_ = av_rescale_q(1, av_inv_q(frameRate_), hundredNanoseconds);
+    clock_.open(output, stream_);
     const int64_t bitRate = get32(output, MF_MT_AVG_BITRATE, 0);
     const UINT32 profile = get32(output, MF_MT_MPEG2_PROFILE, eAVEncH264VProfile_Base);
 
@@ -258,17 +287,12 @@ class VideoEncoder : public StreamEncoder {
     frame_->height = static_cast<int>(height);
     if (av_frame_get_buffer(frame_.get(), 0) < 0) return E_OUTOFMEMORY;
 
-    stream_->time_base = {1, videoTimescale};
-    stream_->avg_frame_rate = frameRate_;
-    stream_->r_frame_rate = frameRate_;
     return describe();
   }
 
   HRESULT write(const uint8_t* data, DWORD length, LONGLONG time, bool hasTime, LONGLONG duration,
                 bool hasDuration, bool) override {
-    if (!hasTime) time = nextTime_;
-    if (!hasDuration) duration = frameInterval_;
-    nextTime_ = time + duration;
+    clock_.stamp(time, hasTime, duration, hasDuration);
     if (static_cast<int64_t>(length) < requiredLength()) return MF_E_BUFFERTOOSMALL;
 
     int result = av_frame_make_writable(frame_.get());
@@ -346,7 +370,7 @@ class VideoEncoder : public StreamEncoder {
   HRESULT drainStamped() {
     return drain([this](AVPacket* packet) {
       while (pending_.size() > 1 && pending_.front().index < packet->pts) pending_.pop_front();
-      Pending times = pending_.empty() ? Pending{packet->pts, nextTime_, frameInterval_} : pending_.front();
+      Pending times = pending_.empty() ? Pending{packet->pts, clock_.next(), clock_.interval()} : pending_.front();
       if (!pending_.empty() && pending_.front().index == packet->pts) pending_.pop_front();
       packet->pts = packet->dts = av_rescale_q(times.time, hundredNanoseconds, stream_->time_base);
       packet->duration = av_rescale_q(times.duration, hundredNanoseconds, stream_->time_base);
@@ -356,10 +380,11 @@ class VideoEncoder : public StreamEncoder {
   void configureCommon(AVCodecContext* context, UINT32 width, UINT32 height, int64_t bitRate) {
     context->width = static_cast<int>(width);
     context->height = static_cast<int>(height);
-    context->time_base = av_inv_q(frameRate_);
-    context->framerate = frameRate_;
+    const AVRational rate = clock_.rate();
+    context->time_base = av_inv_q(rate);
+    context->framerate = rate;
     context->sample_aspect_ratio = {1, 1};
-    context->gop_size = std::max(1, 2 * frameRate_.num / frameRate_.den);  // a key frame every two seconds
+    context->gop_size = std::max(1, 2 * rate.num / rate.den);  // a key frame every two seconds
     context->max_b_frames = 0;
     context->color_primaries = AVCOL_PRI_BT709;
     context->color_trc = AVCOL_TRC_BT709;
@@ -449,9 +474,7 @@ class VideoEncoder : public StreamEncoder {
   int inWidth_ = 0;
   int inHeight_ = 0;
   int stride_ = 0;
-  AVRational frameRate_{30, 1};
-  LONGLONG frameInterval_ = 333333;
-  LONGLONG nextTime_ = 0;
+  VideoClock clock_;
   int64_t frameIndex_ = 0;
   std::deque<Pending> pending_;
   std::unique_ptr<SwsContext, SwsDeleter> scaler_;
@@ -475,10 +498,7 @@ class VideoCopy : public StreamEncoder {
     if (!getPair(output, MF_MT_FRAME_SIZE, &width, &height) || !width || !height) return MF_E_INVALIDMEDIATYPE;
     if (!getPair(input, MF_MT_FRAME_SIZE, &inWidth, &inHeight) || inWidth != width || inHeight != height)
       return MF_E_INVALIDMEDIATYPE;  // a copy cannot scale
-    UINT32 rateNum = 30, rateDen = 1;
-    if (!getPair(output, MF_MT_FRAME_RATE, &rateNum, &rateDen) || !rateNum || !rateDen) rateNum = 30, rateDen = 1;
-    const AVRational rate{static_cast<int>(rateNum), static_cast<int>(rateDen)};
-    frameInterval_ = av_rescale_q(1, av_inv_q(rate), hundredNanoseconds);
+    clock_.open(output, stream_);
 
     AVCodecParameters* codec = stream_->codecpar;
     codec->codec_type = AVMEDIA_TYPE_VIDEO;
@@ -495,17 +515,12 @@ class VideoCopy : public StreamEncoder {
       HRESULT hr = withHeader->GetBlob(MF_MT_MPEG_SEQUENCE_HEADER, codec->extradata, size, nullptr);
       if (FAILED(hr)) return hr;
     }
-    stream_->time_base = {1, videoTimescale};
-    stream_->avg_frame_rate = rate;
-    stream_->r_frame_rate = rate;
     return S_OK;
   }
 
   HRESULT write(const uint8_t* data, DWORD length, LONGLONG time, bool hasTime, LONGLONG duration,
                 bool hasDuration, bool cleanPoint) override {
-    if (!hasTime) time = nextTime_;
-    if (!hasDuration) duration = frameInterval_;
-    nextTime_ = time + duration;
+    clock_.stamp(time, hasTime, duration, hasDuration);
     if (length == 0) return S_OK;  // nothing to copy
     int result = av_new_packet(packet_.get(), static_cast<int>(length));
     if (result < 0) return fromAv(result);
@@ -522,8 +537,7 @@ class VideoCopy : public StreamEncoder {
   HRESULT finish() override { return S_OK; }  // nothing is held back
 
  private:
-  LONGLONG frameInterval_ = 333333;
-  LONGLONG nextTime_ = 0;
+  VideoClock clock_;
 };
 
 // ---- AAC ----
