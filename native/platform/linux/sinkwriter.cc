@@ -3,7 +3,10 @@
 // hardware encoder when hardware transforms are allowed and one opens, else by libx264 (H.264
 // input is copied as it is); AAC by FFmpeg's own encoder. Encoding happens inside WriteSample on
 // the caller's thread, so there is nothing to throttle and no queue to wait for; Finalize drains
-// the encoders, writes the trailer and closes the file.
+// the encoders, writes the trailer and closes the file. MP4 is written fragmented as it records
+// (the header first, then a fragment of at most 0.9 s at a time, each handed to the system when
+// it is complete), so a killed process or a full disk leaves a file that plays up to its last
+// fragment, and a finished one starts playing before it has been read to the end.
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -31,6 +34,7 @@ extern "C" {
 #include "platform/linux/colorconvert.h"
 #include "platform/linux/mf.h"
 #include "platform/linux/mfstartup.h"
+#include "platform/linux/mp4file.h"
 
 namespace platform {
 
@@ -134,7 +138,8 @@ using BufferRefPtr = std::unique_ptr<AVBufferRef, BufferRefDeleter>;
 // One stream's encoder (or copier); it hands every packet it makes to the muxer through mux().
 class StreamEncoder {
  public:
-  StreamEncoder(AVFormatContext* format, AVStream* stream) : format_(format), stream_(stream) {}
+  StreamEncoder(AVFormatContext* format, AVStream* stream, Mp4File* file)
+      : format_(format), stream_(stream), file_(file) {}
   virtual ~StreamEncoder() = default;
 
   // The codec parameters the muxer needs, once the encoder is open.
@@ -166,6 +171,8 @@ class StreamEncoder {
   }
 
   // Writes a packet whose times are in the stream's time base, keeping decoding times rising.
+  // A packet that makes the muxer write out a fragment closes it before itself, so the file
+  // then holds this stream up to the end of the packet before.
   HRESULT mux(AVPacket* packet) {
     packet->stream_index = stream_->index;
     if (packet->dts == AV_NOPTS_VALUE) packet->dts = packet->pts;
@@ -173,17 +180,41 @@ class StreamEncoder {
     if (packet->pts != AV_NOPTS_VALUE && packet->pts < packet->dts) packet->pts = packet->dts;
     lastDts_ = packet->dts;
     ++packets_;
-    return fromAv(av_interleaved_write_frame(format_, packet));
+    const int64_t start = packet->pts != AV_NOPTS_VALUE ? packet->pts : packet->dts;
+    const double end = av_q2d(stream_->time_base) * static_cast<double>(start + std::max<int64_t>(packet->duration, 0));
+    const int64_t lengthBefore = file_ ? file_->length() : 0;
+    const int result = av_interleaved_write_frame(format_, packet);
+    if (file_) {
+      if (result < 0) {
+        file_->rollback();
+      } else {
+        if (file_->length() > lengthBefore) {
+          file_->setTrackEnd(static_cast<size_t>(stream_->index), end_);
+          file_->stampDurations();
+        }
+        file_->commit();
+      }
+    }
+    end_ = std::max(end_, end);
+    return fromAv(result);
   }
+
+ public:
+  // The end of the last packet written, in seconds.
+  double end() const { return end_; }
+
+ protected:
 
   AVFormatContext* format_;
   AVStream* stream_;
+  Mp4File* file_;
   CodecContextPtr context_;
   PacketPtr packet_{av_packet_alloc()};
 
  private:
   int64_t lastDts_ = AV_NOPTS_VALUE;
   uint64_t packets_ = 0;
+  double end_ = 0;
 };
 
 // ---- H.264 ----
@@ -796,8 +827,8 @@ const char* muxerOf(REFGUID container) {
 
 class SinkWriter : public ComObject<IMFSinkWriter, IID_IMFSinkWriter> {
  public:
-  SinkWriter(AVFormatContext* format, bool hardware, bool fragmented)
-      : format_(format), hardware_(hardware), fragmented_(fragmented) {}
+  SinkWriter(AVFormatContext* format, std::unique_ptr<Mp4File> file, bool hardware, bool fragmented)
+      : format_(format), file_(std::move(file)), hardware_(hardware), fragmented_(fragmented) {}
 
   ~SinkWriter() override {
     for (StreamSlot& slot : streams_) {
@@ -806,7 +837,7 @@ class SinkWriter : public ComObject<IMFSinkWriter, IID_IMFSinkWriter> {
       release(slot.input);
     }
     if (format_) {
-      avio_closep(&format_->pb);  // an unfinished file stays as it is, as when Windows drops a writer
+      format_->pb = nullptr;  // the file's own; an unfinished file stays as it is, as when Windows drops a writer
       avformat_free_context(format_);
     }
   }
@@ -844,15 +875,15 @@ class SinkWriter : public ComObject<IMFSinkWriter, IID_IMFSinkWriter> {
     HRESULT hr;
     std::unique_ptr<StreamEncoder> encoder;
     if (outMajor == MFMediaType_Video && getGuid(input, MF_MT_SUBTYPE) == MFVideoFormat_H264) {
-      auto copy = std::make_unique<VideoCopy>(format_, slot.stream);
+      auto copy = std::make_unique<VideoCopy>(format_, slot.stream, file_.get());
       hr = copy->open(slot.output, input);
       encoder = std::move(copy);
     } else if (outMajor == MFMediaType_Video) {
-      auto video = std::make_unique<VideoEncoder>(format_, slot.stream);
+      auto video = std::make_unique<VideoEncoder>(format_, slot.stream, file_.get());
       hr = video->open(slot.output, input, hardware_);
       encoder = std::move(video);
     } else {
-      auto audio = std::make_unique<AudioEncoder>(format_, slot.stream);
+      auto audio = std::make_unique<AudioEncoder>(format_, slot.stream, file_.get());
       hr = audio->open(slot.output, input);
       encoder = std::move(audio);
     }
@@ -870,10 +901,18 @@ class SinkWriter : public ComObject<IMFSinkWriter, IID_IMFSinkWriter> {
     for (const StreamSlot& slot : streams_)
       if (!slot.encoder) return MF_E_TRANSFORM_TYPE_NOT_SET;
     AVDictionary* options = nullptr;
-    if (fragmented_) av_dict_set(&options, "movflags", "frag_keyframe+empty_moov+default_base_moof", 0);
+    if (fragmented_) {
+      // The header waits for the first fragment (delay_moov) so that a stream whose parameter
+      // sets come with its first key frame has them in the header too.
+      av_dict_set(&options, "movflags", "empty_moov+delay_moov+default_base_moof", 0);
+      av_dict_set(&options, "frag_duration", "900000", 0);
+    }
+    av_dict_set(&options, "flush_packets", "1", 0);
     const int result = avformat_write_header(format_, &options);
     av_dict_free(&options);
     if (result < 0) return result == AVERROR(EINVAL) ? MF_E_INVALIDMEDIATYPE : fromAv(result);
+    avio_flush(format_->pb);
+    file_->commit();
     state_ = State::writing;
     return S_OK;
   }
@@ -962,7 +1001,13 @@ class SinkWriter : public ComObject<IMFSinkWriter, IID_IMFSinkWriter> {
     bool anyPackets = false;
     for (const StreamSlot& slot : streams_) anyPackets = anyPackets || slot.encoder->packets() > 0;
     const int trailer = av_write_trailer(format_);
-    const int closed = avio_closep(&format_->pb);
+    if (trailer < 0) {
+      file_->rollback();
+    } else {
+      for (size_t i = 0; i < streams_.size(); ++i) file_->setTrackEnd(i, streams_[i].encoder->end());
+      file_->stampDurations();
+    }
+    const int closed = file_->close();
     if (SUCCEEDED(hr)) hr = fromAv(trailer < 0 ? trailer : closed);
     if (SUCCEEDED(hr) && !anyPackets) hr = MF_E_SINK_NO_SAMPLES_PROCESSED;
     return hr;
@@ -988,6 +1033,7 @@ class SinkWriter : public ComObject<IMFSinkWriter, IID_IMFSinkWriter> {
 
   std::mutex mutex_;
   AVFormatContext* format_;
+  std::unique_ptr<Mp4File> file_;
   const bool hardware_;
   const bool fragmented_;
   State state_ = State::configuring;
@@ -1014,14 +1060,15 @@ HRESULT MFCreateSinkWriterFromURL(LPCWSTR url, IMFByteStream* byteStream, IMFAtt
   if (!output) return MF_E_UNSUPPORTED_BYTESTREAM_TYPE;
 
   // The file is created now, as on Windows, so a bad path fails here with the system's code.
+  if (path.empty()) return HRESULT_FROM_WIN32(ERROR_PATH_NOT_FOUND);
+  auto file = std::make_unique<platform::Mp4File>(path);
+  if (!file->io()) return platform::fromErrno(file->error());
   AVFormatContext* format = nullptr;
   if (avformat_alloc_output_context2(&format, output, nullptr, path.c_str()) < 0 || !format) return E_OUTOFMEMORY;
-  const int opened = avio_open(&format->pb, ("file:" + path).c_str(), AVIO_FLAG_WRITE);
-  if (opened < 0) {
-    avformat_free_context(format);
-    return path.empty() ? HRESULT_FROM_WIN32(ERROR_PATH_NOT_FOUND) : platform::fromAv(opened);
-  }
+  format->pb = file->io();
+  format->flags |= AVFMT_FLAG_CUSTOM_IO;
   const bool hardware = platform::get32(attributes, MF_READWRITE_ENABLE_HARDWARE_TRANSFORMS, 0) != 0;
-  *sinkWriter = new platform::SinkWriter(format, hardware, container == MFTranscodeContainerType_FMPEG4);
+  const bool mp4 = std::strcmp(output->name, "mp4") == 0;
+  *sinkWriter = new platform::SinkWriter(format, std::move(file), hardware, mp4);
   return S_OK;
 }

@@ -1,0 +1,179 @@
+#include "platform/linux/mp4file.h"
+
+#include <fcntl.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <cerrno>
+#include <cmath>
+
+extern "C" {
+#include <libavutil/error.h>
+#include <libavutil/mem.h>
+}
+
+namespace platform {
+
+namespace {
+
+constexpr int bufferSize = 1 << 16;
+
+uint32_t read32(const uint8_t* p) {
+  return static_cast<uint32_t>(p[0]) << 24 | static_cast<uint32_t>(p[1]) << 16 | static_cast<uint32_t>(p[2]) << 8 | p[3];
+}
+
+void write32(uint8_t* p, uint32_t v) {
+  p[0] = static_cast<uint8_t>(v >> 24);
+  p[1] = static_cast<uint8_t>(v >> 16);
+  p[2] = static_cast<uint8_t>(v >> 8);
+  p[3] = static_cast<uint8_t>(v);
+}
+
+void write64(uint8_t* p, uint64_t v) {
+  write32(p, static_cast<uint32_t>(v >> 32));
+  write32(p + 4, static_cast<uint32_t>(v));
+}
+
+// Calls `visit(type, offset, size)` for each box in [begin, end) of `data`; stops at a box that
+// does not fit.
+template <class Visit>
+void forEachBox(const std::vector<uint8_t>& data, size_t begin, size_t end, Visit visit) {
+  while (begin + 8 <= end) {
+    const uint32_t size = read32(&data[begin]);
+    if (size < 8 || begin + size > end) return;
+    visit(std::string(reinterpret_cast<const char*>(&data[begin + 4]), 4), begin, static_cast<size_t>(size));
+    begin += size;
+  }
+}
+
+}  // namespace
+
+Mp4File::Mp4File(const std::string& path) {
+  // Read and write: the header is read back when its durations are stamped.
+  fd_ = ::open(path.c_str(), O_RDWR | O_CREAT | O_TRUNC | O_CLOEXEC, 0644);
+  if (fd_ < 0) {
+    error_ = errno;
+    return;
+  }
+  auto* buffer = static_cast<unsigned char*>(av_malloc(bufferSize));
+  io_ = buffer ? avio_alloc_context(buffer, bufferSize, 1, this, nullptr, writePacket, seek) : nullptr;
+  if (!io_) {
+    av_free(buffer);
+    error_ = ENOMEM;
+  }
+}
+
+Mp4File::~Mp4File() {
+  if (io_) {
+    // What is still buffered belongs to a piece the muxer never finished: it is not written.
+    av_freep(&io_->buffer);
+    avio_context_free(&io_);
+  }
+  if (fd_ >= 0) ::close(fd_);
+}
+
+int Mp4File::writePacket(void* opaque, uint8_t* data, int size) {
+  auto* self = static_cast<Mp4File*>(opaque);
+  int done = 0;
+  while (done < size) {
+    const ssize_t n = ::pwrite(self->fd_, data + done, static_cast<size_t>(size - done), self->position_);
+    if (n < 0 && errno == EINTR) continue;
+    if (n <= 0) return AVERROR(n < 0 ? errno : ENOSPC);
+    done += static_cast<int>(n);
+    self->position_ += n;
+    if (self->position_ > self->end_) self->end_ = self->position_;
+  }
+  return size;
+}
+
+int64_t Mp4File::seek(void* opaque, int64_t offset, int whence) {
+  auto* self = static_cast<Mp4File*>(opaque);
+  switch (whence & ~AVSEEK_FORCE) {
+    case AVSEEK_SIZE:
+      return self->end_;
+    case SEEK_SET:
+      break;
+    case SEEK_CUR:
+      offset += self->position_;
+      break;
+    case SEEK_END:
+      offset += self->end_;
+      break;
+    default:
+      return AVERROR(EINVAL);
+  }
+  if (offset < 0) return AVERROR(EINVAL);
+  self->position_ = offset;
+  return offset;
+}
+
+void Mp4File::commit() {
+  if (io_ && !io_->error) committed_ = end_;
+}
+
+void Mp4File::rollback() {
+  if (fd_ < 0) return;
+  if (::ftruncate(fd_, committed_) == 0) end_ = position_ = committed_;
+  if (io_) io_->buf_ptr = io_->buffer;  // drop the unwritten rest of the failed piece
+}
+
+void Mp4File::setTrackEnd(size_t track, double seconds) {
+  if (trackEnds_.size() <= track) trackEnds_.resize(track + 1, 0.0);
+  trackEnds_[track] = seconds;
+}
+
+void Mp4File::stampDurations() {
+  if (fd_ < 0 || end_ < 16) return;
+  double movieSeconds = 0;
+  for (double seconds : trackEnds_) movieSeconds = std::max(movieSeconds, seconds);
+  // The header is small and at the start: ftyp, then moov.
+  std::vector<uint8_t> head(static_cast<size_t>(std::min<int64_t>(end_, 1 << 20)));
+  const ssize_t got = ::pread(fd_, head.data(), head.size(), 0);
+  if (got <= 0) return;
+  head.resize(static_cast<size_t>(got));
+
+  size_t moov = 0, moovSize = 0;
+  forEachBox(head, 0, head.size(), [&](const std::string& type, size_t offset, size_t size) {
+    if (type == "moov" && !moovSize) moov = offset, moovSize = size;
+  });
+  if (!moovSize) return;
+
+  uint32_t timescale = 0;
+  auto stamp = [&](size_t field, bool wide, double seconds) {
+    const uint64_t units = static_cast<uint64_t>(std::llround(std::max(0.0, seconds) * timescale));
+    if (wide) write64(&head[field], units);
+    else write32(&head[field], static_cast<uint32_t>(std::min<uint64_t>(units, UINT32_MAX)));
+  };
+  size_t track = 0;
+  forEachBox(head, moov + 8, moov + moovSize, [&](const std::string& type, size_t offset, size_t size) {
+    if (type == "mvhd" && size >= 32) {
+      const bool wide = head[offset + 8] == 1;
+      if (wide && size < 44) return;
+      timescale = read32(&head[offset + (wide ? 28 : 20)]);
+      stamp(offset + (wide ? 32 : 24), wide, movieSeconds);
+    } else if (type == "trak" && timescale) {
+      const double seconds = track < trackEnds_.size() ? trackEnds_[track] : movieSeconds;
+      ++track;
+      forEachBox(head, offset + 8, offset + size, [&](const std::string& inner, size_t at, size_t length) {
+        if (inner != "tkhd" || length < 32) return;
+        const bool wide = head[at + 8] == 1;
+        if (wide && length < 44) return;
+        stamp(at + (wide ? 36 : 28), wide, seconds);
+      });
+    }
+  });
+  if (timescale) (void)!::pwrite(fd_, head.data() + moov, moovSize, static_cast<off_t>(moov));
+}
+
+int Mp4File::close() {
+  int result = 0;
+  if (io_) {
+    avio_flush(io_);
+    result = io_->error;
+  }
+  if (fd_ >= 0 && ::close(fd_) != 0 && result >= 0) result = AVERROR(errno);
+  fd_ = -1;
+  return result < 0 ? result : 0;
+}
+
+}  // namespace platform
