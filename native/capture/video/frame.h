@@ -2,7 +2,9 @@
 #pragma once
 
 #include <atomic>
+#include <condition_variable>
 #include <cstdint>
+#include <cstring>
 #include <deque>
 #include <memory>
 #include <mutex>
@@ -32,19 +34,38 @@ struct Frame {
     frame->timestamp = timestamp;
     return frame;
   }
+
+  std::unique_ptr<Frame> clone() const {
+    auto copy = make(width, height, channelOrder, timestamp);
+    std::memcpy(copy->data.get(), data.get(), size);
+    return copy;
+  }
 };
 
 struct FrameQueue {
   FrameQueue(std::wstring path, uint64_t width, uint64_t height, uint32_t channelOrder)
       : path(std::move(path)), width(width), height(height), channelOrder(channelOrder) {}
 
-  std::atomic<bool> stopped{true};
+  std::atomic<bool> stopped{true};  // no clip is being recorded
   std::wstring path;  // the source's name until a display's startEncode stores the file name
   std::mutex mutex;   // guards frames
   std::deque<std::unique_ptr<Frame>> frames;  // oldest first
   const uint64_t width;
   const uint64_t height;
   const uint32_t channelOrder;
+  std::condition_variable changed;  // a frame was appended or a clip was stopped
+};
+
+// One recording of a display: what its recording thread needs besides the queue. A clip covers
+// the wall-clock time from its start to its stop, whatever the picture does in between.
+struct Clip {
+  Clip(std::wstring path, int64_t start, std::unique_ptr<Frame> first)
+      : path(std::move(path)), start(start), first(std::move(first)) {}
+
+  const std::wstring path;
+  const int64_t start;          // ms since 1970, when the file was accepted
+  std::unique_ptr<Frame> first;  // the picture current at the start; null when there was none yet
+  std::atomic<int64_t> stop{0};  // ms since 1970 of the stop request, 0 while recording
 };
 
 }  // namespace capture::video

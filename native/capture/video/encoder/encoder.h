@@ -4,7 +4,7 @@
 
 namespace capture::video::encoder {
 
-// Writes a frame queue to a file until the queue's stopped flag is seen.
+// Writes a clip of a frame queue's pictures to a file until the clip is stopped.
 class Encoder {
  public:
   virtual void encode(capture::video::FrameQueue* queue) = 0;

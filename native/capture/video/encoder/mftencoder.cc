@@ -1,11 +1,14 @@
 #include "capture/video/encoder/mftencoder.h"
 
+#include <algorithm>
 #include <chrono>
+#include <climits>
 #include <cstring>
 #include <memory>
 #include <thread>
 
 #include "capture/check.h"
+#include "capture/clock.h"
 #include "capture/held.h"
 
 namespace capture::video::encoder {
@@ -16,10 +19,19 @@ const char* const file = "native/capture/video/encoder/mftencoder";
 
 constexpr UINT32 bitRate = 10485760;
 constexpr LONGLONG sampleDuration = 166666;  // 1/60 s, while the stream declares 30 fps: both kept on purpose
+constexpr LONGLONG frameInterval = 333333;   // the declared rate, at which a still picture repeats
+constexpr LONGLONG ticksPerMillisecond = 10000;
+// A lone new picture is written once it has stayed for a frame interval; while pictures keep
+// coming, each one is taken out of the queue when the next arrives, without a copy.
+constexpr int64_t stillMilliseconds = 34;
+
+std::chrono::system_clock::time_point atMillis(int64_t ms) {
+  return std::chrono::system_clock::time_point(std::chrono::milliseconds(ms));
+}
 
 }  // namespace
 
-MFTEncoder::MFTEncoder() : firstTimestamp(0), frameCount(0) {}
+MFTEncoder::MFTEncoder(std::shared_ptr<capture::video::Clip> clip) : clip(std::move(clip)) {}
 
 // The writer is released here although the recording never needs it again after Finalize:
 // holding on to it would keep its encoder's memory for the life of the process.
@@ -39,13 +51,92 @@ void MFTEncoder::encode(capture::video::FrameQueue* queue) {
     }
   } guard;
   configure();
-  while (!queue->stopped.load()) {
-    ++frameCount;
-    writeFrame();
-  }
+  record();
+  finish();
   checkResult(file, 34, writer->Finalize(), "Could not finalize writer.");
   guard.armed = false;
   checkResult(file, 35, MFShutdown(), "Could not shut down MFT.");
+}
+
+void MFTEncoder::record() {
+  if (clip->first) write(std::move(clip->first), 0);
+  for (;;) {
+    bool repeat = false;
+    std::unique_ptr<Frame> picture = nextPicture(repeat);
+    if (picture) {
+      const LONGLONG time = (picture->timestamp - clip->start) * ticksPerMillisecond;
+      write(std::move(picture), time);
+    } else if (repeat) {
+      // Behind the clock (a busy machine), the repeats skip ahead instead of piling up.
+      const LONGLONG now = (currentTimeMillis() - clip->start) * ticksPerMillisecond;
+      const LONGLONG time = std::max(lastTime + frameInterval, now - frameInterval);
+      ++frameCount;
+      writeFrame(*last, time);
+      lastTime = time;
+    } else {
+      return;  // stopped
+    }
+  }
+}
+
+std::unique_ptr<Frame> MFTEncoder::nextPicture(bool& repeat) {
+  std::unique_lock<std::mutex> lock(queue->mutex);
+  for (;;) {
+    if (clip->stop.load() != 0) return nullptr;
+    // The newest frame stays for the preview; older ones are the encoder's to take.
+    while (queue->frames.size() > 1) {
+      std::unique_ptr<Frame> older = std::move(queue->frames.front());
+      queue->frames.pop_front();
+      if (!last || older->timestamp > lastTimestamp) return older;
+    }
+    const Frame* newest = queue->frames.empty() ? nullptr : queue->frames.back().get();
+    const bool unwritten = newest && (!last || newest->timestamp > lastTimestamp);
+    int64_t due = INT64_MAX;
+    if (unwritten) due = newest->timestamp + stillMilliseconds;
+    if (last) due = std::min(due, clip->start + (lastTime + frameInterval) / ticksPerMillisecond + 1);
+    if (due != INT64_MAX && currentTimeMillis() >= due) {
+      if (unwritten) return newest->clone();
+      repeat = true;
+      return nullptr;
+    }
+    if (due == INT64_MAX)
+      queue->changed.wait(lock);
+    else
+      queue->changed.wait_until(lock, atMillis(due));
+  }
+}
+
+void MFTEncoder::finish() {
+  const int64_t stop = clip->stop.load();
+  // The picture current at the stop moment: the newest one captured by then.
+  std::unique_ptr<Frame> current;
+  {
+    std::lock_guard<std::mutex> lock(queue->mutex);
+    for (const auto& frame : queue->frames)
+      if (frame->timestamp <= stop && (!last || frame->timestamp > lastTimestamp)) current = frame->clone();
+  }
+  if (current) {
+    const LONGLONG time = (current->timestamp - clip->start) * ticksPerMillisecond;
+    write(std::move(current), time);
+  }
+  // It lasts until the stop: the last sample is placed so that it ends there.
+  const LONGLONG end = (stop - clip->start) * ticksPerMillisecond;
+  if (last && end - sampleDuration > lastTime) {
+    ++frameCount;
+    writeFrame(*last, end - sampleDuration);
+    lastTime = end - sampleDuration;
+  }
+}
+
+void MFTEncoder::write(std::unique_ptr<Frame> picture, LONGLONG time) {
+  // Sample times rise: a picture captured before the start, or within the same millisecond as
+  // the one before, is placed just after what is already written.
+  time = lastTime < 0 ? std::max<LONGLONG>(time, 0) : std::max(time, lastTime + ticksPerMillisecond);
+  ++frameCount;
+  writeFrame(*picture, time);
+  lastTime = time;
+  lastTimestamp = picture->timestamp;
+  last = std::move(picture);
 }
 
 void MFTEncoder::configure() {
@@ -58,7 +149,7 @@ void MFTEncoder::configure() {
               "Unable to disable throttling.");
   checkResult(file, 52, attrs.object->SetGUID(MF_TRANSCODE_CONTAINERTYPE, MFTranscodeContainerType_MPEG4),
               "Unable to set container type.");
-  checkResult(file, 54, MFCreateSinkWriterFromURL(queue->path.c_str(), nullptr, attrs.object, &writer),
+  checkResult(file, 54, MFCreateSinkWriterFromURL(clip->path.c_str(), nullptr, attrs.object, &writer),
               "Could not create sink.");
   attrs.release();
 
@@ -100,45 +191,27 @@ void MFTEncoder::configure() {
   checkResult(file, 83, writer->BeginWriting(), "Could not being writing.");
 }
 
-void MFTEncoder::writeFrame() {
+void MFTEncoder::writeFrame(const Frame& frame, LONGLONG time) {
   const DWORD length = static_cast<DWORD>(queue->width) * static_cast<DWORD>(queue->height) * 4;
   Held<IMFMediaBuffer> buffer;
   checkResult(file, 88, MFCreateMemoryBuffer(length, &buffer.object), "Could not create memory buffer");
 
-  // The newest frame always stays for the preview, so a frame is taken only while two or more
-  // are queued; until then poll every 5 ms (the stop flag is not looked at here).
-  std::unique_ptr<Frame> frame;
-  for (;;) {
-    {
-      std::lock_guard<std::mutex> lock(queue->mutex);
-      if (queue->frames.size() > 1) {
-        frame = std::move(queue->frames.front());
-        queue->frames.pop_front();
-        break;
-      }
-    }
-    std::this_thread::sleep_until(std::chrono::system_clock::now() + std::chrono::microseconds(5000));
-  }
-
   BYTE* dst = nullptr;
   checkResult(file, 105, buffer.object->Lock(&dst, nullptr, nullptr), "Could not get a lock on input buffer.");
   // Rows go in upside down: the input type is bottom-up RGB32.
-  const uint32_t rowBytes = static_cast<uint32_t>(frame->width) * 4;
-  const uint8_t* src = frame->data.get();
-  for (uint64_t i = 0; i < frame->height; ++i)
-    std::memcpy(dst + (frame->height - 1 - i) * rowBytes, src + i * rowBytes, rowBytes);
-  if (firstTimestamp == 0) firstTimestamp = frame->timestamp;
+  const uint32_t rowBytes = static_cast<uint32_t>(frame.width) * 4;
+  const uint8_t* src = frame.data.get();
+  for (uint64_t i = 0; i < frame.height; ++i)
+    std::memcpy(dst + (frame.height - 1 - i) * rowBytes, src + i * rowBytes, rowBytes);
   checkResult(file, 124, buffer.object->Unlock(), "Could not unlock input buffer.");
   checkResult(file, 126, buffer.object->SetCurrentLength(length), "Could not set current length.");
 
   Held<IMFSample> sample;
   checkResult(file, 129, MFCreateSample(&sample.object), "Could not create sample.");
   checkResult(file, 130, sample.object->AddBuffer(buffer.object), "Coudl not add input buffer to sample.");
-  checkResult(file, 134, sample.object->SetSampleTime((frame->timestamp - firstTimestamp) * 10000),
-              "Could not set sample time.");
+  checkResult(file, 134, sample.object->SetSampleTime(time), "Could not set sample time.");
   checkResult(file, 135, sample.object->SetSampleDuration(sampleDuration), "Could not set sample duration.");
   checkResult(file, 137, writer->WriteSample(streamIndex, sample.object), "Could not write sample.");
-  frame.reset();  // its pixel bytes, then the frame
 }
 
 }  // namespace capture::video::encoder

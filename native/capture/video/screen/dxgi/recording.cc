@@ -9,18 +9,16 @@
 
 namespace capture::video::screen::dxgi {
 
-void startRecording(std::shared_ptr<capture::video::FrameQueue> queue) {
-  std::thread([queue] {
+void startRecording(std::shared_ptr<capture::video::FrameQueue> queue, std::shared_ptr<capture::video::Clip> clip) {
+  std::thread([queue, clip] {
     capture::nameThread("tavio-record");
-    capture::video::encoder::MFTEncoder encoder;
-    queue->stopped = false;
+    capture::video::encoder::MFTEncoder encoder(clip);
     // A failed clip is reported as a warning and ends only this thread, not the host process.
     try {
       encoder.encode(queue.get());
     } catch (const std::exception& e) {
       capture::logWarning(e.what());
     }
-    queue->stopped = true;
   }).detach();
 }
 

@@ -7,7 +7,7 @@
 
 namespace capture::video::screen::dxgi {
 
-// Starts a detached thread that encodes the queue until its stopped flag is seen.
-void startRecording(std::shared_ptr<capture::video::FrameQueue> queue);
+// Starts a detached thread that records `clip` from the queue until the clip is stopped.
+void startRecording(std::shared_ptr<capture::video::FrameQueue> queue, std::shared_ptr<capture::video::Clip> clip);
 
 }  // namespace capture::video::screen::dxgi

@@ -112,9 +112,12 @@ void Source::capture() {
   capture::video::copyPicture(frame->data.get(), mapped.pData, frame->size);
   if (captureMouse) drawPointer(pointer, *frame);
 
-  std::lock_guard<std::mutex> lock(queue->mutex);
-  while (queue->frames.size() > 1) queue->frames.pop_front();
-  queue->frames.push_back(std::move(frame));
+  {
+    std::lock_guard<std::mutex> lock(queue->mutex);
+    while (queue->frames.size() > 1) queue->frames.pop_front();
+    queue->frames.push_back(std::move(frame));
+  }
+  queue->changed.notify_all();
 }
 
 bool Source::preview(uint8_t* dst, uint32_t swapRedBlue, int32_t dstWidth, int32_t dstHeight) {
@@ -125,11 +128,30 @@ bool Source::preview(uint8_t* dst, uint32_t swapRedBlue, int32_t dstWidth, int32
   return true;
 }
 
+// The clip starts now, with the picture now current; a clip still recording ends here.
 void Source::startEncode(std::string filename) {
-  queue->path = capture::toWide(filename);
-  startRecording(queue);
+  std::shared_ptr<capture::video::Clip> started;
+  {
+    std::lock_guard<std::mutex> lock(queue->mutex);
+    const int64_t now = capture::currentTimeMillis();
+    if (clip && clip->stop.load() == 0) clip->stop = now;
+    queue->path = capture::toWide(filename);
+    started = std::make_shared<capture::video::Clip>(
+        queue->path, now, queue->frames.empty() ? nullptr : queue->frames.back()->clone());
+    clip = started;
+    queue->stopped = false;
+  }
+  queue->changed.notify_all();
+  startRecording(queue, started);
 }
 
-void Source::stopEncode() { queue->stopped = true; }
+void Source::stopEncode() {
+  {
+    std::lock_guard<std::mutex> lock(queue->mutex);
+    if (clip && clip->stop.load() == 0) clip->stop = capture::currentTimeMillis();
+    queue->stopped = true;
+  }
+  queue->changed.notify_all();
+}
 
 }  // namespace capture::video::screen::dxgi

@@ -38,6 +38,7 @@ class Source : public capture::video::Source {
 
   // Shared with the recording thread, which may outlive the source.
   std::shared_ptr<capture::video::FrameQueue> queue;
+  std::shared_ptr<capture::video::Clip> clip;  // the latest clip, guarded by queue->mutex
   IDXGIOutput1* output = nullptr;
   ID3D11Device* device = nullptr;
   ID3D11DeviceContext* context = nullptr;
