@@ -126,6 +126,7 @@ struct Decoded {
   int width = 0;
   int height = 0;
   std::vector<uint8_t> firstPicture;  // BGRA
+  std::vector<uint8_t> lastPicture;   // BGRA
   int sampleRate = 0;
   int channels = 0;
   std::vector<float> samples;  // interleaved
@@ -152,17 +153,18 @@ inline Decoded decode(const std::string& path, AVMediaType kind) {
   auto take = [&]() {
     while (avcodec_receive_frame(context, frame) == 0) {
       ++out.frames;
-      if (kind == AVMEDIA_TYPE_VIDEO && out.firstPicture.empty()) {
+      if (kind == AVMEDIA_TYPE_VIDEO) {
         out.width = frame->width;
         out.height = frame->height;
-        out.firstPicture.resize(static_cast<size_t>(frame->width) * frame->height * 4);
+        out.lastPicture.resize(static_cast<size_t>(frame->width) * frame->height * 4);
         SwsContext* sws = sws_getContext(frame->width, frame->height, static_cast<AVPixelFormat>(frame->format),
                                          frame->width, frame->height, AV_PIX_FMT_BGRA, SWS_POINT, nullptr, nullptr,
                                          nullptr);
-        uint8_t* planes[1] = {out.firstPicture.data()};
+        uint8_t* planes[1] = {out.lastPicture.data()};
         int strides[1] = {frame->width * 4};
         sws_scale(sws, frame->data, frame->linesize, 0, frame->height, planes, strides);
         sws_freeContext(sws);
+        if (out.firstPicture.empty()) out.firstPicture = out.lastPicture;
       } else if (kind == AVMEDIA_TYPE_AUDIO) {
         if (!resampler) {
           out.sampleRate = frame->sample_rate;

@@ -1,5 +1,6 @@
-// The video encoder against real files: the two-frame rule, timing from the frames' stamps,
-// the row flip, the fixed stream parameters and the failure path.
+// The video encoder against real files: a clip from its start to its stop whatever the picture
+// does, timing from the frames' stamps, the row flip, the fixed stream parameters and the
+// failure path.
 #include "capture/video/encoder/mftencoder.h"
 
 #include <gtest/gtest.h>
@@ -8,158 +9,176 @@
 #include <future>
 #include <thread>
 
+#include "capture/clock.h"
 #include "media.h"
 
 namespace {
 
+using capture::currentTimeMillis;
+using capture::video::Clip;
 using capture::video::Frame;
 using capture::video::FrameQueue;
 using capture::video::encoder::MFTEncoder;
 
-// Red above the middle, blue below, in a display frame's top-down B, G, R, A rows.
-std::unique_ptr<Frame> frameAt(uint64_t width, uint64_t height, int64_t timestamp) {
-  auto frame = Frame::make(width, height, 0, timestamp);
-  for (uint64_t y = 0; y < height; ++y) {
-    for (uint64_t x = 0; x < width; ++x) {
-      uint8_t* p = &frame->data[(y * width + x) * 4];
-      const bool top = y < height / 2;
-      p[0] = top ? 0 : 255;
-      p[1] = 0;
-      p[2] = top ? 255 : 0;
+constexpr uint8_t red[3] = {0, 0, 255};  // B, G, R
+constexpr uint8_t blue[3] = {255, 0, 0};
+
+// `top` above the middle, `bottom` below, in a display frame's top-down B, G, R, A rows.
+std::unique_ptr<Frame> frameAt(const FrameQueue& queue, int64_t timestamp, const uint8_t* top = red,
+                               const uint8_t* bottom = blue) {
+  auto frame = Frame::make(queue.width, queue.height, 0, timestamp);
+  for (uint64_t y = 0; y < queue.height; ++y) {
+    for (uint64_t x = 0; x < queue.width; ++x) {
+      uint8_t* p = &frame->data[(y * queue.width + x) * 4];
+      std::memcpy(p, y < queue.height / 2 ? top : bottom, 3);
       p[3] = 255;
     }
   }
   return frame;
 }
 
-void push(FrameQueue& queue, int64_t timestamp) {
-  auto frame = frameAt(queue.width, queue.height, timestamp);
-  std::lock_guard<std::mutex> lock(queue.mutex);
-  queue.frames.push_back(std::move(frame));
-}
-
-size_t queued(FrameQueue& queue) {
-  std::lock_guard<std::mutex> lock(queue.mutex);
-  return queue.frames.size();
-}
-
-// Waits (bounded) until the queue holds `count` frames.
-bool waitForQueued(FrameQueue& queue, size_t count) {
-  for (int i = 0; i < 2000; ++i) {
-    if (queued(queue) == count) return true;
-    std::this_thread::sleep_for(std::chrono::milliseconds(5));
+void push(FrameQueue& queue, std::unique_ptr<Frame> frame) {
+  {
+    std::lock_guard<std::mutex> lock(queue.mutex);
+    while (queue.frames.size() > 1) queue.frames.pop_front();  // as the screen pump does
+    queue.frames.push_back(std::move(frame));
   }
-  return false;
+  queue.changed.notify_all();
 }
 
-// Runs a recording the way a display's recording thread does, and stops it once `written`
-// frames have left the queue; returns what encode threw, if anything.
-std::string record(FrameQueue& queue, const std::vector<int64_t>& stamps, size_t written) {
-  for (int64_t stamp : stamps) push(queue, stamp);
-  queue.stopped.store(false);
-  auto done = std::async(std::launch::async, [&queue]() -> std::string {
-    MFTEncoder encoder;
-    try {
-      encoder.encode(&queue);
-    } catch (const std::runtime_error& error) {
-      return error.what();
-    }
-    return "";
-  });
-  EXPECT_TRUE(waitForQueued(queue, stamps.size() - written));
-  queue.stopped.store(true);
-  // The encoder may already wait for one more frame; give it one, later than all the others.
-  push(queue, stamps.back() + 1000);
-  return done.get();
+void stop(FrameQueue& queue, Clip& clip, int64_t at) {
+  {
+    std::lock_guard<std::mutex> lock(queue.mutex);
+    clip.stop = at;
+  }
+  queue.changed.notify_all();
 }
 
-TEST(MFTEncoder, TimesSamplesFromTheFirstFrameWithTheFixedDuration) {
+void sleepUntil(int64_t ms) {
+  std::this_thread::sleep_until(std::chrono::system_clock::time_point(std::chrono::milliseconds(ms)));
+}
+
+// A recording on its own thread, as a display's recording thread runs it.
+struct Recording {
+  Recording(FrameQueue& queue, std::shared_ptr<Clip> clip) : clip(clip) {
+    done = std::async(std::launch::async, [&queue, clip]() -> std::string {
+      MFTEncoder encoder(clip);
+      try {
+        encoder.encode(&queue);
+      } catch (const std::runtime_error& error) {
+        return error.what();
+      }
+      return "";
+    });
+  }
+  std::shared_ptr<Clip> clip;
+  std::future<std::string> done;
+};
+
+std::vector<uint8_t> pixel(const std::vector<uint8_t>& picture, int width, int x, int y) {
+  const uint8_t* p = &picture[(static_cast<size_t>(y) * width + x) * 4];
+  return {p[0], p[1], p[2]};
+}
+
+bool near(const std::vector<uint8_t>& got, const uint8_t* want) {
+  for (int i = 0; i < 3; ++i)
+    if (std::abs(int(got[i]) - int(want[i])) > 60) return false;
+  return true;
+}
+
+TEST(MFTEncoder, AStillPictureIsRecordedFromTheStartToTheStopAndTheFileEndsAtOnce) {
   media::TempFolder folder;
-  const std::string path = folder.file("timing.mp4");
-  FrameQueue queue(platform::widen(path), 320, 240, 0);
-  EXPECT_EQ(record(queue, {1000, 1033, 1100, 1200}, 3), "");
+  FrameQueue queue(L"display", 320, 240, 0);
+  const int64_t start = currentTimeMillis();
+  // The picture current at the start was captured long before it.
+  auto clip = std::make_shared<Clip>(platform::widen(folder.file("still.mp4")), start, frameAt(queue, start - 5000));
+  push(queue, frameAt(queue, start - 5000));
+  Recording recording(queue, clip);
+  sleepUntil(start + 400);
+  const int64_t end = currentTimeMillis();
+  stop(queue, *clip, end);
+  // Nothing more comes from the screen; the file is finished all the same.
+  ASSERT_EQ(recording.done.wait_for(std::chrono::seconds(5)), std::future_status::ready);
+  EXPECT_EQ(recording.done.get(), "");
 
-  const media::File file = media::probe(path);
+  const media::File file = media::probe(folder.file("still.mp4"));
   ASSERT_TRUE(file.opened);
-  ASSERT_EQ(file.streams.size(), 1u);
   const auto& packets = file.streams[0].packets;
-  ASSERT_GE(packets.size(), 3u);
-  ASSERT_LE(packets.size(), 4u);  // a fourth when the stop came while it waited for a frame
+  ASSERT_GE(packets.size(), 3u);  // the first picture, repeats, the picture held to the stop
   EXPECT_NEAR(packets[0].time, 0.0, 1e-6);
-  EXPECT_NEAR(packets[1].time, 0.033, 1e-6);
-  EXPECT_NEAR(packets[2].time, 0.100, 1e-6);
-  // MP4 keeps the times; the last sample's own duration (1/60 s) ends the file.
-  EXPECT_NEAR(packets.back().duration, 166666e-7, 2e-5);
-  EXPECT_NEAR(file.duration, packets.back().time + 166666e-7, 1e-3);  // the movie header counts milliseconds
+  for (size_t i = 1; i < packets.size(); ++i) EXPECT_GT(packets[i].time, packets[i - 1].time);
+  EXPECT_NEAR(packets.back().time, (end - start) / 1000.0 - 166666e-7, 2e-4);
+  EXPECT_NEAR(file.duration, (end - start) / 1000.0, 2e-3);  // the header counts milliseconds
   EXPECT_EQ(file.streams[0].codec, "h264");
   EXPECT_EQ(file.streams[0].profile, FF_PROFILE_H264_MAIN);
-  EXPECT_EQ(file.streams[0].width, 320);
-  EXPECT_EQ(file.streams[0].height, 240);
 }
 
-TEST(MFTEncoder, FlippedRowsComeOutUprightInTheFile) {
+TEST(MFTEncoder, NewPicturesKeepTheirCaptureTimesAndThePictureCurrentAtTheStopEndsTheClip) {
   media::TempFolder folder;
-  const std::string path = folder.file("upright.mp4");
-  FrameQueue queue(platform::widen(path), 160, 120, 0);
-  EXPECT_EQ(record(queue, {5000, 5033, 5066}, 2), "");
-  const media::Decoded decoded = media::decode(path, AVMEDIA_TYPE_VIDEO);
+  FrameQueue queue(L"display", 160, 120, 0);
+  const int64_t start = currentTimeMillis();
+  auto clip = std::make_shared<Clip>(platform::widen(folder.file("times.mp4")), start, frameAt(queue, start - 20));
+  Recording recording(queue, clip);
+  push(queue, frameAt(queue, start + 33));
+  push(queue, frameAt(queue, start + 100));
+  sleepUntil(start + 250);
+  push(queue, frameAt(queue, start + 250, blue, red));  // turned upside down just before the stop
+  stop(queue, *clip, start + 260);
+  ASSERT_EQ(recording.done.wait_for(std::chrono::seconds(5)), std::future_status::ready);
+  EXPECT_EQ(recording.done.get(), "");
+
+  const media::File file = media::probe(folder.file("times.mp4"));
+  ASSERT_TRUE(file.opened);
+  std::vector<double> times;
+  for (const auto& packet : file.streams[0].packets) times.push_back(packet.time);
+  ASSERT_GE(times.size(), 4u);
+  EXPECT_NEAR(times[0], 0.0, 1e-6);
+  // Capture times are kept; repeats of a still picture may come in between.
+  for (double want : {0.033, 0.100, 0.250})
+    EXPECT_NE(std::find_if(times.begin(), times.end(), [want](double t) { return std::abs(t - want) < 1e-4; }),
+              times.end())
+        << want;
+  // The last picture came 10 ms before the stop: its own 1/60 s may reach past it.
+  EXPECT_GE(file.duration, 0.260 - 1e-3);
+  EXPECT_LE(file.duration, 0.250 + 1 / 60.0 + 1e-3);
+
+  const media::Decoded decoded = media::decode(folder.file("times.mp4"), AVMEDIA_TYPE_VIDEO);
   EXPECT_EQ(decoded.errors, 0);
   ASSERT_EQ(decoded.width, 160);
-  ASSERT_EQ(decoded.height, 120);
-  const uint8_t* top = &decoded.firstPicture[(10 * 160 + 80) * 4];
-  const uint8_t* bottom = &decoded.firstPicture[(110 * 160 + 80) * 4];
-  EXPECT_GT(top[2], 180);  // red above
-  EXPECT_LT(top[0], 80);
-  EXPECT_GT(bottom[0], 180);  // blue below
-  EXPECT_LT(bottom[2], 80);
+  // Rows go in upright: red above, blue below at first; the last picture the other way round.
+  EXPECT_TRUE(near(pixel(decoded.firstPicture, 160, 80, 10), red));
+  EXPECT_TRUE(near(pixel(decoded.firstPicture, 160, 80, 110), blue));
+  EXPECT_TRUE(near(pixel(decoded.lastPicture, 160, 80, 10), blue));
+  EXPECT_TRUE(near(pixel(decoded.lastPicture, 160, 80, 110), red));
 }
 
-TEST(MFTEncoder, FullHdRecordingHasTheFixedStreamParameters) {
+TEST(MFTEncoder, AClipWithoutAPictureAtItsStartBeginsWithTheFirstOneAtTimeZero) {
   media::TempFolder folder;
-  const std::string path = folder.file("fullhd.mp4");
-  FrameQueue queue(platform::widen(path), 1920, 1080, 0);
-  EXPECT_EQ(record(queue, {100, 133, 166}, 2), "");
-  const media::File file = media::probe(path);
+  FrameQueue queue(L"display", 1920, 1080, 0);
+  const int64_t start = currentTimeMillis();
+  auto clip = std::make_shared<Clip>(platform::widen(folder.file("fullhd.mp4")), start, nullptr);
+  Recording recording(queue, clip);
+  push(queue, frameAt(queue, start + 50));
+  push(queue, frameAt(queue, start + 83));
+  stop(queue, *clip, start + 200);
+  ASSERT_EQ(recording.done.wait_for(std::chrono::seconds(10)), std::future_status::ready);
+  EXPECT_EQ(recording.done.get(), "");
+  const media::File file = media::probe(folder.file("fullhd.mp4"));
   ASSERT_TRUE(file.opened);
   EXPECT_EQ(file.streams[0].width, 1920);
   EXPECT_EQ(file.streams[0].height, 1080);
-  EXPECT_EQ(file.streams[0].profile, FF_PROFILE_H264_MAIN);
-  EXPECT_GE(file.streams[0].packets.size(), 2u);
-  EXPECT_LE(file.streams[0].packets.size(), 3u);
-}
-
-TEST(MFTEncoder, WritesNothingWhileOnlyOneFrameIsQueued) {
-  media::TempFolder folder;
-  const std::string path = folder.file("one.mp4");
-  FrameQueue queue(platform::widen(path), 64, 64, 0);
-  push(queue, 1000);
-  queue.stopped.store(false);
-  auto done = std::async(std::launch::async, [&queue] {
-    MFTEncoder encoder;
-    encoder.encode(&queue);
-  });
-  // The newest frame stays for the preview, however long the encoder waits.
-  EXPECT_EQ(done.wait_for(std::chrono::milliseconds(150)), std::future_status::timeout);
-  EXPECT_EQ(queued(queue), 1u);
-  // A stop is honoured only after the next written frame.
-  queue.stopped.store(true);
-  EXPECT_EQ(done.wait_for(std::chrono::milliseconds(50)), std::future_status::timeout);
-  push(queue, 1040);
-  done.get();
-  EXPECT_EQ(queued(queue), 1u);
-  const media::File file = media::probe(path);
-  ASSERT_TRUE(file.opened);
-  ASSERT_EQ(file.streams[0].packets.size(), 1u);
+  ASSERT_GE(file.streams[0].packets.size(), 2u);
   EXPECT_NEAR(file.streams[0].packets[0].time, 0.0, 1e-6);
+  EXPECT_NEAR(file.duration, 0.200, 2e-3);
 }
 
 TEST(MFTEncoder, AFailureAfterStartUpShutsMediaFoundationDownBeforeItLeaves) {
   while (SUCCEEDED(MFShutdown())) {
   }
   media::TempFolder folder;
-  FrameQueue queue(platform::widen(folder.file("missing/clip.mp4")), 64, 64, 0);
-  queue.stopped.store(false);
-  MFTEncoder encoder;
+  FrameQueue queue(L"display", 64, 64, 0);
+  MFTEncoder encoder(std::make_shared<Clip>(platform::widen(folder.file("missing/clip.mp4")), currentTimeMillis(),
+                                            frameAt(queue, 1)));
   try {
     encoder.encode(&queue);
     FAIL() << "encode did not throw";

@@ -6,6 +6,7 @@
 #include <cstring>
 #include <memory>
 #include <thread>
+#include <vector>
 
 #include "capture/check.h"
 #include "capture/clock.h"
@@ -64,12 +65,14 @@ void MFTEncoder::record() {
     bool repeat = false;
     std::unique_ptr<Frame> picture = nextPicture(repeat);
     if (picture) {
+      const int64_t stop = clip->stop.load();
+      if (stop != 0 && picture->timestamp > stop) return;  // captured after the stop request
       const LONGLONG time = (picture->timestamp - clip->start) * ticksPerMillisecond;
       write(std::move(picture), time);
     } else if (repeat) {
       // Behind the clock (a busy machine), the repeats skip ahead instead of piling up.
       const LONGLONG now = (currentTimeMillis() - clip->start) * ticksPerMillisecond;
-      const LONGLONG time = std::max(lastTime + frameInterval, now - frameInterval);
+      const LONGLONG time = std::max(lastTime + frameInterval, now - 2 * frameInterval);
       ++frameCount;
       writeFrame(*last, time);
       lastTime = time;
@@ -93,7 +96,9 @@ std::unique_ptr<Frame> MFTEncoder::nextPicture(bool& repeat) {
     const bool unwritten = newest && (!last || newest->timestamp > lastTimestamp);
     int64_t due = INT64_MAX;
     if (unwritten) due = newest->timestamp + stillMilliseconds;
-    if (last) due = std::min(due, clip->start + (lastTime + frameInterval) / ticksPerMillisecond + 1);
+    // A repeat is written one interval late, so that none is ever placed past a stop that
+    // comes in the meantime: the picture held to the stop fills that last stretch.
+    if (last) due = std::min(due, clip->start + (lastTime + 2 * frameInterval) / ticksPerMillisecond + 1);
     if (due != INT64_MAX && currentTimeMillis() >= due) {
       if (unwritten) return newest->clone();
       repeat = true;
@@ -108,16 +113,24 @@ std::unique_ptr<Frame> MFTEncoder::nextPicture(bool& repeat) {
 
 void MFTEncoder::finish() {
   const int64_t stop = clip->stop.load();
-  // The picture current at the stop moment: the newest one captured by then.
-  std::unique_ptr<Frame> current;
+  // What was captured up to the stop and not written yet; the newest is the picture current at
+  // the stop moment.
+  std::vector<std::unique_ptr<Frame>> pending;
   {
     std::lock_guard<std::mutex> lock(queue->mutex);
-    for (const auto& frame : queue->frames)
-      if (frame->timestamp <= stop && (!last || frame->timestamp > lastTimestamp)) current = frame->clone();
+    auto unwritten = [&](const Frame& frame) {
+      return frame.timestamp <= stop && (!last || frame.timestamp > lastTimestamp);
+    };
+    while (queue->frames.size() > 1) {
+      std::unique_ptr<Frame> older = std::move(queue->frames.front());
+      queue->frames.pop_front();
+      if (unwritten(*older)) pending.push_back(std::move(older));
+    }
+    if (!queue->frames.empty() && unwritten(*queue->frames.back())) pending.push_back(queue->frames.back()->clone());
   }
-  if (current) {
-    const LONGLONG time = (current->timestamp - clip->start) * ticksPerMillisecond;
-    write(std::move(current), time);
+  for (auto& picture : pending) {
+    const LONGLONG time = (picture->timestamp - clip->start) * ticksPerMillisecond;
+    write(std::move(picture), time);
   }
   // It lasts until the stop: the last sample is placed so that it ends there.
   const LONGLONG end = (stop - clip->start) * ticksPerMillisecond;
@@ -129,9 +142,9 @@ void MFTEncoder::finish() {
 }
 
 void MFTEncoder::write(std::unique_ptr<Frame> picture, LONGLONG time) {
-  // Sample times rise: a picture captured before the start, or within the same millisecond as
-  // the one before, is placed just after what is already written.
-  time = lastTime < 0 ? std::max<LONGLONG>(time, 0) : std::max(time, lastTime + ticksPerMillisecond);
+  // The clip opens with its first picture, wherever it came from; after that, sample times rise
+  // even for a picture captured within the same millisecond as the one before.
+  time = lastTime < 0 ? 0 : std::max(time, lastTime + ticksPerMillisecond);
   ++frameCount;
   writeFrame(*picture, time);
   lastTime = time;
