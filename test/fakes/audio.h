@@ -269,6 +269,7 @@ struct EncoderLog {
     const uint8_t* data;
     uint32_t frames;
     int64_t time;
+    std::vector<float> samples;  // of float formats
   };
   std::mutex mutex;
   std::string path;
@@ -284,9 +285,14 @@ class Encoder : public capture::audio::Encoder {
     std::lock_guard<std::mutex> lock(log_->mutex);
     log_->deleted = true;
   }
-  void write(const uint8_t* data, uint32_t frames, const WAVEFORMATEX*, int64_t time) override {
+  void write(const uint8_t* data, uint32_t frames, const WAVEFORMATEX* format, int64_t time) override {
     std::lock_guard<std::mutex> lock(log_->mutex);
-    log_->writes.push_back({data, frames, time});
+    std::vector<float> samples;
+    if (format && format->wBitsPerSample == 32) {
+      const auto* first = reinterpret_cast<const float*>(data);
+      samples.assign(first, first + static_cast<size_t>(frames) * format->nChannels);
+    }
+    log_->writes.push_back({data, frames, time, std::move(samples)});
   }
   void finalize() override {
     std::lock_guard<std::mutex> lock(log_->mutex);

@@ -13,6 +13,7 @@
 
 #include "capture/audio/wasapi/source.h"
 #include "fakes/audio.h"
+#include "platform/kernel32.h"
 
 namespace {
 
@@ -250,76 +251,110 @@ TEST_F(WasapiSource, OtherFormatAnswersAreIgnored) {
 
 // The base follows every packet while not encoding; the first recorded packet keeps the base of
 // the packet before it, and every later one is timed from there.
-TEST_F(WasapiSource, RecordedTimeIsMeasuredFromTheLastPacketBeforeEncoding) {
+// Polls `done` for up to ten seconds.
+template <class Done>
+bool eventually(Done done) {
+  for (int i = 0; i < 2000; ++i) {
+    if (done()) return true;
+    std::this_thread::sleep_for(std::chrono::milliseconds(5));
+  }
+  return false;
+}
+
+// The capture clock, as packets are stamped on it (100 ns units).
+UINT64 clockNow() {
+  LARGE_INTEGER count{};
+  QueryPerformanceCounter(&count);
+  return static_cast<UINT64>(count.QuadPart);
+}
+
+constexpr UINT64 kMs = 10000;
+constexpr UINT64 kFrame = 10000000 / 48000;  // whole units per frame at 48 kHz, rounded down
+
+std::vector<float> tone(size_t frames) { return std::vector<float>(frames * 2, 0.25f); }
+
+TEST_F(WasapiSource, AClipTakesTheFramesFromItsStartToItsStopTimedFromItsStart) {
   startCapture();
-  feed(floats({0.1f, 0.1f}, 1000));
-  feed(floats({0.1f, 0.1f}, 2000));
+  feed(floats(tone(960), clockNow() - 200 * kMs));  // before the clip: nobody records it
+  const UINT64 beforeStart = clockNow();
   source->startEncode("clip.mp4");
+  const UINT64 afterStart = clockNow();
   ASSERT_EQ(encoders.size(), 1u);
   EXPECT_EQ(encoders[0]->path, "clip.mp4");
   ASSERT_NE(formatsGiven[0], nullptr);
   EXPECT_EQ(formatsGiven[0]->Format.nSamplesPerSec, 48000u);
-  feed(floats({0.1f, 0.1f}, 3000));
-  feed(floats({0.1f, 0.1f, 0.2f, 0.2f}, 4500));
+  // A packet that began 10 ms before the start gives the clip only what follows the start.
+  feed(floats(tone(960), beforeStart - 10 * kMs));
+  feed(floats(tone(960), afterStart + 10 * kMs));
+  std::this_thread::sleep_for(std::chrono::milliseconds(100));
+  const UINT64 beforeStop = clockNow();
   source->stopEncode();
-  {
-    std::lock_guard<std::mutex> lock(encoders[0]->mutex);
-    ASSERT_EQ(encoders[0]->writes.size(), 2u);
-    EXPECT_EQ(encoders[0]->writes[0].time, 1000);
-    EXPECT_EQ(encoders[0]->writes[1].time, 2500);
-    EXPECT_EQ(encoders[0]->writes[1].frames, 2u);
-    EXPECT_EQ(encoders[0]->finalized, 0) << "finalised only by the next packet";
-    EXPECT_FALSE(encoders[0]->deleted);
-  }
-  feed(floats({0.1f, 0.1f}, 6000));
-  {
-    std::lock_guard<std::mutex> lock(encoders[0]->mutex);
-    EXPECT_EQ(encoders[0]->writes.size(), 2u);
-    EXPECT_EQ(encoders[0]->finalized, 1);
-    EXPECT_TRUE(encoders[0]->deleted);
-  }
-  // While not encoding the base follows every packet again.
-  feed(floats({0.1f, 0.1f}, 7000));
-  source->startEncode("second.mp4");
-  feed(floats({0.1f, 0.1f}, 9000));
-  feed(floats({0.1f, 0.1f}, 9250));
-  std::lock_guard<std::mutex> lock(encoders[1]->mutex);
-  ASSERT_EQ(encoders[1]->writes.size(), 2u);
-  EXPECT_EQ(encoders[1]->writes[0].time, 2000);
-  EXPECT_EQ(encoders[1]->writes[1].time, 2250);
-}
-
-TEST_F(WasapiSource, RecordingStoppedBeforeItsFirstPacketIsStillFinalised) {
-  startCapture();
-  source->startEncode("never.mp4");
-  source->stopEncode();
-  feed(floats({0.1f, 0.1f}, 1000));
+  const UINT64 afterStop = clockNow();
+  feed(floats(tone(960), beforeStop - 10 * kMs));  // crosses the stop: cut there, and the clip ends
+  feed(floats(tone(960), afterStop + 100 * kMs));
   std::lock_guard<std::mutex> lock(encoders[0]->mutex);
-  EXPECT_TRUE(encoders[0]->writes.empty());
+  ASSERT_EQ(encoders[0]->writes.size(), 3u);
+  const auto& first = encoders[0]->writes[0];
+  EXPECT_EQ(first.time, 0);
+  EXPECT_LE(first.frames, 480u);
+  EXPECT_GE(first.frames, 480u - (afterStart - beforeStart) / kFrame - 1);
+  const auto& second = encoders[0]->writes[1];
+  EXPECT_EQ(second.frames, 960u);
+  EXPECT_GE(static_cast<UINT64>(second.time), 10 * kMs);
+  EXPECT_LE(static_cast<UINT64>(second.time), 10 * kMs + (afterStart - beforeStart));
+  const auto& last = encoders[0]->writes[2];
+  EXPECT_GE(last.frames, 480u - 1);
+  EXPECT_LE(last.frames, 480u + (afterStop - beforeStop) / kFrame + 1);
   EXPECT_EQ(encoders[0]->finalized, 1);
   EXPECT_TRUE(encoders[0]->deleted);
 }
 
-TEST_F(WasapiSource, CaptureStoppedBeforeTheNextPacketLeavesTheEncoderUnfinalised) {
+TEST_F(WasapiSource, ClipsWithoutAGapSplitAPacketBetweenThem) {
   startCapture();
-  source->startEncode("cut.mp4");
-  feed(floats({0.1f, 0.1f}, 1000));
+  const UINT64 now = clockNow();
+  source->startEncode("first.mp4");
+  source->startEncode("second.mp4");  // ends the first where it begins
+  const UINT64 later = clockNow();
+  feed(floats(tone(960), now));
+  {
+    std::lock_guard<std::mutex> lock(encoders[0]->mutex);
+    EXPECT_EQ(encoders[0]->finalized, 1);
+  }
+  std::lock_guard<std::mutex> lock(encoders[1]->mutex);
+  ASSERT_EQ(encoders[1]->writes.size(), 1u);
+  EXPECT_EQ(encoders[1]->writes[0].time, 0);
+  UINT32 total = encoders[1]->writes[0].frames;
+  {
+    std::lock_guard<std::mutex> firstLock(encoders[0]->mutex);
+    for (const auto& write : encoders[0]->writes) total += write.frames;
+  }
+  EXPECT_GE(total, 960u - (later - now) / kFrame - 2);  // nothing lost between the two
+  EXPECT_LE(total, 960u);
+  EXPECT_EQ(encoders[1]->finalized, 0);
+}
+
+TEST_F(WasapiSource, AStoppedClipThatNoPacketReachesIsFinishedAnyway) {
+  startCapture();
+  source->startEncode("quiet.mp4");
+  feed(floats(tone(480), clockNow()));
   source->stopEncode();
-  std::shared_ptr<fakes::EncoderLog> log = encoders[0];
-  endCapture();  // drops the last reference: the source is gone
-  std::lock_guard<std::mutex> lock(log->mutex);
-  EXPECT_EQ(log->writes.size(), 1u);
-  EXPECT_EQ(log->finalized, 0);
+  // The endpoint delivers nothing more; the clip must not stay open.
+  ASSERT_TRUE(eventually([&] {
+    std::lock_guard<std::mutex> lock(encoders[0]->mutex);
+    return encoders[0]->finalized == 1;
+  }));
+  std::lock_guard<std::mutex> lock(encoders[0]->mutex);
+  EXPECT_EQ(encoders[0]->writes.size(), 1u);
 }
 
 TEST_F(WasapiSource, SpecialAnswersOfGetBuffer) {
   startCapture();
   source->startEncode("clip.mp4");
+  const UINT64 at = clockNow() + 10 * kMs;
   feed(answer(AUDCLNT_E_OUT_OF_ORDER));
   feed(answer(AUDCLNT_S_BUFFER_EMPTY));
-  // A zero-frame packet with another result goes on to the encoder.
-  feed(floats({}, 5000));
-  fakes::Packet silent = floats({0.9f, 0.9f, 0.9f, 0.9f}, 6000, AUDCLNT_BUFFERFLAGS_SILENT);
+  feed(floats({}, at));  // a zero-frame packet gives nothing to record
+  fakes::Packet silent = floats({0.9f, 0.9f, 0.9f, 0.9f}, at, AUDCLNT_BUFFERFLAGS_SILENT);
   feed(silent);
   const uint8_t* original;
   {
@@ -328,11 +363,10 @@ TEST_F(WasapiSource, SpecialAnswersOfGetBuffer) {
     EXPECT_EQ(audio->captureReleases, (std::vector<UINT32>{0, 0, 0, 2}));
   }
   std::lock_guard<std::mutex> lock(encoders[0]->mutex);
-  ASSERT_EQ(encoders[0]->writes.size(), 2u);
-  EXPECT_EQ(encoders[0]->writes[0].frames, 0u);
-  EXPECT_EQ(encoders[0]->writes[1].frames, 2u);
-  EXPECT_NE(encoders[0]->writes[1].data, original) << "a silent packet is handed on in a block of its own";
-  EXPECT_EQ(encoders[0]->writes[1].time, 1000);
+  ASSERT_EQ(encoders[0]->writes.size(), 1u);
+  EXPECT_EQ(encoders[0]->writes[0].frames, 2u);
+  EXPECT_NE(encoders[0]->writes[0].data, original) << "a silent packet is handed on in a block of its own";
+  EXPECT_EQ(encoders[0]->writes[0].samples, (std::vector<float>{0, 0, 0, 0})) << "and that block is silence";
 }
 
 TEST_F(WasapiSource, DiscontinuityAndTimestampErrorsWriteOnePositionLine) {
@@ -356,25 +390,30 @@ struct Failure {
 
 class WasapiSourceFailure : public WasapiSource, public testing::WithParamInterface<Failure> {};
 
-TEST_P(WasapiSourceFailure, EndsTheCaptureThreadWithAWarning) {
+TEST_P(WasapiSourceFailure, FinishesTheClipWarnsOnceAndCapturesAgain) {
   startCapture();
+  source->startEncode("cut.mp4");
+  feed(floats(tone(480), clockNow()));
   Output output;
   audio->push(answer(GetParam().result));
-  std::weak_ptr<capture::audio::wasapi::Source> watch = source;
-  std::shared_ptr<capture::audio::wasapi::Source> kept = source;
-  ASSERT_TRUE(audio->waitAnswered(1));
-  // The thread ends by itself, leaving the flag set: capture() starts nothing new.
-  const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(10);
-  while (kept.use_count() > 2 && std::chrono::steady_clock::now() < deadline)
-    std::this_thread::sleep_for(std::chrono::milliseconds(1));
-  EXPECT_EQ(kept.use_count(), 2) << "the capture thread still holds the source";
+  audio->push(answer(GetParam().result));  // the same failure again on the next try
+  // What was recorded up to the failure stays: the clip is finished.
+  ASSERT_TRUE(eventually([&] {
+    std::lock_guard<std::mutex> lock(encoders[0]->mutex);
+    return encoders[0]->finalized == 1;
+  }));
+  // Half a second later the thread opens the endpoint again, by itself, twice.
+  ASSERT_TRUE(eventually([&] {
+    std::lock_guard<std::mutex> lock(audio->mutex);
+    return audio->activations >= 3 && audio->packets.empty();
+  }));
+  std::this_thread::sleep_for(std::chrono::milliseconds(50));
+  endCapture();
   std::vector<std::string> lines = output.lines();
-  EXPECT_EQ(count(lines, ": Warning: "), 1);
+  EXPECT_EQ(count(lines, ": Warning: "), 1) << "the same failure in a row is printed once";
   EXPECT_EQ(count(lines, GetParam().text), 1);
-  kept->capture();
-  std::this_thread::sleep_for(std::chrono::milliseconds(20));
-  std::lock_guard<std::mutex> lock(audio->mutex);
-  EXPECT_EQ(audio->activations, 2);
+  std::lock_guard<std::mutex> lock(encoders[0]->mutex);
+  EXPECT_EQ(encoders[0]->writes.size(), 1u);
 }
 
 INSTANTIATE_TEST_SUITE_P(
@@ -385,9 +424,16 @@ INSTANTIATE_TEST_SUITE_P(
         Failure{AUDCLNT_E_BUFFER_OPERATION_PENDING,
                 "native/capture/audio/wasapi/source(264): 0x8889000b: Audio buffer operation is pending."},
         Failure{AUDCLNT_E_SERVICE_NOT_RUNNING,
-                "native/capture/audio/wasapi/source(266): 0x88890010: Audio client service is not running."}));
+                "native/capture/audio/wasapi/source(266): 0x88890010: Audio client service is not running."}),
+    [](const testing::TestParamInfo<Failure>& info) {
+      switch (info.param.result) {
+        case AUDCLNT_E_DEVICE_INVALIDATED: return std::string("DeviceInvalidated");
+        case AUDCLNT_E_BUFFER_OPERATION_PENDING: return std::string("BufferOperationPending");
+        default: return std::string("ServiceNotRunning");
+      }
+    });
 
-TEST_F(WasapiSource, UnreadableSamplesEndTheThreadAfterTheEncoderHadThePacket) {
+TEST_F(WasapiSource, UnreadableSamplesEndTheTryAfterTheEncoderHadThePacket) {
   {
     std::lock_guard<std::mutex> lock(audio->mutex);
     audio->mix.SubFormat = KSDATAFORMAT_SUBTYPE_PCM;
@@ -398,23 +444,22 @@ TEST_F(WasapiSource, UnreadableSamplesEndTheThreadAfterTheEncoderHadThePacket) {
   source->startPreview();
   source->startEncode("clip.mp4");
   Output output;
-  fakes::Packet packet;
+  fakes::Packet packet = floats({}, clockNow() + 10 * kMs);
   packet.bytes.assign(12, 0x10);
   packet.frames = 2;
   audio->push(packet);
-  ASSERT_TRUE(audio->waitFor([&] { return audio->packets.empty(); }));
-  std::shared_ptr<fakes::EncoderLog> log = encoders[0];
-  std::weak_ptr<capture::audio::wasapi::Source> watch = source;
-  source.reset();  // the flag stays set, so only the failure can end the thread
-  const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(10);
-  while (!watch.expired() && std::chrono::steady_clock::now() < deadline)
-    std::this_thread::sleep_for(std::chrono::milliseconds(1));
-  EXPECT_TRUE(watch.expired());
-  EXPECT_EQ(count(output.lines(), "Warning: native/capture/audio/wasapi/source(354): Peaks cannot be calculated"), 1);
+  ASSERT_TRUE(eventually([&] {
+    std::lock_guard<std::mutex> lock(encoders[0]->mutex);
+    return encoders[0]->finalized == 1;
+  }));
+  endCapture();
+  const std::vector<std::string> lines = output.lines();
+  EXPECT_EQ(count(lines, "Warning: native/capture/audio/wasapi/source(354): Peaks cannot be calculated"), 1)
+      << testing::PrintToString(lines);
   std::lock_guard<std::mutex> lock(audio->mutex);
   EXPECT_TRUE(audio->captureReleases.empty()) << "the failing packet is not released";
-  std::lock_guard<std::mutex> encoderLock(log->mutex);
-  EXPECT_EQ(log->writes.size(), 1u);
+  std::lock_guard<std::mutex> encoderLock(encoders[0]->mutex);
+  EXPECT_EQ(encoders[0]->writes.size(), 1u);
 }
 
 }  // namespace

@@ -28,6 +28,11 @@ constexpr int64_t kShortestBuffer = 100000;
 // Packet times follow the sample count; when they drift this far from the clock, samples were lost
 // (or the sink stalled) and the next packet starts a new time line with a discontinuity.
 constexpr int64_t kDriftLimit = 2000000;
+// A sink that nothing asked for low latency renders in blocks of up to two seconds, ahead of the
+// clock; a monitor stream that connects then gets nothing until the sink's clock has caught up
+// with what it rendered before. Loopback on Windows delivers packets all along while the
+// silence stream plays, so time that passes this long without data is handed out as silence.
+constexpr int64_t kStallLimit = 2000000;
 
 // Everything the audio client and its services share; it outlives whichever of them goes last.
 struct Stream {
@@ -55,6 +60,12 @@ struct Stream {
   bool anchored = false;
   UINT64 anchorTime = 0;
   UINT64 anchorPosition = 0;
+  bool synthesized = false;  // the held packet is silence made here, not the server's
+
+  // The capture time of the frame at `frames` on the current time line.
+  UINT64 timeOf(UINT64 frames) const {
+    return anchorTime + (frames - anchorPosition) * kUnitsPerSecond / sampleSpec.rate;
+  }
 
   ~Stream() {
     if (!stream) return;
@@ -106,8 +117,24 @@ class CaptureClient : public ComObject<IAudioCaptureClient, IID_IAudioCaptureCli
     const UINT64 now = performanceCounterPosition();
     if (devicePosition) *devicePosition = s_->position;
     if (size == 0) {
-      if (qpcPosition) *qpcPosition = now;
-      return AUDCLNT_S_BUFFER_EMPTY;
+      const UINT64 covered = s_->timeOf(s_->position);
+      if (!s_->started || !s_->anchored || now < covered + kStallLimit) {
+        if (qpcPosition) *qpcPosition = now;
+        return AUDCLNT_S_BUFFER_EMPTY;
+      }
+      // Up to a fragment before now: data that arrives late still follows on.
+      const UINT64 missing = (now - covered - kRecordFragment) * s_->sampleSpec.rate / kUnitsPerSecond;
+      const uint32_t count = static_cast<uint32_t>(std::min<UINT64>(missing, s_->bufferFrames));
+      *flags |= AUDCLNT_BUFFERFLAGS_SILENT;
+      s_->bytes.assign(static_cast<size_t>(count) * s_->frameBytes, 0);
+      *data = s_->bytes.data();
+      if (qpcPosition) *qpcPosition = covered;
+      *frames = count;
+      s_->holding = true;
+      s_->heldFrames = count;
+      s_->heldBytes = 0;  // nothing of the server's queue
+      s_->synthesized = true;
+      return S_OK;
     }
     const uint32_t count = static_cast<uint32_t>(size / s_->frameBytes);
     if (bytes) {
@@ -123,7 +150,7 @@ class CaptureClient : public ComObject<IAudioCaptureClient, IID_IAudioCaptureCli
     s_->readable = queued;
     const int64_t queuedUnits = static_cast<int64_t>(queued / s_->frameBytes) * kUnitsPerSecond / s_->sampleSpec.rate;
     const UINT64 measured = now - static_cast<UINT64>(std::max<int64_t>(queuedUnits, 0));
-    UINT64 time = s_->anchorTime + (s_->position - s_->anchorPosition) * kUnitsPerSecond / s_->sampleSpec.rate;
+    UINT64 time = s_->timeOf(s_->position);
     const int64_t drift = static_cast<int64_t>(measured - time);
     if (!s_->anchored || drift > kDriftLimit || drift < -kDriftLimit) {
       if (s_->anchored) *flags |= AUDCLNT_BUFFERFLAGS_DATA_DISCONTINUITY;
@@ -144,12 +171,18 @@ class CaptureClient : public ComObject<IAudioCaptureClient, IID_IAudioCaptureCli
     // Releasing nothing keeps the packet for the next GetBuffer.
     if (framesRead == 0) {
       s_->holding = false;
+      s_->synthesized = false;
       return S_OK;
     }
     if (!s_->holding) return AUDCLNT_E_OUT_OF_ORDER;
     if (framesRead != s_->heldFrames) return AUDCLNT_E_INVALID_SIZE;
     s_->holding = false;
     if (s_->invalid()) return AUDCLNT_E_DEVICE_INVALIDATED;
+    if (s_->synthesized) {
+      s_->synthesized = false;
+      s_->position += framesRead;
+      return S_OK;
+    }
     pa_stream_drop(s_->stream);
     s_->readable -= std::min(s_->readable, s_->heldBytes);
     s_->position += framesRead;
@@ -375,6 +408,12 @@ class AudioClient : public ComObject<IAudioClient, IID_IAudioClient> {
     if (!s_->connection->wait(pa_stream_cork(s_->stream, stop ? 1 : 0, nullptr, nullptr)))
       return AUDCLNT_E_DEVICE_INVALIDATED;
     s_->started = !stop;
+    // Capture time runs from the start, whether or not the sink delivers at once.
+    if (!stop && s_->loopback && !s_->anchored) {
+      s_->anchored = true;
+      s_->anchorTime = performanceCounterPosition();
+      s_->anchorPosition = s_->position;
+    }
     return S_OK;
   }
 

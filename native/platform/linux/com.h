@@ -46,6 +46,14 @@ using SIZE_T = size_t;
 using VARTYPE = uint16_t;
 using REFERENCE_TIME = int64_t;
 
+union LARGE_INTEGER {
+  struct {
+    DWORD LowPart;
+    LONG HighPart;
+  } u;
+  LONGLONG QuadPart;
+};
+
 #define TRUE 1
 #define FALSE 0
 #define STDMETHODCALLTYPE

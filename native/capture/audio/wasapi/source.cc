@@ -14,6 +14,7 @@
 #include "capture/log.h"
 #include "capture/text.h"
 #include "capture/threadname.h"
+#include "platform/kernel32.h"
 
 namespace capture::audio::wasapi {
 
@@ -34,7 +35,7 @@ WAVEFORMATEXTENSIBLE* readMixFormat(IAudioClient* client) {
   return copy;
 }
 
-// The outermost frame of both threads: a failure becomes a warning line and ends the thread.
+// A failure becomes a warning line.
 template <class Body>
 void guarded(Body body) {
   try {
@@ -46,18 +47,63 @@ void guarded(Body body) {
   }
 }
 
-void finish(Encoder*& encoder) {
-  Encoder* done = encoder;
-  encoder = nullptr;
-  done->finalize();
-  delete done;
+constexpr auto kRetryPause = std::chrono::milliseconds(500);
+
+// The outermost frame of both threads: runs `body` until it returns, trying again after a
+// pause whenever it fails while `wanted()` holds, so an endpoint whose sound server or device
+// went away works again once it is back. The first failure of a row is printed; the same one
+// again is not. `after` runs once after every try.
+template <class Body, class Wanted, class After>
+void keepTrying(Body body, Wanted wanted, After after) {
+  std::string lastFailure;
+  while (wanted()) {
+    std::string failure;
+    try {
+      body();
+    } catch (const std::exception& e) {
+      failure = *e.what() ? e.what() : "unknown exception";
+    } catch (...) {
+      failure = "unknown exception";
+    }
+    if (failure.empty()) {
+      after();
+      return;
+    }
+    // Checked failures begin with their time; the rest tells whether it is the same again.
+    const size_t tab = failure.find('\t');
+    const std::string what = tab == std::string::npos ? failure : failure.substr(tab);
+    if (what != lastFailure) capture::logWarning(failure.c_str());
+    lastFailure = what;
+    after();
+    std::this_thread::sleep_for(kRetryPause);
+  }
 }
 
 Encoder* makeMFEncoder(const std::string& path, const WAVEFORMATEXTENSIBLE* format) {
   return new MFEncoder(path, format);
 }
 
+constexpr uint64_t kUnitsPerSecond = 10000000;
+// A stopped clip whose stop no packet reaches within this time (the endpoint stalled or went
+// away) is finished with what it has.
+constexpr uint64_t kStopWait = 5000000;
+
+// The performance counter in 100 ns units: the clock of the packets' positions.
+uint64_t counterNow() {
+  LARGE_INTEGER count{}, frequency{};
+  QueryPerformanceCounter(&count);
+  QueryPerformanceFrequency(&frequency);
+  const uint64_t ticks = static_cast<uint64_t>(count.QuadPart), rate = static_cast<uint64_t>(frequency.QuadPart);
+  return rate == kUnitsPerSecond ? ticks : ticks / rate * kUnitsPerSecond + ticks % rate * kUnitsPerSecond / rate;
+}
+
 }  // namespace
+
+struct Source::Clip {
+  std::unique_ptr<Encoder> encoder;
+  uint64_t start = 0;             // capture clock, 100 ns
+  std::atomic<uint64_t> stop{0};  // 0 while recording
+};
 
 // The silence thread's share of the source: it never ends, so it must not depend on the source.
 struct Source::Silence {
@@ -66,6 +112,11 @@ struct Source::Silence {
   IAudioRenderClient* renderClient = nullptr;
 
   void run() {
+    // A try after a failure starts with clients of its own.
+    if (renderClient) renderClient->Release();
+    if (silenceClient) silenceClient->Release();
+    renderClient = nullptr;
+    silenceClient = nullptr;
     capture::checkResult(kFile, 173,
                          endpoint->Activate(IID_IAudioClient, CLSCTX_ALL, nullptr, reinterpret_cast<void**>(&silenceClient)),
                          "Could not create audio client.");
@@ -104,7 +155,7 @@ Source::Source(IMMDevice* endpoint, bool isSelected, EncoderFactory makeEncoder)
   silence->endpoint = endpoint;
   std::thread([state = silence] {
     capture::nameThread("tavio-silence");
-    guarded([&] { state->run(); });
+    keepTrying([&] { state->run(); }, [] { return true; }, [] {});
   }).detach();
 }
 
@@ -113,9 +164,6 @@ Source::~Source() {
   if (IAudioClient* client = audioClient.load()) client->Release();
   if (IAudioCaptureClient* client = captureClient.load()) client->Release();
   delete format.load();
-  // A recording that capture never took up: dropped without finishing its file.
-  delete encoder.load();
-  delete stopped.load();
 }
 
 int32_t Source::type() { return capture::AudioEndpoint; }
@@ -140,22 +188,92 @@ bool Source::selected() { return isSelected; }
 void Source::stopCapturing() { capturing.exchange(false); }
 void Source::stopEncode() {
   encoding.exchange(false);
-  if (Encoder* waiting = encoder.exchange(nullptr)) delete stopped.exchange(waiting);
+  if (latest) latest->stop.store(counterNow());
+  latest.reset();
 }
 
 void Source::capture() {
   if (capturing.exchange(true)) return;
   std::thread([self = shared_from_this()] {
     capture::nameThread("tavio-capture");
-    guarded([&] { self->runCapture(); });
+    // What was recorded up to a failure is kept: the clips end there.
+    keepTrying([&] { self->runCapture(); }, [&] { return self->capturing.load(); }, [&] { self->finishAll(); });
   }).detach();
 }
 
 void Source::startEncode(std::string filename) {
-  Encoder* made = makeEncoder(filename, format.load());
-  // One still waiting never got a packet; it is replaced without being finalised.
-  delete encoder.exchange(made);
+  auto clip = std::make_shared<Clip>();
+  clip->encoder.reset(makeEncoder(filename, format.load()));
+  clip->start = counterNow();
+  // A clip still recording ends where the new one begins.
+  if (latest) latest->stop.store(clip->start);
+  latest = clip;
+  {
+    std::lock_guard<std::mutex> hold(clipsLock);
+    started.push_back(clip);
+  }
   encoding.exchange(true);
+}
+
+void Source::record(const BYTE* data, UINT32 frames, uint64_t begin, const WAVEFORMATEXTENSIBLE* captureFormat) {
+  {
+    std::lock_guard<std::mutex> hold(clipsLock);
+    while (!started.empty()) {
+      writing.push_back(std::move(started.front()));
+      started.pop_front();
+    }
+  }
+  const uint64_t rate = captureFormat->Format.nSamplesPerSec;
+  const uint32_t blockAlign = captureFormat->Format.nBlockAlign;
+  const uint64_t end = begin + frames * kUnitsPerSecond / rate;
+  auto frameAt = [&](uint64_t time) {
+    if (time >= end) return frames;
+    return static_cast<UINT32>(std::min<uint64_t>(frames, ((time - begin) * rate + kUnitsPerSecond / 2) / kUnitsPerSecond));
+  };
+  for (auto it = writing.begin(); it != writing.end();) {
+    Clip& clip = **it;
+    const uint64_t stop = clip.stop.load();
+    const uint64_t from = std::max(begin, clip.start);
+    const uint64_t to = stop ? std::min(end, stop) : end;
+    if (to > from) {
+      const UINT32 first = frameAt(from), last = frameAt(to);
+      if (last > first)
+        clip.encoder->write(data + static_cast<size_t>(first) * blockAlign, last - first, &captureFormat->Format,
+                            static_cast<int64_t>(from - clip.start));
+    }
+    if (stop && end >= stop) {
+      clip.encoder->finalize();
+      it = writing.erase(it);
+    } else {
+      ++it;
+    }
+  }
+}
+
+void Source::finishOverdue(uint64_t now) {
+  for (auto it = writing.begin(); it != writing.end();) {
+    const uint64_t stop = (*it)->stop.load();
+    if (stop && now > stop + kStopWait) {
+      (*it)->encoder->finalize();
+      it = writing.erase(it);
+    } else {
+      ++it;
+    }
+  }
+}
+
+// Finalises every clip this endpoint holds, as far as each got; a failure to finish one is
+// printed and does not keep the others from finishing.
+void Source::finishAll() {
+  {
+    std::lock_guard<std::mutex> hold(clipsLock);
+    while (!started.empty()) {
+      writing.push_back(std::move(started.front()));
+      started.pop_front();
+    }
+  }
+  for (auto& clip : writing) guarded([&] { clip->encoder->finalize(); });
+  writing.clear();
 }
 
 uint16_t Source::channels() {
@@ -204,20 +322,6 @@ void Source::runCapture() {
   captureClient.exchange(packets);
   capture::checkResult(kFile, 246, client->Start(), "Could not start the audio client.");
 
-  // The recording this thread writes. Whatever ends the thread hands it back to the source as if
-  // it had never been taken, so that a later capture thread carries on with it or finishes it.
-  Encoder* writing = nullptr;
-  struct HandBack {
-    Source& source;
-    Encoder*& writing;
-    ~HandBack() {
-      if (!writing) return;
-      std::atomic<Encoder*>& slot = source.encoding.load() ? source.encoder : source.stopped;
-      Encoder* empty = nullptr;
-      if (!slot.compare_exchange_strong(empty, writing)) delete writing;  // a newer one is there
-    }
-  } handBack{*this, writing};
-
   while (capturing.load()) {
     BYTE* data = nullptr;
     UINT32 frames = 0;
@@ -234,33 +338,23 @@ void Source::runCapture() {
     if (hr == AUDCLNT_E_SERVICE_NOT_RUNNING) capture::checkResult(kFile, 266, hr, "Audio client service is not running.");
     if (frames == 0 && hr == AUDCLNT_S_BUFFER_EMPTY) {
       capture::checkResult(kFile, 271, packets->ReleaseBuffer(0), "Could not release the audio capture client's buffer.");
+      finishOverdue(counterNow());
       pause();
       continue;
     }
 
-    // Silence is handed on as a block of the packet's size whose contents nobody reads as sound.
+    // Silence is handed on as a block of zeros of the packet's size: it is recorded as it is.
     std::unique_ptr<BYTE[]> silent;
     if (flags & AUDCLNT_BUFFERFLAGS_SILENT) {
-      silent.reset(new BYTE[static_cast<size_t>(captureFormat->Format.nBlockAlign) * frames]);
+      silent.reset(new BYTE[static_cast<size_t>(captureFormat->Format.nBlockAlign) * frames]());
       data = silent.get();
     }
     if (flags & (AUDCLNT_BUFFERFLAGS_DATA_DISCONTINUITY | AUDCLNT_BUFFERFLAGS_TIMESTAMP_ERROR))
       std::cout << "Dev Pos: " << devicePosition << "\tClock Pos: " << qpcPosition << std::endl;
 
-    const bool recording = encoding.load();
-    if (basePosition == 0 || !recording) basePosition = qpcPosition;
-    if (recording) {
-      if (Encoder* fresh = encoder.exchange(nullptr)) {
-        // A new recording began before this thread saw the previous one stopped.
-        if (writing) finish(writing);
-        writing = fresh;
-      }
-      if (writing)
-        writing->write(data, frames, &captureFormat->Format, static_cast<int64_t>(qpcPosition - basePosition));
-    } else {
-      if (writing) finish(writing);
-      if (Encoder* never = stopped.exchange(nullptr)) finish(never);
-    }
+    // Each clip takes the frames from its start to its stop, timed from its start.
+    record(data, frames, qpcPosition, captureFormat);
+    finishOverdue(counterNow());
     if (previewing.load()) computePeaks(data, frames, captureFormat, peaks, peakLock);
     silent.reset();
     capture::checkResult(kFile, 309, packets->ReleaseBuffer(frames), "Could not release the audio capture client's buffer.");

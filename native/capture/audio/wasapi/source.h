@@ -2,6 +2,7 @@
 
 #include <atomic>
 #include <cstdint>
+#include <deque>
 #include <functional>
 #include <memory>
 #include <mutex>
@@ -43,8 +44,15 @@ class Source : public capture::audio::Source, public std::enable_shared_from_thi
 
  private:
   struct Silence;
+  struct Clip;
 
   void runCapture();
+  // Gives every clip its part of the packet that covers [begin, begin + frames / rate) on the
+  // capture clock, and finishes the clips that have reached their stop.
+  void record(const BYTE* data, UINT32 frames, uint64_t begin, const WAVEFORMATEXTENSIBLE* captureFormat);
+  // Finishes the clips whose stop lies far enough behind without packets reaching it.
+  void finishOverdue(uint64_t now);
+  void finishAll();
 
   IMMDevice* endpoint;
   // The newest capture thread's clients; each thread works with its own, and a later thread's
@@ -54,11 +62,13 @@ class Source : public capture::audio::Source, public std::enable_shared_from_thi
   // The silence thread's clients live with that thread, which may outlive the source.
   std::shared_ptr<Silence> silence;
   std::atomic<WAVEFORMATEXTENSIBLE*> format{nullptr};
-  // The recording handed between threads: startEncode puts a new encoder here, the capture thread
-  // takes it with its first recorded packet and owns it from then. One that stopEncode finds still
-  // waiting moves to `stopped`, for the capture thread to finalise on its next packet.
-  std::atomic<Encoder*> encoder{nullptr};
-  std::atomic<Encoder*> stopped{nullptr};
+  // Clips cover the capture-clock interval from their startEncode to their stopEncode. startEncode
+  // hands a new clip to the capture thread through `started`; the thread writes each packet's part
+  // of every clip it holds and finishes a clip once packets have passed its stop.
+  std::mutex clipsLock;
+  std::deque<std::shared_ptr<Clip>> started;  // guarded by clipsLock
+  std::shared_ptr<Clip> latest;               // the caller's thread only
+  std::vector<std::shared_ptr<Clip>> writing;  // the capture thread only
   EncoderFactory makeEncoder;
   bool isSelected;
   std::mutex peakLock;
@@ -66,7 +76,6 @@ class Source : public capture::audio::Source, public std::enable_shared_from_thi
   std::atomic<bool> capturing{false};
   std::atomic<bool> previewing{false};
   std::atomic<bool> encoding{false};
-  uint64_t basePosition = 0;
 };
 
 }  // namespace capture::audio::wasapi
