@@ -3,6 +3,7 @@
 #include <nan.h>
 #include <node.h>
 
+#include <chrono>
 #include <iostream>
 #include <memory>
 #include <stdexcept>
@@ -82,18 +83,25 @@ void append(SourceList found) {
   for (auto& source : found) sources.push_back(std::move(source));
 }
 
-// Keeps every display capturing; its pace is the displays' own acquisition time-out.
+// Keeps every display capturing; its pace is the displays' own acquisition time-out. With no
+// display, or after a failure (a display server gone), it pauses instead of spinning.
 void screenPump() {
   capture::nameThread("tavio-screen");
+  constexpr auto pause = std::chrono::milliseconds(100);
   for (;;) {
+    bool anyScreen = false;
     try {
       for (size_t i = 0; i < sources.size(); ++i) {
         std::shared_ptr<capture::Source> source = sources[i];
-        if (source->type() == capture::Screen) source->capture();
+        if (source->type() != capture::Screen) continue;
+        anyScreen = true;
+        source->capture();
       }
     } catch (const std::runtime_error& e) {
       capture::logWarning(e.what());
+      anyScreen = false;
     }
+    if (!anyScreen) std::this_thread::sleep_for(pause);
   }
 }
 

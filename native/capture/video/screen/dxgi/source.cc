@@ -1,6 +1,8 @@
 #include "capture/video/screen/dxgi/source.h"
 
+#include <chrono>
 #include <cstring>
+#include <thread>
 
 #include "capture/check.h"
 #include "capture/clock.h"
@@ -77,7 +79,9 @@ void Source::capture() {
       try {
         duplication = duplicateOutput(output, device);
       } catch (...) {
-        // Access comes back after the mode change or desktop switch is over.
+        // Access comes back after the mode change or desktop switch is over; until then the
+        // pump waits here without spinning.
+        std::this_thread::sleep_for(std::chrono::milliseconds(100));
       }
     }
     return;
