@@ -61,6 +61,7 @@ struct Stream {
   UINT64 anchorTime = 0;
   UINT64 anchorPosition = 0;
   bool synthesized = false;  // the held packet is silence made here, not the server's
+  bool filled = false;       // the last packet released was such silence
 
   // The capture time of the frame at `frames` on the current time line.
   UINT64 timeOf(UINT64 frames) const {
@@ -151,6 +152,13 @@ class CaptureClient : public ComObject<IAudioCaptureClient, IID_IAudioCaptureCli
     const int64_t queuedUnits = static_cast<int64_t>(queued / s_->frameBytes) * kUnitsPerSecond / s_->sampleSpec.rate;
     const UINT64 measured = now - static_cast<UINT64>(std::max<int64_t>(queuedUnits, 0));
     UINT64 time = s_->timeOf(s_->position);
+    if (s_->filled) {
+      // The sink delivers again after a stretch handed out as silence: its data goes on from its
+      // own time, never before the end of that silence.
+      s_->filled = false;
+      s_->anchorTime = time = std::max(measured, time);
+      s_->anchorPosition = s_->position;
+    }
     const int64_t drift = static_cast<int64_t>(measured - time);
     if (!s_->anchored || drift > kDriftLimit || drift < -kDriftLimit) {
       if (s_->anchored) *flags |= AUDCLNT_BUFFERFLAGS_DATA_DISCONTINUITY;
@@ -180,6 +188,7 @@ class CaptureClient : public ComObject<IAudioCaptureClient, IID_IAudioCaptureCli
     if (s_->invalid()) return AUDCLNT_E_DEVICE_INVALIDATED;
     if (s_->synthesized) {
       s_->synthesized = false;
+      s_->filled = true;
       s_->position += framesRead;
       return S_OK;
     }

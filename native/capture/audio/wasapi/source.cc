@@ -202,6 +202,11 @@ void Source::capture() {
 }
 
 void Source::startEncode(std::string filename) {
+  // Right after initialize the capture thread may not have read the format yet; it does within
+  // milliseconds unless the endpoint cannot be opened.
+  for (int i = 0; i < 400 && !format.load() && capturing.load(); ++i) pause();
+  if (!format.load())
+    capture::checkResult(kFile, 150, AUDCLNT_E_NOT_INITIALIZED, "Audio capture has not started on this endpoint.");
   auto clip = std::make_shared<Clip>();
   clip->encoder.reset(makeEncoder(filename, format.load()));
   clip->start = counterNow();

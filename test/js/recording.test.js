@@ -1,0 +1,191 @@
+'use strict';
+// Clips as a user records them: each covers its start to its stop whatever the picture or the
+// sound does, clips started together line up, start/stop cycles lose nothing, and a host killed
+// mid-recording leaves files that play up to about a second before the kill.
+const { test, before, after } = require('node:test');
+const assert = require('node:assert');
+const { execFileSync, spawnSync } = require('child_process');
+const fs = require('fs');
+const os = require('os');
+const path = require('path');
+const { startDesktop } = require('../../scripts/desktop');
+const { runAddon, root } = require('./addon');
+
+let dir;
+let flashbeep;
+
+before(() => {
+  dir = fs.mkdtempSync(path.join(os.tmpdir(), 'tavio-recording-'));
+  flashbeep = path.join(dir, 'flashbeep');
+  execFileSync('g++', ['-O2', '-o', flashbeep, path.join(root, 'test/tools/flashbeep.cc'), '-lxcb', '-lpulse-simple', '-lpulse']);
+});
+after(() => fs.rmSync(dir, { recursive: true, force: true }));
+
+async function withDesktop(fn, options = {}) {
+  const desktop = await startDesktop(options);
+  try {
+    await fn(desktop.env);
+  } finally {
+    desktop.stop();
+  }
+}
+
+function probe(file) {
+  const r = spawnSync('ffprobe', ['-v', 'error', '-show_entries', 'format=duration', '-of', 'csv=p=0', file], { encoding: 'utf8' });
+  return r.status === 0 && r.stdout.trim() ? Number(r.stdout.trim()) : NaN;
+}
+
+// Decodes the whole file; resolves to the error lines ffmpeg printed.
+function decodeErrors(file) {
+  return spawnSync('ffmpeg', ['-v', 'error', '-i', file, '-f', 'null', '-'], { encoding: 'utf8' }).stderr.trim();
+}
+
+// Seconds into the clip of the first picture whose top-left corner is bright.
+function flashTime(file) {
+  const r = spawnSync('ffprobe', ['-v', 'error', '-f', 'lavfi', '-i', `movie=${file},crop=64:64:0:0,signalstats`,
+    '-show_entries', 'frame=pts_time:frame_tags=lavfi.signalstats.YAVG', '-of', 'csv=p=0'], { encoding: 'utf8' });
+  for (const line of r.stdout.trim().split('\n')) {
+    const [time, luma] = line.split(',').map(Number);
+    if (luma > 128) return time;
+  }
+  return NaN;
+}
+
+// Seconds into the clip of the first sample louder than 0.1.
+function beepTime(file) {
+  const raw = execFileSync('ffmpeg', ['-v', 'error', '-i', file, '-ac', '1', '-ar', '48000', '-f', 'f32le', '-'], { maxBuffer: 1 << 28 });
+  const samples = new Float32Array(raw.buffer, raw.byteOffset, raw.length / 4);
+  const index = samples.findIndex((v) => Math.abs(v) > 0.1);
+  return index < 0 ? NaN : index / 48000;
+}
+
+const FIND = `
+addon.initialize();
+const sources = events.filter((e) => e.type === 'new source').map((e) => e.source);
+const display = sources.find((s) => s.type === 'dxgi');
+const speakers = sources.find((s) => s.type === 'wasapi');
+`;
+
+test('a display clip on a still screen covers its start to its stop and is finished at once', async () => {
+  await withDesktop(async (env) => {
+    const file = path.join(dir, 'still.mp4');
+    const { reports, code, stderr } = await runAddon(`${FIND}
+      await sleep(1500);  // the screen has been still since initialize
+      addon.startCapture(display.id, ${JSON.stringify(file)});
+      const start = Date.now();
+      await sleep(2000);
+      addon.stopCapture(display.id);
+      const stop = Date.now();
+      const { spawnSync } = require('child_process');
+      let validAfter = -1;
+      while (Date.now() - stop < 3000) {
+        const r = spawnSync('ffprobe', ['-v', 'error', '-show_entries', 'format=duration', '-of', 'csv=p=0', ${JSON.stringify(file)}], { encoding: 'utf8' });
+        if (r.status === 0 && Number(r.stdout) > 0) { validAfter = Date.now() - stop; break; }
+        await sleep(50);
+      }
+      report({ wall: (stop - start) / 1000, validAfter });`, { env });
+    assert.strictEqual(code, 0, stderr);
+    const [{ wall, validAfter }] = reports;
+    assert.ok(validAfter >= 0 && validAfter < 1000, `valid ${validAfter} ms after the stop`);
+    assert.ok(Math.abs(probe(file) - wall) <= 1 / 30 + 0.01, `${probe(file)} s for ${wall} s`);
+    assert.strictEqual(decodeErrors(file), '');
+  });
+});
+
+test('a flash and a beep made together land at the same time in clips started together', async () => {
+  await withDesktop(async (env) => {
+    const video = path.join(dir, 'flash.mp4');
+    const audio = path.join(dir, 'beep.mp4');
+    const { code, stderr } = await runAddon(`${FIND}
+      await sleep(1000);
+      const { spawn } = require('child_process');
+      const tool = spawn(${JSON.stringify(flashbeep)}, ['1500'], { stdio: ['ignore', 'pipe', 'inherit'] });
+      await new Promise((resolve) => tool.stdout.on('data', (d) => { if (String(d).includes('ready')) resolve(); }));
+      addon.startCapture(display.id, ${JSON.stringify(video)});
+      addon.startCapture(speakers.id, ${JSON.stringify(audio)});
+      await new Promise((resolve) => tool.stdout.on('data', (d) => { if (String(d).includes('flash')) resolve(); }));
+      await sleep(1000);
+      addon.stopCapture(display.id);
+      addon.stopCapture(speakers.id);
+      tool.kill();
+      await sleep(1000);`, { env });
+    assert.strictEqual(code, 0, stderr);
+    const flash = flashTime(video);
+    const beep = beepTime(audio);
+    assert.ok(flash > 0.5 && beep > 0.5, `flash at ${flash} s, beep at ${beep} s`);
+    assert.ok(Math.abs(flash - beep) <= 0.06, `flash at ${flash} s, beep at ${beep} s`);
+  });
+});
+
+test('back-to-back one-second clips of a display and an endpoint each last their own second', async () => {
+  await withDesktop(async (env) => {
+    const { reports, code, stderr } = await runAddon(`${FIND}
+      const path = require('path');
+      const walls = [];
+      for (let i = 0; i < 5; i++) {
+        const started = Date.now();
+        addon.startCapture(display.id, path.join(${JSON.stringify(dir)}, 'cycle-display-' + i + '.mp4'));
+        addon.startCapture(speakers.id, path.join(${JSON.stringify(dir)}, 'cycle-endpoint-' + i + '.mp4'));
+        await sleep(1000);
+        addon.stopCapture(display.id);
+        addon.stopCapture(speakers.id);
+        walls.push((Date.now() - started) / 1000);
+        if (i % 2 === 0) await sleep(300);  // after odd clips the next starts with no gap at all
+      }
+      await sleep(1500);
+      report(walls);`, { env });
+    assert.strictEqual(code, 0, stderr);
+    const [walls] = reports;
+    for (let i = 0; i < 5; i++) {
+      for (const [kind, tolerance] of [['display', 1 / 30 + 0.01], ['endpoint', 0.05]]) {
+        const file = path.join(dir, `cycle-${kind}-${i}.mp4`);
+        const duration = probe(file);
+        assert.ok(Math.abs(duration - walls[i]) <= tolerance, `${kind} clip ${i}: ${duration} s for ${walls[i]} s`);
+        assert.strictEqual(decodeErrors(file), '', `${kind} clip ${i}`);
+      }
+    }
+  });
+});
+
+test('an endpoint clip started right after initialize lasts its wall time', async () => {
+  await withDesktop(async (env) => {
+    const file = path.join(dir, 'early.mp4');
+    const { reports, code, stderr } = await runAddon(`${FIND}
+      addon.startCapture(speakers.id, ${JSON.stringify(file)});
+      const start = Date.now();
+      await sleep(2000);
+      addon.stopCapture(speakers.id);
+      report((Date.now() - start) / 1000);
+      await sleep(800);`, { env });
+    assert.strictEqual(code, 0, stderr);
+    const [wall] = reports;
+    assert.ok(Math.abs(probe(file) - wall) <= 0.05, `${probe(file)} s for ${wall} s`);
+  }, { display: false });
+});
+
+test('a host killed while recording leaves files that play up to a second before the kill', async () => {
+  await withDesktop(async (env) => {
+    const files = { display: path.join(dir, 'kill-display.mp4'), endpoint: path.join(dir, 'kill-endpoint.mp4'),
+      camera: path.join(dir, 'kill-camera.mp4'), h264: path.join(dir, 'kill-h264.mp4') };
+    const { reports, signal } = await runAddon(`${FIND}
+      const cameras = sources.filter((s) => s.type === 'mfce_video');
+      await sleep(500);
+      addon.startCapture(display.id, ${JSON.stringify(files.display)});
+      addon.startCapture(speakers.id, ${JSON.stringify(files.endpoint)});
+      addon.startCapture(cameras[0].id, ${JSON.stringify(files.camera)});
+      addon.startCapture(cameras[1].id, ${JSON.stringify(files.h264)});
+      const start = Date.now();
+      await sleep(5000);
+      report((Date.now() - start) / 1000);
+      process.kill(process.pid, 'SIGKILL');`, {
+      env: { ...env, TAVIO_TEST_CAMERAS: 'Kill Camera=testsrc2=size=320x240:rate=30;Kill H264=h264:testsrc2=size=320x240:rate=30' },
+    });
+    assert.strictEqual(signal, 'SIGKILL');
+    const [recorded] = reports;
+    for (const [kind, file] of Object.entries(files)) {
+      assert.strictEqual(decodeErrors(file), '', kind);
+      const duration = probe(file);
+      assert.ok(duration >= recorded - 1, `${kind}: ${duration} s of ${recorded} s`);
+    }
+  });
+});
