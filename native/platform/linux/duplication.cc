@@ -93,6 +93,13 @@ bool findFormats(xcb_connection_t* c, const xcb_screen_t* screen, xcb_render_pic
   return *argb && *root;
 }
 
+// One colour of a pixel scaled to 8 bits, whatever the width of its mask (5, 6, 8 or 10 bits).
+uint32_t channel(uint32_t pixel, uint32_t mask) {
+  if (!mask) return 0;
+  const uint32_t largest = mask >> __builtin_ctz(mask);
+  return ((pixel & mask) >> __builtin_ctz(mask)) * 255u / largest;
+}
+
 bool overlaps(const xcb_rectangle_t& a, const x11::Monitor& m) {
   return a.x < m.x + m.width && m.x < a.x + a.width && a.y < m.y + m.height && m.y < a.y + a.height;
 }
@@ -122,13 +129,25 @@ bool Duplication::setUp() {
   if (!screen || !x11::findMonitor(c, screen_, name_, &monitor_)) return false;
   root_ = screen->root;
 
-  // The grab hands on 4 bytes a pixel: the root must be 24 or 32 bits deep at 32 bits a pixel.
-  bool fourBytes = false;
+  // GetImage gives the root's own pixels; those of a true-colour visual at 16 or 32 bits a pixel
+  // (depths 15, 16, 24, 30, 32) are converted to B, G, R, A here. RENDER converts any depth.
   const xcb_setup_t* setup = xcb_get_setup(c);
   for (auto it = xcb_setup_pixmap_formats_iterator(setup); it.rem; xcb_format_next(&it)) {
-    if (it.data->depth == screen->root_depth) fourBytes = it.data->bits_per_pixel == 32;
+    if (it.data->depth != screen->root_depth) continue;
+    pixels_.bytes = it.data->bits_per_pixel / 8u;
+    pixels_.pad = it.data->scanline_pad;
+    convertible_ = it.data->bits_per_pixel == 16 || it.data->bits_per_pixel == 32;
   }
-  if (!fourBytes || (screen->root_depth != 24 && screen->root_depth != 32)) return false;
+  for (auto d = xcb_screen_allowed_depths_iterator(screen); d.rem; xcb_depth_next(&d)) {
+    for (auto v = xcb_depth_visuals_iterator(d.data); v.rem; xcb_visualtype_next(&v)) {
+      if (v.data->visual_id != screen->root_visual) continue;
+      pixels_.red = v.data->red_mask;
+      pixels_.green = v.data->green_mask;
+      pixels_.blue = v.data->blue_mask;
+      convertible_ = convertible_ && v.data->_class == XCB_VISUAL_CLASS_TRUE_COLOR && pixels_.red && pixels_.green &&
+                    pixels_.blue && (pixels_.pad == 8 || pixels_.pad == 16 || pixels_.pad == 32);
+    }
+  }
 
   const xcb_query_extension_reply_t* damage = xcb_get_extension_data(c, &xcb_damage_id);
   const xcb_query_extension_reply_t* xfixes = xcb_get_extension_data(c, &xcb_xfixes_id);
@@ -168,7 +187,43 @@ bool Duplication::setUp() {
     }
   }
   xcb_flush(c);
+  // A root neither RENDER nor the conversion can read (an indexed-colour screen without RENDER)
+  // gives no duplication rather than wrong colours.
+  if (!composite_ && !convertible_) return false;
   return !xcb_connection_has_error(c);
+}
+
+// Rows of root pixels to B, G, R, A rows packed at width * 4 bytes. `from` may be `to` itself: the
+// pixels are taken from the last backwards, so a pixel of 2 bytes is read before its place in
+// the wider picture is written.
+void Duplication::convert(const uint8_t* from, size_t fromStride, uint8_t* to, int32_t rows) const {
+  const uint32_t width = monitor_.width;
+  if (pixels_.words()) {
+    if (from != to)
+      for (int32_t y = 0; y < rows; ++y) std::memcpy(to + y * size_t{width} * 4, from + y * fromStride, size_t{width} * 4);
+    // The server leaves the padding byte of a 24-bit pixel at 0; the format promises opaque alpha.
+    auto* words = reinterpret_cast<uint32_t*>(to);
+    const size_t count = size_t{width} * rows;
+    for (size_t i = 0; i < count; ++i) words[i] |= 0xFF000000u;
+    return;
+  }
+  for (int32_t y = rows - 1; y >= 0; --y) {
+    const uint8_t* in = from + y * fromStride;
+    uint8_t* out = to + y * size_t{width} * 4;
+    for (int64_t x = static_cast<int64_t>(width) - 1; x >= 0; --x) {
+      uint32_t pixel = 0;
+      if (pixels_.bytes == 2) {
+        uint16_t half;
+        std::memcpy(&half, in + x * 2, 2);
+        pixel = half;
+      } else {
+        std::memcpy(&pixel, in + x * 4, 4);
+      }
+      const uint32_t word = channel(pixel, pixels_.blue) | channel(pixel, pixels_.green) << 8 |
+                            channel(pixel, pixels_.red) << 16 | 0xFF000000u;
+      std::memcpy(out + x * 4, &word, 4);
+    }
+  }
 }
 
 void Duplication::GetDesc(DXGI_OUTDUPL_DESC* desc) {
@@ -405,6 +460,8 @@ bool Duplication::fetch(d3d11::TextureMemory& memory, int32_t top, int32_t rows)
                                                    static_cast<int16_t>(top), monitor_.width,
                                                    static_cast<uint16_t>(rows)));
   }
+  if (!convertible_) return false;
+  const size_t stride = pixels_.stride(monitor_.width);
   if (shm_) {
     auto image = own(xcb_shm_get_image_reply(
         c,
@@ -413,19 +470,16 @@ bool Duplication::fetch(d3d11::TextureMemory& memory, int32_t top, int32_t rows)
                           static_cast<uint32_t>(top * rowBytes)),
         nullptr));
     if (!image) return false;
+    convert(at, stride, at, rows);
   } else {
     auto image = own(xcb_get_image_reply(c,
                                          xcb_get_image(c, XCB_IMAGE_FORMAT_Z_PIXMAP, root_, monitor_.x,
                                                        static_cast<int16_t>(monitor_.y + top), monitor_.width,
                                                        static_cast<uint16_t>(rows), ~0u),
                                          nullptr));
-    if (!image || static_cast<size_t>(xcb_get_image_data_length(image.get())) < rowBytes * rows) return false;
-    std::memcpy(at, xcb_get_image_data(image.get()), rowBytes * rows);
+    if (!image || static_cast<size_t>(xcb_get_image_data_length(image.get())) < stride * rows) return false;
+    convert(xcb_get_image_data(image.get()), stride, at, rows);
   }
-  // The server leaves the padding byte of a 24-bit pixel at 0; the format promises opaque alpha.
-  auto* pixels = reinterpret_cast<uint32_t*>(at);
-  const size_t count = rowBytes / 4 * rows;
-  for (size_t i = 0; i < count; ++i) pixels[i] |= 0xFF000000u;
   return true;
 }
 
