@@ -3,6 +3,7 @@
 #include <nan.h>
 #include <node.h>
 
+#include <algorithm>
 #include <cstdlib>
 #include <iostream>
 #include <limits>
