@@ -24,8 +24,8 @@ std::string print(const pa_channel_map& map) {
 // The mix format of a sink, as the capture code sends it back to the audio client.
 struct Mix {
   explicit Mix(const char* sinkMap, uint8_t channels) : sink(parse(sinkMap)) {
-    const pa_sample_spec spec{PA_SAMPLE_FLOAT32LE, 48000, channels};
-    format = mixFormat(spec, sink);
+    const pa_sample_spec sampleSpec{PA_SAMPLE_FLOAT32LE, 48000, channels};
+    format = mixFormat(sampleSpec, sink);
   }
   ~Mix() { CoTaskMemFree(format); }
   DWORD mask() const { return reinterpret_cast<const WAVEFORMATEXTENSIBLE*>(format)->dwChannelMask; }
@@ -36,9 +36,9 @@ struct Mix {
 // The stream map that the audio client opens for the sink's own mix format: recording through it
 // must not remix, so it holds the sink's positions (in wave order).
 std::string streamMap(const Mix& mix, const pa_channel_map* device) {
-  pa_sample_spec spec;
+  pa_sample_spec sampleSpec;
   pa_channel_map map;
-  if (!specOf(mix.format, spec, map, device)) return "refused";
+  if (!specOf(mix.format, sampleSpec, map, device)) return "refused";
   return print(map);
 }
 
@@ -76,9 +76,9 @@ TEST(PulseFormat, MasksThatCannotFitTheChannelsAreRefused) {
   EXPECT_EQ(streamMap(stereo, &stereo.sink), "refused");
   // A plain format has the usual layout of its channel count.
   WAVEFORMATEX plain{WAVE_FORMAT_IEEE_FLOAT, 2, 48000, 48000 * 8, 8, 32, 0};
-  pa_sample_spec spec;
+  pa_sample_spec sampleSpec;
   pa_channel_map map;
-  ASSERT_TRUE(specOf(&plain, spec, map, &stereo.sink));
+  ASSERT_TRUE(specOf(&plain, sampleSpec, map, &stereo.sink));
   EXPECT_EQ(print(map), "front-left,front-right");
 }
 
