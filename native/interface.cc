@@ -3,8 +3,11 @@
 #include <nan.h>
 #include <node.h>
 
+#include <algorithm>
 #include <chrono>
+#include <cstdlib>
 #include <iostream>
+#include <limits>
 #include <memory>
 #include <stdexcept>
 #include <string>
@@ -55,6 +58,7 @@ void set(v8::Local<v8::Object> object, const char* key, v8::Local<v8::Value> val
 
 // Delivers one event to the stored callback, synchronously, inside its own async context.
 void emitEvent(v8::Local<v8::Object> event) {
+  if (callback.IsEmpty()) return;  // initialize refuses to run without one; nothing else may crash
   v8::Isolate* js = isolate ? isolate : v8::Isolate::GetCurrent();
   v8::HandleScope scope(js);
   v8::Local<v8::Context> context = js->GetCurrentContext();
@@ -107,6 +111,16 @@ void screenPump() {
 
 NAN_METHOD(initialize) {
   isolate = info.GetIsolate();
+  // Without a callback no "new source" event could reach the host, which then could not know a
+  // uid; so nothing is found or started, and initialize may be called again after setCallback.
+  if (callback.IsEmpty()) {
+    try {
+      capture::checkResult(kFile, 52, E_POINTER, "initialize: no event callback; call setCallback first.");
+    } catch (const std::runtime_error& e) {
+      capture::logWarning(e.what());
+    }
+    return;
+  }
   try {
     const size_t firstNew = sources.size();
     {
@@ -140,7 +154,13 @@ NAN_METHOD(initialize) {
       }
     }
 
-    append(capture::video::screen::dxgi::CaptureMethod().sources());
+    // A display the grab cannot handle costs the displays, not the cameras and endpoints found
+    // above: they are announced all the same.
+    try {
+      append(capture::video::screen::dxgi::CaptureMethod().sources());
+    } catch (const std::runtime_error& e) {
+      capture::logWarning(e.what());
+    }
 
     std::thread(screenPump).detach();
 
@@ -174,8 +194,23 @@ NAN_METHOD(getPreview) {
     const int32_t height = intArgument(info, 2);
     if (width < 0 || height < 0) throw std::invalid_argument("preview size must not be negative");
     auto& video = dynamic_cast<capture::video::Source&>(*capture::at(sources, static_cast<size_t>(uid)));
-    const size_t bytes = static_cast<size_t>(video.pixelWidth()) * static_cast<size_t>(height) * static_cast<size_t>(width);
-    v8::Local<v8::ArrayBuffer> buffer = v8::ArrayBuffer::New(currentIsolate(info), bytes);
+    const uint64_t bytes = static_cast<uint64_t>(video.pixelWidth()) * static_cast<uint64_t>(height) * static_cast<uint64_t>(width);
+    // The scaler addresses the picture with 32-bit signed offsets, and a typed array holds at
+    // most kMaxLength bytes: anything larger would be written out of bounds.
+    constexpr uint64_t largest =
+        std::min<uint64_t>(std::numeric_limits<int32_t>::max(), v8::TypedArray::kMaxLength);
+    if (bytes > largest) {
+      const std::string text = "getPreview: a preview of " + std::to_string(width) + "x" + std::to_string(height) +
+                               " pixels is larger than " + std::to_string(largest) + " bytes.";
+      capture::checkResult(kFile, 175, E_INVALIDARG, text.c_str());
+    }
+    // V8's own allocation ends the process when memory runs out; memory of our own is refused
+    // with a warning instead, and handed to the array buffer, which frees it.
+    void* memory = std::malloc(bytes ? bytes : 1);
+    if (!memory) capture::checkResult(kFile, 181, E_OUTOFMEMORY, "getPreview: no memory for the preview.");
+    std::shared_ptr<v8::BackingStore> store = v8::ArrayBuffer::NewBackingStore(
+        memory, bytes, [](void* data, size_t, void*) { std::free(data); }, nullptr);
+    v8::Local<v8::ArrayBuffer> buffer = v8::ArrayBuffer::New(currentIsolate(info), store);
     if (video.preview(static_cast<uint8_t*>(buffer->Data()), 1, width, height))
       info.GetReturnValue().Set(v8::Uint8ClampedArray::New(buffer, 0, buffer->ByteLength()));
   } catch (const std::exception& e) {

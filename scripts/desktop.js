@@ -12,9 +12,9 @@ function sleep(ms) {
 }
 
 // Starts Xvfb and resolves with its display name (":N"), read from -displayfd.
-function startXvfb(width, height, extra) {
+function startXvfb(width, height, extra, depth = 24) {
   return new Promise((resolve, reject) => {
-    const xvfb = spawn('Xvfb', ['-displayfd', '3', '-screen', '0', `${width}x${height}x24`, '-noreset', '-nolisten', 'tcp', ...extra], {
+    const xvfb = spawn('Xvfb', ['-displayfd', '3', '-screen', '0', `${width}x${height}x${depth}`, '-noreset', '-nolisten', 'tcp', ...extra], {
       stdio: ['ignore', 'ignore', 'pipe', 'pipe'],
     });
     let text = '';
@@ -33,7 +33,7 @@ function pulseConfig(dir, sinks, microphone) {
   const lines = [`load-module module-native-protocol-unix auth-anonymous=1 socket=${dir}/native`];
   for (const sink of sinks) {
     lines.push(`load-module module-null-sink sink_name=${sink.name} rate=${sink.rate || 48000} channels=${sink.channels || 2} ` +
-      `sink_properties="device.description='${sink.description}'"`);
+      (sink.channelMap ? `channel_map=${sink.channelMap} ` : '') + `sink_properties="device.description='${sink.description}'"`);
   }
   if (sinks.length) lines.push(`set-default-sink ${sinks.find((s) => s.default)?.name || sinks[0].name}`);
   if (microphone) {
@@ -62,13 +62,14 @@ async function startPulse(dir, sinks, microphone) {
 /**
  * Starts what the environment does not already give (or everything, with `private: true`).
  * Options: width, height, monitors (xrandr --setmonitor arguments, e.g. ['LEFT 960/254x1080/286+0+0 screen']),
- * sinks ([{name, description, rate, channels, default}]), microphone ({name, description, frequency}),
- * display (false: no X server), xvfbArguments (more Xvfb arguments), audio (false: no sound server).
+ * sinks ([{name, description, rate, channels, channelMap, default}], channelMap e.g. 'aux0,aux1'),
+ * microphone ({name, description, frequency}), display (false: no X server), depth (the screen's
+ * depth, 24 by default), xvfbArguments (more Xvfb arguments), audio (false: no sound server).
  * Resolves with { env, dir, stop() }: env holds DISPLAY and PULSE_SERVER for child processes.
  */
 async function startDesktop(options = {}) {
   const {
-    width = 1920, height = 1080, monitors = [], display = true, xvfbArguments = [], audio = true,
+    width = 1920, height = 1080, depth = 24, monitors = [], display = true, xvfbArguments = [], audio = true,
     sinks = [{ name: 'tavio_speakers', description: 'Tavio Speakers', default: true }],
     microphone = { name: 'tavio_mic', description: 'Tavio Microphone', frequency: 440 },
   } = options;
@@ -78,7 +79,7 @@ async function startDesktop(options = {}) {
   let xvfb = null;
   try {
     if (display && (own || !process.env.DISPLAY)) {
-      xvfb = await startXvfb(width, height, xvfbArguments);
+      xvfb = await startXvfb(width, height, xvfbArguments, depth);
       env.DISPLAY = xvfb.display;
       for (const monitor of monitors) {
         execFileSync('xrandr', ['--setmonitor', ...monitor.split(' ')], { env: { ...process.env, DISPLAY: env.DISPLAY } });

@@ -7,23 +7,24 @@ const path = require('path');
 const root = path.resolve(__dirname, '..', '..');
 const MARK = '@@tavio-report ';
 
-function prelude() {
+function prelude(callback) {
   return `
 const addon = require(${JSON.stringify(root)});
 const events = [];
-addon.setCallback((event) => events.push(event));
+${callback ? 'addon.setCallback((event) => events.push(event));' : ''}
 const report = (value) => process.stdout.write(${JSON.stringify(MARK)} + JSON.stringify(value) + '\\n');
 const sleep = (ms) => new Promise((resolve) => setTimeout(resolve, ms));
 `;
 }
 
 /**
- * Runs `script` (may use await) with `addon`, `events`, `report(value)` and `sleep(ms)` defined.
+ * Runs `script` (may use await) with `addon`, `events`, `report(value)` and `sleep(ms)` defined;
+ * the events arrive through a callback set before the script runs, unless `callback` is false.
  * Resolves { reports, stdout, stderr, code, signal }: stdout without the report lines. The child is
  * ended when the script finishes, or killed after timeoutMs.
  */
-function runAddon(script, { env = {}, timeoutMs = 60000 } = {}) {
-  const source = `${prelude()}
+function runAddon(script, { env = {}, timeoutMs = 60000, callback = true } = {}) {
+  const source = `${prelude(callback)}
 (async () => {
 ${script}
 })().then(() => process.exit(0), (error) => { console.error(error); process.exit(3); });

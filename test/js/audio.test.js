@@ -164,3 +164,59 @@ test('without a sound server there is no default endpoint', async () => {
     { env: { PULSE_SERVER: `unix:${os.tmpdir()}/no-such-pulse-server`, DISPLAY: '' } });
   assert.match(stdout, /native\/capture\/audio\/wasapi\/capturemethod\(30\): 0x80070490: Could not get the default device\./);
 });
+
+// Pro-audio sinks (PipeWire's pro-audio profile and the like) have channels without speaker
+// positions. A tone played into each such channel must arrive in peaks and recordings, not silence.
+test('sinks whose channels have no speaker positions record and preview what they play', async (t) => {
+  const sinks = [
+    { name: 'tavio_aux', description: 'Tavio Aux Sink', channels: 2, channelMap: 'aux0,aux1', default: true },
+    { name: 'tavio_mixed', description: 'Tavio Mixed Sink', channels: 4, channelMap: 'front-left,front-right,aux0,aux1' },
+  ];
+  const desktop = await startDesktop({ display: false, sinks });
+  t.after(() => desktop.stop());
+  const dir = fs.mkdtempSync(path.join(os.tmpdir(), 'tavio-aux-'));
+  t.after(() => fs.rmSync(dir, { recursive: true, force: true }));
+
+  for (const sink of sinks) {
+    await t.test(`${sink.channelMap}: peaks and a clip near 0.5 on every channel, no warning`, async () => {
+      // The file carries the sink's own map, so nothing is remixed on the way in.
+      const file = tone(dir, { seconds: 5, channels: sink.channels });
+      const clip = path.join(dir, `${sink.name}.mp4`);
+      const { reports, code, stdout } = await runAddon(`
+        addon.initialize();
+        await sleep(500);
+        const uid = events.find((e) => e.source.name === ${JSON.stringify(sink.description)}).source.id;
+        const player = require('child_process').spawn('paplay', ['--device=${sink.name}',
+          '--channel-map=${sink.channelMap}', ${JSON.stringify(file)}], { stdio: 'ignore' });
+        let preview;
+        for (let i = 0; i < 300; i++) {
+          await sleep(10);
+          preview = addon.getPreview(uid);
+          if (Object.keys(preview).filter((k) => /^\\d+$/.test(k)).every((k) => preview[k] > 0.4)) break;
+        }
+        addon.startCapture(uid, ${JSON.stringify(clip)});
+        await sleep(1500);
+        addon.stopCapture(uid);
+        await sleep(500);
+        player.kill();
+        report(preview);`, { env: desktop.env });
+      assert.strictEqual(code, 0, stdout);
+      const preview = reports[0];
+      for (let c = 0; c < sink.channels; c++) assert.ok(Math.abs(preview[c] - 0.5) < 0.03, `peak ${c}: ${JSON.stringify(preview)}`);
+      const info = probe(clip);
+      assert.strictEqual(info.streams[0].channels, sink.channels);
+      // The tone's amplitude in every channel of the decoded clip (its RMS times the square root of
+      // 2), over the middle of the clip: AAC rings around the start and the end.
+      const raw = execFileSync('ffmpeg', ['-v', 'error', '-i', clip, '-f', 'f32le', '-'], { maxBuffer: 1 << 26 });
+      const samples = new Float32Array(raw.buffer, raw.byteOffset, raw.length / 4);
+      const frames = samples.length / sink.channels;
+      const sums = new Array(sink.channels).fill(0);
+      for (let f = Math.floor(frames * 0.2); f < Math.floor(frames * 0.8); f++) {
+        for (let c = 0; c < sink.channels; c++) sums[c] += samples[f * sink.channels + c] ** 2;
+      }
+      const amplitudes = sums.map((sum) => Math.sqrt((2 * sum) / (Math.floor(frames * 0.8) - Math.floor(frames * 0.2))));
+      for (const a of amplitudes) assert.ok(Math.abs(a - 0.5) < 0.05, `clip amplitudes ${amplitudes}`);
+      assert.doesNotMatch(stdout, /Warning/);
+    });
+  }
+});

@@ -36,8 +36,8 @@ function movePointer(env, x, y) {
   execFileSync('xdotool', ['mousemove', String(x), String(y)], { env: { ...process.env, ...env } });
 }
 
-async function withDesktop(fn, xvfbArguments = []) {
-  const desktop = await startDesktop({ monitors: MONITORS, xvfbArguments });
+async function withDesktop(fn, xvfbArguments = [], depth = 24) {
+  const desktop = await startDesktop({ monitors: MONITORS, xvfbArguments, depth });
   const children = [];
   try {
     await fn(desktop.env, children);
@@ -80,8 +80,24 @@ test('two monitors give two display sources in server order, the first selected'
   });
 });
 
-// Servers with RENDER get the picture composited into shared memory; without it, GetImage.
-for (const [server, xvfbArguments] of [['', []], [', X server without RENDER', ['-extension', 'RENDER']]]) {
+// Servers with RENDER get the picture composited into shared memory; without it, GetImage, whose
+// pixels at depths other than 24 and 32 the grab converts itself.
+const SERVERS = [['', []], [', X server without RENDER', ['-extension', 'RENDER']]];
+for (const [server, xvfbArguments] of SERVERS) {
+  for (const depth of [16, 30]) {
+    test(`a screen of depth ${depth} previews the pattern in its true colours${server}`, async () => {
+      await withDesktop(async (env, children) => {
+        movePointer(env, 1900, 1000);
+        children.push(await pattern(env, [0, 0, 960, 1080]));
+        const { reports, code, stderr, stdout } = await runAddon(`${INIT}
+          const p = await preview(left.id, 96, 108);
+          report([12, 36, 60, 84].map((x) => Array.from(p.slice((54 * 96 + x) * 4, (54 * 96 + x) * 4 + 4))));
+        `, { env });
+        assert.strictEqual(code, 0, stderr + stdout);
+        assert.deepStrictEqual(reports[0], [[255, 0, 0, 255], [0, 255, 0, 255], [0, 0, 255, 255], [255, 255, 255, 255]]);
+      }, xvfbArguments, depth);
+    });
+  }
   test(`getPreview returns the scaled pattern in red, green, blue, alpha order${server}`, async () => {
     await withDesktop(async (env, children) => {
       movePointer(env, 1900, 1000);  // on the right monitor, out of the picture
@@ -233,7 +249,8 @@ test('a recording is H.264 Main at the monitor size, 30/1, timed by capture time
   });
 });
 
-test('a recording is upright and its colours are the BT.709 limited-range levels it declares', async () => {
+for (const depth of [24, 16, 30]) {
+test(`a recording is upright and its colours are the BT.709 limited-range levels it declares (depth ${depth})`, async () => {
   await withDesktop(async (env, children) => {
     movePointer(env, 1900, 1000);
     // The pattern fills the top half only; the bottom half is the black root window.
@@ -266,7 +283,18 @@ test('a recording is upright and its colours are the BT.709 limited-range levels
     const first = order.indexOf(names[0]);
     assert.deepStrictEqual(names, [0, 1, 2, 3].map((i) => order[(first + i) % 4]));
     for (const x of [120, 480, 840]) assert.ok(near(at(x, 810), [16, 128, 128]), JSON.stringify(at(x, 810)));
-  });
+  }, [], depth);
+});
+}
+
+test('a screen the grab cannot read costs only the displays: the other sources are announced', async () => {
+  // Indexed colour without RENDER: neither the server nor the grab can turn it into B, G, R, A.
+  await withDesktop(async (env) => {
+    const { reports, code, stdout } = await runAddon('addon.initialize(); report(events.map((e) => e.source.type));', { env });
+    assert.strictEqual(code, 0, stdout);
+    assert.deepStrictEqual(reports[0], ['mfce_audio', 'wasapi']);
+    assert.match(stdout, /duplicate\(10\): 0x887a0004: Could not get output duplicator from device\./);
+  }, ['-extension', 'RENDER'], 8);
 });
 
 test('a recording into a missing folder is a warning and the host records again afterwards', async () => {

@@ -17,6 +17,31 @@ test('exports the seven functions in order', async () => {
   assert.strictEqual(reports[1], 'function');
 });
 
+test('FFmpeg\'s log never reaches standard error; its errors are warning lines', async (t) => {
+  const desktop = await startDesktop({ width: 640, height: 480 });
+  t.after(() => desktop.stop());
+  const cameras = 'Plain=testsrc2=size=320x240:rate=30;Encoding=h264:testsrc2=size=320x240:rate=30;' +
+    'Broken=testsrc2=size=notasize';
+  const folder = require('fs').mkdtempSync(require('path').join(require('os').tmpdir(), 'tavio-log-'));
+  t.after(() => require('fs').rmSync(folder, { recursive: true, force: true }));
+  // Every source kind previews and records for a second.
+  const { reports, stdout, stderr, code } = await runAddon(`
+    addon.initialize();
+    await sleep(1000);
+    const uids = events.filter((e) => e.source.name !== 'Broken').map((e) => e.source.id);
+    for (const uid of uids) addon.startCapture(uid, ${JSON.stringify(folder)} + '/' + uid + '.mp4');
+    await sleep(1000);
+    for (const uid of uids) addon.stopCapture(uid);
+    await sleep(1000);
+    report(events.filter((e) => e.type === 'new source').map((e) => e.source.type));`, { env: { ...desktop.env, TAVIO_TEST_CAMERAS: cameras } });
+  assert.strictEqual(code, 0, stdout + stderr);
+  assert.strictEqual(stderr, '');
+  assert.match(stdout, /\tnative\/platform\/linux\/avlog\(46\): 0x80004005: FFmpeg lavfi: Error initializing filter 'testsrc2' with args 'size=notasize' \(Unspecified error\)/);
+  // Cameras (the broken one left out), the microphone, the endpoint and the display all recorded.
+  assert.deepStrictEqual(reports[0], ['mfce_video', 'mfce_video', 'mfce_video', 'mfce_audio', 'wasapi', 'dxgi']);
+  assert.strictEqual(require('fs').readdirSync(folder).length, 5);
+});
+
 test('setCallback without a function ends the process', async () => {
   const { code, signal, stderr } = await runAddon('addon.setCallback(42); report("survived");');
   assert.ok(code !== 0 || signal, 'the process must not go on');
@@ -89,6 +114,38 @@ test('with a desktop', async (t) => {
       for (let i = 0; i < sources; i++) addon.stopCapture(i);`, { env });
     assert.strictEqual(code, 0);
     assert.deepStrictEqual(reports[0].uids, [0, 0, 0]);
+  });
+
+  await t.test('previews too large to address are refused with a warning and the host lives on', async () => {
+    const { reports, stdout, code, signal } = await runAddon(`
+      addon.initialize();
+      const uid = events.find((e) => e.source.type === 'dxgi').source.id;
+      for (let i = 0; i < 200 && !addon.getPreview(uid, 4, 4); i++) await sleep(10);
+      report([addon.getPreview(uid, 23171, 23171), addon.getPreview(uid, 100000, 100000),
+              addon.getPreview(uid, 65536, 8192), addon.getPreview(uid, 64, 32).length]);`, { env });
+    assert.strictEqual(signal, null);
+    assert.strictEqual(code, 0, stdout);
+    // JSON turns undefined into null.
+    assert.deepStrictEqual(reports[0], [null, null, null, 64 * 32 * 4]);
+    const refused = (w, h) => `native/interface(175): 0x80070057: getPreview: a preview of ${w}x${h} pixels is ` +
+      'larger than 2147483647 bytes. (The parameter is incorrect.)';
+    const lines = stdout.split('\n').filter((l) => l.startsWith('\t')).map((l) => l.slice(1));
+    assert.deepStrictEqual(lines, [refused(23171, 23171), refused(100000, 100000), refused(65536, 8192)]);
+  });
+
+  await t.test('initialize without a callback warns and finds nothing; after setCallback it works', async () => {
+    const { reports, stdout, code, signal } = await runAddon(`
+      addon.initialize();
+      const seen = [];
+      addon.setCallback((event) => seen.push(event));
+      addon.initialize();
+      report(seen.map((e) => e.source.id));`, { env, callback: false });
+    assert.strictEqual(signal, null);
+    assert.strictEqual(code, 0, stdout);
+    // The second call's uids start at 0: the first one added no sources.
+    assert.ok(reports[0].length >= 2, JSON.stringify(reports[0]));
+    assert.deepStrictEqual(reports[0], reports[0].map((_, i) => i));
+    assert.match(stdout, /^\d{13}: Warning: .*\n\tnative\/interface\(52\): 0x80004003: initialize: no event callback; call setCallback first\. \(Invalid pointer\)$/);
   });
 
   await t.test('transfer answers 1 for the null window and an existing one, 0 for one that does not exist', async () => {

@@ -14,13 +14,23 @@
 namespace {
 
 const uint32_t colours[4] = {0xFF0000, 0x00FF00, 0x0000FF, 0xFFFFFF};
+uint32_t pixels[4];
+
+// The pixel value of a full-intensity 0xRRGGBB colour on a true-colour visual of any depth.
+uint32_t pixelOf(uint32_t rgb, const xcb_visualtype_t& visual) {
+  uint32_t pixel = 0;
+  if (rgb & 0xFF0000) pixel |= visual.red_mask;
+  if (rgb & 0x00FF00) pixel |= visual.green_mask;
+  if (rgb & 0x0000FF) pixel |= visual.blue_mask;
+  return pixel;
+}
 
 // Paints into a pixmap and copies it in one request, so a screen grab never sees half a step.
 void draw(xcb_connection_t* c, xcb_window_t window, xcb_pixmap_t pixmap, xcb_gcontext_t gc, uint16_t width,
           uint16_t height, int shift) {
   uint16_t block = width / 4;
   for (int i = 0; i < 4; ++i) {
-    uint32_t colour = colours[(i + 4 - shift % 4) % 4];
+    uint32_t colour = pixels[(i + 4 - shift % 4) % 4];
     xcb_change_gc(c, gc, XCB_GC_FOREGROUND, &colour);
     xcb_rectangle_t r{static_cast<int16_t>(i * block), 0, static_cast<uint16_t>(i == 3 ? width - 3 * block : block),
                       height};
@@ -49,6 +59,10 @@ int main(int argc, char** argv) {
     return 1;
   }
   xcb_screen_t* screen = xcb_setup_roots_iterator(xcb_get_setup(c)).data;
+  for (auto d = xcb_screen_allowed_depths_iterator(screen); d.rem; xcb_depth_next(&d))
+    for (auto v = xcb_depth_visuals_iterator(d.data); v.rem; xcb_visualtype_next(&v))
+      if (v.data->visual_id == screen->root_visual)
+        for (int i = 0; i < 4; ++i) pixels[i] = pixelOf(colours[i], *v.data);
   xcb_window_t window = xcb_generate_id(c);
   // Override-redirect: no window manager may move or decorate it.
   uint32_t values[] = {screen->black_pixel, 1, XCB_EVENT_MASK_EXPOSURE};

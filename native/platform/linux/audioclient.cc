@@ -270,7 +270,7 @@ class AudioClient : public ComObject<IAudioClient, IID_IAudioClient> {
       return E_INVALIDARG;
     pa_sample_spec sampleSpec;
     pa_channel_map map;
-    if (!pulse::specOf(format, sampleSpec, map) || sampleSpec.rate != sink_.sampleSpec.rate || sampleSpec.channels != sink_.sampleSpec.channels)
+    if (!pulse::specOf(format, sampleSpec, map, &sink_.map) || sampleSpec.rate != sink_.sampleSpec.rate || sampleSpec.channels != sink_.sampleSpec.channels)
       return AUDCLNT_E_UNSUPPORTED_FORMAT;
 
     Stream& s = *s_;
@@ -351,7 +351,7 @@ class AudioClient : public ComObject<IAudioClient, IID_IAudioClient> {
     if (shareMode != AUDCLNT_SHAREMODE_SHARED) return AUDCLNT_E_UNSUPPORTED_FORMAT;
     pa_sample_spec sampleSpec;
     pa_channel_map map;
-    if (!pulse::specOf(format, sampleSpec, map)) return AUDCLNT_E_UNSUPPORTED_FORMAT;
+    if (!pulse::specOf(format, sampleSpec, map, &sink_.map)) return AUDCLNT_E_UNSUPPORTED_FORMAT;
     if (sampleSpec.rate == sink_.sampleSpec.rate && sampleSpec.channels == sink_.sampleSpec.channels) return S_OK;
     *closestMatch = pulse::mixFormat(sink_.sampleSpec, sink_.map);
     return S_FALSE;

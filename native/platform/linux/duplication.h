@@ -47,6 +47,7 @@ class Duplication : public platform::ComObject<IDXGIOutputDuplication, IID_IDXGI
   void detach();
   bool makePicture();
   bool fetch(d3d11::TextureMemory& memory, int32_t top, int32_t rows);
+  void convert(const uint8_t* from, size_t fromStride, uint8_t* to, int32_t rows) const;
 
   x11::Connection connection_;
   int screen_;
@@ -69,6 +70,19 @@ class Duplication : public platform::ComObject<IDXGIOutputDuplication, IID_IDXGI
   std::vector<uint8_t> cursor_;
   uint32_t cursorWidth_ = 0, cursorHeight_ = 0;
   int32_t hotX_ = 0, hotY_ = 0;
+
+  // The root's pixels as GetImage gives them: bytes a pixel, bytes a row of `width` pixels, the
+  // colour masks. B, G, R, X words need only their alpha set; other layouts are converted.
+  struct Pixels {
+    uint32_t bytes = 4;
+    uint32_t red = 0xFF0000, green = 0xFF00, blue = 0xFF;
+    uint32_t pad = 32;
+    size_t stride(uint32_t width) const { return (static_cast<size_t>(width) * bytes * 8 + pad - 1) / pad * (pad / 8); }
+    bool words() const { return bytes == 4 && red == 0xFF0000 && green == 0xFF00 && blue == 0xFF; }
+    std::vector<uint32_t> words16;      // 2-byte pixels: the word of every value
+    std::vector<uint8_t> levels[3];     // 4-byte pixels: the level of every blue, green, red value
+  } pixels_;
+  bool convertible_ = false;
 
   bool shm_ = false;
   uint32_t segment_ = 0;

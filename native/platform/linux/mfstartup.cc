@@ -1,10 +1,11 @@
-// MFStartup and MFShutdown on Linux. The platform needs no start-up work here, but it keeps the
+// MFStartup and MFShutdown on Linux. The only start-up work is routing FFmpeg's log; it keeps the
 // count Media Foundation keeps, so unpaired calls show up as they would on Windows: MFShutdown
 // without a start-up still outstanding fails with MF_E_PLATFORM_NOT_INITIALIZED (the code
 // Windows gives for work on a platform that is not started) and leaves the count at zero, and
 // the sink writer refuses to be created while the count is zero.
 #include <atomic>
 
+#include "platform/linux/avlog.h"
 #include "platform/linux/mf.h"
 #include "platform/linux/mfstartup.h"
 
@@ -18,6 +19,8 @@ HRESULT MFStartup(ULONG version, DWORD) {
   // Both SDK generations (1 and 2) of API version 0x70 are accepted, as by Windows.
   const ULONG sdk = version >> 16;
   if ((version & 0xFFFF) != MF_API_VERSION || (sdk != 1 && sdk != MF_SDK_VERSION)) return MF_E_BAD_STARTUP_VERSION;
+  // Every user of FFmpeg here starts the platform first, so its log is routed before it logs.
+  platform::ffmpeg::routeLog();
   ++startups;
   return S_OK;
 }

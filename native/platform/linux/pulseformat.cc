@@ -41,8 +41,17 @@ DWORD bitOf(pa_channel_position_t position) {
   return 0;
 }
 
-// The channel map of a mask; false when the mask does not name exactly `channels` speakers.
-bool mapOf(DWORD mask, uint8_t channels, pa_channel_map& map) {
+bool named(const pa_channel_map& map, pa_channel_position_t position) {
+  for (unsigned i = 0; i < map.channels; ++i)
+    if (map.map[i] == position) return true;
+  return false;
+}
+
+// The channel map of a mask: the speakers it names in bit order, then, as in an extensible wave
+// format, the channels no bit names. Those take the device's positions the mask leaves out, in
+// the device's order (its aux channels, for a pro-audio sink), then AUX0, AUX1, ... that are
+// still free. False when the mask names more speakers than there are channels.
+bool mapOf(DWORD mask, uint8_t channels, const pa_channel_map* device, pa_channel_map& map) {
   pa_channel_map_init(&map);
   uint8_t count = 0;
   for (const Speaker& speaker : speakers) {
@@ -50,10 +59,20 @@ bool mapOf(DWORD mask, uint8_t channels, pa_channel_map& map) {
     if (count == channels) return false;
     map.map[count++] = speaker.position;
   }
-  if (count != channels) return false;
-  if (channels == 1) map.map[0] = PA_CHANNEL_POSITION_MONO;
-  map.channels = channels;
-  return true;
+  if (count == 1 && channels == 1) map.map[0] = PA_CHANNEL_POSITION_MONO;
+  map.channels = count;
+  for (unsigned i = 0; device && i < device->channels && count < channels; ++i) {
+    const pa_channel_position_t position = device->map[i];
+    if (position == PA_CHANNEL_POSITION_MONO ? mask & SPEAKER_FRONT_CENTER : named(map, position)) continue;
+    map.map[count++] = position;
+    map.channels = count;
+  }
+  for (int aux = PA_CHANNEL_POSITION_AUX0; aux <= PA_CHANNEL_POSITION_AUX31 && count < channels; ++aux) {
+    if (named(map, static_cast<pa_channel_position_t>(aux))) continue;
+    map.map[count++] = static_cast<pa_channel_position_t>(aux);
+    map.channels = count;
+  }
+  return count == channels;
 }
 
 }  // namespace
@@ -80,7 +99,7 @@ WAVEFORMATEX* mixFormat(const pa_sample_spec& sampleSpec, const pa_channel_map& 
   return &format->Format;
 }
 
-bool specOf(const WAVEFORMATEX* format, pa_sample_spec& sampleSpec, pa_channel_map& map) {
+bool specOf(const WAVEFORMATEX* format, pa_sample_spec& sampleSpec, pa_channel_map& map, const pa_channel_map* device) {
   if (!format || format->nChannels == 0 || format->nChannels > PA_CHANNELS_MAX) return false;
   bool isFloat = false;
   const bool extensible = format->wFormatTag == WAVE_FORMAT_EXTENSIBLE &&
@@ -105,8 +124,10 @@ bool specOf(const WAVEFORMATEX* format, pa_sample_spec& sampleSpec, pa_channel_m
   sampleSpec.rate = format->nSamplesPerSec;
   sampleSpec.channels = static_cast<uint8_t>(format->nChannels);
   if (!pa_sample_spec_valid(&sampleSpec)) return false;
-  if (extensible && wide->dwChannelMask != 0) {
-    if (!mapOf(wide->dwChannelMask, sampleSpec.channels, map)) return false;
+  // An extensible format names its speakers by mask, and a mask of 0 names none (the form of an
+  // endpoint whose channels have no speaker positions); a plain one has the usual layout.
+  if (extensible) {
+    if (!mapOf(wide->dwChannelMask, sampleSpec.channels, device, map)) return false;
   } else if (!pa_channel_map_init_auto(&map, sampleSpec.channels, PA_CHANNEL_MAP_WAVEEX)) {
     return false;
   }
