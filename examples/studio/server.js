@@ -96,14 +96,7 @@ function startEngine(env) {
     env: { ...process.env, ...env },
     stdio: ['ignore', 'pipe', 'inherit', 'pipe', 'ipc'],
   });
-  // The add-on writes its warning lines straight to its standard output.
-  readline.createInterface({ input: engine.stdout }).on('line', (line) => {
-    console.log(line);
-    if (!WARNING.test(line)) return;
-    state.warnings.push(line);
-    if (state.warnings.length > KEPT_WARNINGS) state.warnings.shift();
-    broadcast({ type: 'warning', line });
-  });
+  readWarnings(engine.stdout);
   readFrames(engine.stdio[3]);
   engine.on('message', (message) => {
     if (message.type === 'event' && message.event.type === 'new source') {
@@ -116,6 +109,33 @@ function startEngine(env) {
     }
   });
   return engine;
+}
+
+// The add-on writes its warning lines straight to its standard output. A failure's text from
+// checkResult goes on over lines that start with a tab; they belong to the warning above them.
+function readWarnings(stream) {
+  let warning = null;
+  let timer = null;
+  const finish = () => {
+    clearTimeout(timer);
+    if (warning === null) return;
+    state.warnings.push(warning);
+    if (state.warnings.length > KEPT_WARNINGS) state.warnings.shift();
+    broadcast({ type: 'warning', line: warning });
+    warning = null;
+  };
+  readline.createInterface({ input: stream }).on('line', (line) => {
+    console.log(line);
+    if (warning !== null && line.startsWith('\t')) {
+      warning += `\n${line}`;
+    } else {
+      finish();
+      if (WARNING.test(line)) warning = line;
+    }
+    // A warning is written in one piece: its lines arrive together.
+    clearTimeout(timer);
+    if (warning !== null) timer = setTimeout(finish, 20);
+  });
 }
 
 // Frames arrive as [u32 length][length bytes]; the bytes after the length are the WebSocket
