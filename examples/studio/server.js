@@ -139,7 +139,7 @@ function readWarnings(stream) {
 }
 
 // Frames arrive as [u32 length][length bytes]; the bytes after the length are the WebSocket
-// message. A page whose socket is still busy with earlier pictures skips this one.
+// message. A page whose socket still holds several earlier pictures skips this one.
 function readFrames(stream) {
   let chunks = [];
   let have = 0;
@@ -163,7 +163,7 @@ function readFrames(stream) {
       need = -1;
       const uid = frame.readUInt32LE(0);
       for (const ws of clients) {
-        if (ws.previews.has(uid) && ws.bufferedAmount < 2 * frame.length) ws.send(frame, { binary: true });
+        if (ws.previews.has(uid) && ws.bufferedAmount < 6 * frame.length) ws.send(frame, { binary: true });
       }
     }
   });

@@ -46,7 +46,11 @@ test('the package from its tarball', { timeout: 15 * 60 * 1000 }, async (t) => {
     const installed = path.join(host, 'node_modules', 'tavio_capture');
     assert.ok(fs.existsSync(path.join(installed, 'build', 'Release', 'tavio_capture.node')), 'the install built the add-on');
 
-    const desktop = await startDesktop({ width: 640, height: 480 });
+    const desktop = await startDesktop({
+      width: 640, height: 480,
+      sinks: [{ name: 'tavio_speakers', description: 'Tavio Speakers', default: true }],
+      microphone: { name: 'tavio_mic', description: 'Tavio Microphone', frequency: 440 },
+    });
     try {
       const script = `
         const capture = require('tavio_capture');

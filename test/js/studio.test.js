@@ -46,7 +46,11 @@ async function until(page, fn, arg, what, timeoutMs = 15000) {
 const near = (pixel, colour) => colour.every((c, i) => Math.abs(pixel[i] - c) <= LEVELS) && pixel[3] === 255;
 
 test('the studio page in Chromium', async (t) => {
-  const desktop = await startDesktop({ width: 1280, height: 720 });
+  const desktop = await startDesktop({
+    width: 1280, height: 720,
+    sinks: [{ name: 'tavio_speakers', description: 'Tavio Speakers', default: true }],
+    microphone: { name: 'tavio_mic', description: 'Tavio Microphone', frequency: 440 },
+  });
   t.after(() => desktop.stop());
   const folder = fs.mkdtempSync(path.join(os.tmpdir(), 'tavio-studio-'));
   t.after(() => fs.rmSync(folder, { recursive: true, force: true }));

@@ -55,7 +55,8 @@
       card.canvas.width = source.width;
       card.canvas.height = source.height;
       card.canvas.style.aspectRatio = `${source.width} / ${source.height}`;
-      card.context = card.canvas.getContext('2d');
+      // Every picture is replaced whole from memory: a canvas kept in memory takes it as a copy.
+      card.context = card.canvas.getContext('2d', { willReadFrequently: true });
       card.fps = element('div', 'fps', `${source.width}×${source.height}`);
       card.element.append(card.canvas, card.fps);
       studio.drawn[source.id] = 0;
