@@ -89,6 +89,8 @@ process.on('message', (message) => {
 });
 // The server is gone: nothing is left to serve.
 process.on('disconnect', () => process.exit(0));
+// Ctrl+C reaches the whole process group; the server ends this process once it has stopped serving.
+process.on('SIGINT', () => {});
 
 addon.setCallback((event) => {
   if (event.type === 'new source') sources.set(event.source.id, event.source);
