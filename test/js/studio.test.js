@@ -64,6 +64,7 @@ test('the studio page in Chromium', async (t) => {
   const browser = await puppeteer.launch({
     executablePath: '/usr/bin/chromium',
     headless: true,
+    networkEnabled: false,  // puppeteer's network events would copy every picture to this process
     // Root has no sandbox; the page's own playback must not reach the sink whose meter is read.
     args: ['--no-sandbox', '--mute-audio', '--autoplay-policy=no-user-gesture-required'],
   });
