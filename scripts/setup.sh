@@ -11,6 +11,7 @@ packages=(
   libpulse-dev libdbus-1-dev
   xvfb x11-xserver-utils xdotool pulseaudio pulseaudio-utils ffmpeg sox
   g++-mingw-w64-x86-64-posix mingw-w64-x86-64-dev
+  chromium
 )
 # A machine without Node gets Debian's, with its headers and node-gyp.
 command -v node >/dev/null 2>&1 || packages+=(nodejs npm node-gyp libnode-dev)

@@ -8,6 +8,7 @@ jobs=$(nproc)
 
 bash scripts/setup.sh
 [ -f node_modules/nan/nan.h ] || npm install --ignore-scripts --no-audit --no-fund
+[ -d node_modules/puppeteer-core ] || npm install --ignore-scripts --no-audit --no-fund  # the browser test's driver
 node scripts/gyp.js rebuild -j "$jobs" > build-gyp.log 2>&1 || { tail -50 build-gyp.log; exit 1; }
 
 unit() {  # unit <folder> <cmake options...>
