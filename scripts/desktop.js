@@ -96,7 +96,7 @@ async function startDesktop(options = {}) {
     stopAll(xvfb, dir);
     throw e;
   }
-  return { env, dir, stop: () => stopAll(xvfb, dir), stopAfterExit: () => stopAfterExit(xvfb, dir) };
+  return { env, dir, xvfbPid: xvfb && xvfb.process.pid, stop: () => stopAll(xvfb, dir), stopAfterExit: () => stopAfterExit(xvfb, dir) };
 }
 
 function stopAll(xvfb, dir) {

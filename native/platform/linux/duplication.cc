@@ -107,11 +107,20 @@ bool overlaps(const xcb_rectangle_t& a, const x11::Monitor& m) {
 
 }  // namespace
 
-HRESULT Duplication::open(const std::string& display, int screen, xcb_atom_t name, IDXGIOutputDuplication** result) {
+HRESULT Duplication::open(const std::string& display, int screen, xcb_atom_t name, const std::string& nameText,
+                          IDXGIOutputDuplication** result) {
   if (!result) return E_INVALIDARG;
   *result = nullptr;
   x11::Connection connection = x11::connect(display);
   if (!connection) return DXGI_ERROR_SESSION_DISCONNECTED;
+  if (!nameText.empty()) {
+    xcb_intern_atom_cookie_t cookie =
+        xcb_intern_atom(connection.get(), 1, static_cast<uint16_t>(nameText.size()), nameText.c_str());
+    if (xcb_intern_atom_reply_t* reply = xcb_intern_atom_reply(connection.get(), cookie, nullptr)) {
+      if (reply->atom != XCB_ATOM_NONE) name = reply->atom;
+      free(reply);
+    }
+  }
   auto* duplication = new Duplication(std::move(connection), screen, name);
   if (!duplication->setUp()) {
     duplication->Release();

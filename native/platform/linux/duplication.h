@@ -22,7 +22,9 @@ namespace platform::dxgi {
 class Duplication : public platform::ComObject<IDXGIOutputDuplication, IID_IDXGIObject, IID_IDXGIOutputDuplication> {
  public:
   // Opens a duplication of monitor `name` of `screen` on display `display`.
-  static HRESULT open(const std::string& display, int screen, xcb_atom_t name, IDXGIOutputDuplication** result);
+  // `nameText` finds the monitor again on a display server that was restarted, where atoms differ.
+  static HRESULT open(const std::string& display, int screen, xcb_atom_t name, const std::string& nameText,
+                      IDXGIOutputDuplication** result);
 
   void GetDesc(DXGI_OUTDUPL_DESC* desc) override;
   HRESULT AcquireNextFrame(UINT timeoutMilliseconds, DXGI_OUTDUPL_FRAME_INFO* frameInfo,

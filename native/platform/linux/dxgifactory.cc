@@ -1,6 +1,8 @@
 // DXGI factory, adapters and outputs: an adapter is an X screen of $DISPLAY, an output one of
 // its RandR monitors, in the server's order.
 #include <algorithm>
+#include <cstdlib>
+#include <string>
 #include <vector>
 
 #include "platform/linux/display.h"
@@ -13,8 +15,8 @@ namespace {
 
 class Output : public platform::ComObject<IDXGIOutput1, IID_IDXGIObject, IID_IDXGIOutput, IID_IDXGIOutput1> {
  public:
-  Output(std::string display, int screen, const DXGI_OUTPUT_DESC& desc, xcb_atom_t name)
-      : display_(std::move(display)), screen_(screen), desc_(desc), name_(name) {}
+  Output(std::string display, int screen, const DXGI_OUTPUT_DESC& desc, xcb_atom_t name, std::string nameText)
+      : display_(std::move(display)), screen_(screen), desc_(desc), name_(name), nameText_(std::move(nameText)) {}
 
   HRESULT GetDesc(DXGI_OUTPUT_DESC* desc) override {
     if (!desc) return E_INVALIDARG;
@@ -27,7 +29,7 @@ class Output : public platform::ComObject<IDXGIOutput1, IID_IDXGIObject, IID_IDX
     ID3D11Device* d3d = nullptr;
     if (FAILED(device->QueryInterface(IID_ID3D11Device, reinterpret_cast<void**>(&d3d)))) return E_INVALIDARG;
     d3d->Release();
-    return Duplication::open(display_, screen_, name_, duplication);
+    return Duplication::open(display_, screen_, name_, nameText_, duplication);
   }
 
  private:
@@ -35,7 +37,17 @@ class Output : public platform::ComObject<IDXGIOutput1, IID_IDXGIObject, IID_IDX
   int screen_;
   DXGI_OUTPUT_DESC desc_;
   xcb_atom_t name_;
+  std::string nameText_;
 };
+
+std::string atomName(xcb_connection_t* connection, xcb_atom_t atom) {
+  std::string text;
+  if (xcb_get_atom_name_reply_t* reply = xcb_get_atom_name_reply(connection, xcb_get_atom_name(connection, atom), nullptr)) {
+    text.assign(xcb_get_atom_name_name(reply), static_cast<size_t>(xcb_get_atom_name_name_length(reply)));
+    free(reply);
+  }
+  return text;
+}
 
 class Adapter : public platform::ComObject<IDXGIAdapter1, IID_IDXGIObject, IID_IDXGIAdapter, IID_IDXGIAdapter1> {
  public:
@@ -55,7 +67,7 @@ class Adapter : public platform::ComObject<IDXGIAdapter1, IID_IDXGIObject, IID_I
     desc.AttachedToDesktop = TRUE;
     desc.Rotation = DXGI_MODE_ROTATION_IDENTITY;
     desc.Monitor = x11::monitorHandle(screen_, m.name);
-    *output = new Output(display_, screen_, desc, m.name);
+    *output = new Output(display_, screen_, desc, m.name, atomName(connection_.get(), m.name));
     return S_OK;
   }
 

@@ -3,6 +3,7 @@
 #include "platform/linux/wasapi.h"
 
 #include <memory>
+#include <mutex>
 #include <string>
 #include <vector>
 
@@ -58,7 +59,7 @@ class Device : public ComObject<IMMDevice, IID_IMMDevice> {
     if (!object) return E_POINTER;
     *object = nullptr;
     if (!(iid == IID_IAudioClient)) return E_NOINTERFACE;
-    return createAudioClient(connection_, name_, iid, object);
+    return createAudioClient(liveConnection(), name_, iid, object);
   }
   HRESULT OpenPropertyStore(DWORD, IPropertyStore** properties) override {
     if (!properties) return E_POINTER;
@@ -73,11 +74,24 @@ class Device : public ComObject<IMMDevice, IID_IMMDevice> {
   HRESULT GetState(DWORD* state) override {
     if (!state) return E_POINTER;
     Sink sink;
-    *state = connection_->findSink(name_, sink) ? DEVICE_STATE_ACTIVE : DEVICE_STATE_NOTPRESENT;
+    *state = liveConnection()->findSink(name_, sink) ? DEVICE_STATE_ACTIVE : DEVICE_STATE_NOTPRESENT;
     return S_OK;
   }
 
  private:
+  // A sound server that went away and came back is a new server: the endpoint connects to it
+  // anew, as a Windows endpoint works again once its audio service runs again. Clients made
+  // earlier keep the connection they were made on.
+  std::shared_ptr<Connection> liveConnection() {
+    std::lock_guard<std::mutex> lock(mutex_);
+    if (!connection_->ready()) {
+      auto fresh = std::make_shared<Connection>();
+      if (fresh->connected()) connection_ = std::move(fresh);
+    }
+    return connection_;
+  }
+
+  std::mutex mutex_;  // the capture and silence threads activate clients at the same time
   std::shared_ptr<Connection> connection_;
   std::string name_;
   std::string description_;

@@ -20,7 +20,9 @@ const char* const file = "native/capture/video/encoder/mftencoder";
 
 constexpr UINT32 bitRate = 10485760;
 constexpr LONGLONG sampleDuration = 166666;  // 1/60 s, while the stream declares 30 fps: both kept on purpose
-constexpr LONGLONG frameInterval = 333333;   // the declared rate, at which a still picture repeats
+// A still picture repeats ten times a second: no gap in the file is longer, and a screen that
+// stays still (or a display server that went away) costs little to keep recording.
+constexpr LONGLONG frameInterval = 1000000;
 constexpr LONGLONG ticksPerMillisecond = 10000;
 // A lone new picture is written once it has stayed for a frame interval; while pictures keep
 // coming, each one is taken out of the queue when the next arrives, without a copy.

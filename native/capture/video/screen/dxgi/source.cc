@@ -6,6 +6,7 @@
 
 #include "capture/check.h"
 #include "capture/clock.h"
+#include "capture/log.h"
 #include "capture/text.h"
 #include "capture/video/copy.h"
 #include "capture/video/scale.h"
@@ -75,12 +76,15 @@ void Source::capture() {
   HRESULT hr = duplication->AcquireNextFrame(acquireTimeout, &frameInfo, &acquired);
   if (hr == DXGI_ERROR_ACCESS_LOST) {
     release(duplication);
+    bool reported = false;
     while (!duplication) {
       try {
         duplication = duplicateOutput(output, device);
-      } catch (...) {
-        // Access comes back after the mode change or desktop switch is over; until then the
-        // pump waits here without spinning.
+      } catch (const std::exception& e) {
+        // Access comes back after the mode change or desktop switch is over, or once the display
+        // server runs again; until then the pump waits here without spinning. Said once.
+        if (!reported) capture::logWarning(e.what());
+        reported = true;
         std::this_thread::sleep_for(std::chrono::milliseconds(100));
       }
     }

@@ -1,0 +1,254 @@
+'use strict';
+// Faults while every kind of source records: the sound server killed and restarted, the sink
+// unloaded and loaded again, the X server killed and started again on its display number, the
+// disk full and then freed. For each: the clips in progress are valid files that cover the time
+// before the fault, a warning says what happened, no thread spins while the device is gone, and
+// after recovery a new clip of every source works.
+const { test } = require('node:test');
+const assert = require('node:assert');
+const { spawn, spawnSync, execFileSync } = require('child_process');
+const fs = require('fs');
+const os = require('os');
+const path = require('path');
+const readline = require('readline');
+const { startDesktop, playTone } = require('../../scripts/desktop');
+const { root } = require('./addon');
+
+const sleep = (ms) => new Promise((resolve) => setTimeout(resolve, ms));
+const CAMERAS = 'Fault Camera=testsrc2=size=320x240:rate=30';
+
+// The host: a Node process with the add-on that takes commands on standard input
+// ("start <folder> <prefix>", "stop", "peaks") and answers each with one JSON line.
+const HOST = `
+const addon = require(${JSON.stringify(root)});
+const path = require('path');
+const sources = [];
+addon.setCallback((e) => { if (e.type === 'new source') sources.push(e.source); });
+addon.initialize();
+const say = (value) => process.stdout.write('@@' + JSON.stringify(value) + '\\n');
+say({ sources });
+require('readline').createInterface({ input: process.stdin }).on('line', (line) => {
+  const [command, folder, prefix] = line.split(' ');
+  if (command === 'start') {
+    const files = {};
+    for (const s of sources) {
+      files[s.type] = path.join(folder, prefix + '-' + s.type + '.mp4');
+      addon.startCapture(s.id, files[s.type]);
+    }
+    say({ started: Date.now(), files });
+  } else if (command === 'stop') {
+    for (const s of sources) addon.stopCapture(s.id);
+    say({ stopped: Date.now() });
+  } else if (command === 'peaks') {
+    say({ peaks: addon.getPreview(sources.find((s) => s.type === 'wasapi').id) });
+  }
+});
+`;
+
+function startHost(env) {
+  const child = spawn(process.execPath, ['-e', HOST], { env: { ...process.env, ...env, TAVIO_TEST_CAMERAS: CAMERAS },
+    stdio: ['pipe', 'pipe', 'pipe'] });
+  const answers = [];
+  const waiting = [];
+  let output = '';
+  readline.createInterface({ input: child.stdout }).on('line', (line) => {
+    if (!line.startsWith('@@')) {
+      output += line + '\n';
+      return;
+    }
+    const value = JSON.parse(line.slice(2));
+    if (waiting.length) waiting.shift()(value);
+    else answers.push(value);
+  });
+  child.stderr.on('data', (d) => { output += d; });
+  const next = () => (answers.length ? Promise.resolve(answers.shift()) : new Promise((resolve) => waiting.push(resolve)));
+  return {
+    child,
+    output: () => output,
+    next,
+    ask: (command) => { child.stdin.write(command + '\n'); return next(); },
+  };
+}
+
+// CPU per thread of a process over `ms`, in shares of one core.
+async function threadLoads(pid, ms) {
+  const read = () => {
+    const ticks = new Map();
+    for (const task of fs.readdirSync(`/proc/${pid}/task`)) {
+      try {
+        const stat = fs.readFileSync(`/proc/${pid}/task/${task}/stat`, 'utf8');
+        const fields = stat.slice(stat.lastIndexOf(')') + 2).split(' ');
+        ticks.set(task, { name: stat.slice(stat.indexOf('(') + 1, stat.lastIndexOf(')')), ticks: Number(fields[11]) + Number(fields[12]) });
+      } catch (_) { /* ended */ }
+    }
+    return ticks;
+  };
+  const before = read();
+  await sleep(ms);
+  const after = read();
+  const hz = Number(execFileSync('getconf', ['CLK_TCK'], { encoding: 'utf8' }));
+  return [...after].map(([task, { name, ticks }]) => ({ name, load: (ticks - (before.get(task)?.ticks ?? ticks)) / hz / (ms / 1000) }));
+}
+
+function probe(file) {
+  const r = spawnSync('ffprobe', ['-v', 'error', '-show_entries', 'format=duration', '-of', 'csv=p=0', file], { encoding: 'utf8' });
+  return r.status === 0 && r.stdout.trim() ? Number(r.stdout.trim()) : NaN;
+}
+function decodeErrors(file) {
+  return spawnSync('ffmpeg', ['-v', 'error', '-i', file, '-f', 'null', '-'], { encoding: 'utf8' }).stderr.trim();
+}
+
+function pulseArguments(dir) {
+  return ['--daemonize=yes', '--exit-idle-time=-1', '--system=false', '-n', '-F', path.join(dir, 'conf.pa'),
+    '--use-pid-file=yes', '--log-target=stderr'];
+}
+function pulseEnv(dir) { return { ...process.env, HOME: dir, XDG_RUNTIME_DIR: dir }; }
+function pulsePid(dir) { return Number(fs.readFileSync(path.join(dir, 'pulse', 'pid'), 'utf8')); }
+async function restartPulse(dir, env) {
+  spawnSync('pulseaudio', pulseArguments(dir), { env: pulseEnv(dir) });
+  for (let i = 0; i < 100; i++) {
+    if (spawnSync('pactl', ['info'], { env: { ...process.env, ...env } }).status === 0) return;
+    await sleep(20);
+  }
+  throw new Error('pulseaudio did not come back');
+}
+
+// One fault case: record everything, break something two seconds in, check, repair, record again.
+async function faultCase({ folder, broken, fault, repair, options = {} }) {
+  const desktop = await startDesktop(options);
+  const env = desktop.env;
+  const helpers = [playTone(env)];
+  const host = startHost(env);
+  try {
+    const { sources } = await host.next();
+    assert.deepStrictEqual(sources.map((s) => s.type).sort(), ['dxgi', 'mfce_audio', 'mfce_video', 'wasapi']);
+    await sleep(1000);
+    const first = await host.ask(`start ${folder} before`);
+    await sleep(2000);
+    const faultAt = Date.now();
+    await fault({ env, dir: desktop.dir, helpers, desktop });
+    await sleep(1500);
+    const loads = await threadLoads(host.child.pid, 1000);
+    const busy = loads.filter((t) => t.load > 0.05 && !t.name.startsWith('node'));
+    const stop = await host.ask('stop');
+    await sleep(1500);
+    const warnedAfterFault = host.output();
+
+    for (const [type, file] of Object.entries(first.files)) {
+      assert.strictEqual(decodeErrors(file), '', `${type} clip in progress at the fault`);
+      const duration = probe(file);
+      // Everything up to the fault is kept (a broken source may lose its last second).
+      const expected = (faultAt - first.started) / 1000 - (broken.includes(type) ? 1 : 0);
+      assert.ok(duration >= expected, `${type}: ${duration} s, expected at least ${expected} s`);
+    }
+    assert.match(warnedAfterFault, /Warning: /, 'the fault is reported');
+    assert.deepStrictEqual(busy, [], 'no thread spins while the device is gone');
+
+    await repair({ env, dir: desktop.dir, helpers });
+    await sleep(3000);
+    const second = await host.ask(`start ${folder} after`);
+    await sleep(2000);
+    const { peaks } = await host.ask('peaks');
+    await host.ask('stop');
+    await sleep(1500);
+    for (const [type, file] of Object.entries(second.files)) {
+      assert.strictEqual(decodeErrors(file), '', `${type} clip after recovery`);
+      assert.ok(probe(file) >= 1.8, `${type} clip after recovery: ${probe(file)} s`);
+    }
+    assert.ok(peaks.left > 0.3, `the endpoint hears the tone again: ${JSON.stringify(peaks)}`);
+  } finally {
+    host.child.kill('SIGKILL');
+    helpers.forEach((h) => h.kill('SIGKILL'));
+    desktop.stop();
+  }
+}
+
+function folderFor(name) { return fs.mkdtempSync(path.join(os.tmpdir(), `tavio-fault-${name}-`)); }
+
+test('the sound server killed and started again', async () => {
+  const folder = folderFor('pulse');
+  try {
+    await faultCase({
+      folder,
+      broken: ['wasapi', 'mfce_audio'],
+      fault: ({ dir }) => process.kill(pulsePid(dir), 'SIGKILL'),
+      repair: async ({ env, dir, helpers }) => {
+        await restartPulse(dir, env);
+        helpers.push(playTone(env));
+      },
+    });
+  } finally {
+    fs.rmSync(folder, { recursive: true, force: true });
+  }
+});
+
+test('the sink unloaded and loaded again', async () => {
+  const folder = folderFor('sink');
+  const pactl = (env, ...args) => execFileSync('pactl', args, { env: { ...process.env, ...env }, encoding: 'utf8' });
+  try {
+    await faultCase({
+      folder,
+      broken: ['wasapi'],
+      fault: ({ env }) => {
+        const line = pactl(env, 'list', 'short', 'modules').split('\n').find((l) => l.includes('sink_name=tavio_speakers'));
+        pactl(env, 'unload-module', line.split('\t')[0]);
+      },
+      repair: async ({ env, helpers }) => {
+        pactl(env, 'load-module', 'module-null-sink', 'sink_name=tavio_speakers', 'rate=48000', 'channels=2',
+          "sink_properties=device.description='Tavio Speakers'");
+        pactl(env, 'set-default-sink', 'tavio_speakers');
+        helpers.push(playTone(env));
+      },
+    });
+  } finally {
+    fs.rmSync(folder, { recursive: true, force: true });
+  }
+});
+
+test('the X server killed and a new one started on its display number', async () => {
+  const folder = folderFor('x');
+  let xvfb = null;
+  try {
+    await faultCase({
+      folder,
+      broken: ['dxgi'],
+      fault: ({ desktop }) => process.kill(desktop.xvfbPid, 'SIGKILL'),
+      repair: async ({ env }) => {
+        xvfb = spawn('Xvfb', [env.DISPLAY, '-screen', '0', '1920x1080x24', '-noreset', '-nolisten', 'tcp'], { stdio: 'ignore' });
+        for (let i = 0; i < 100; i++) {
+          if (spawnSync('xdotool', ['getdisplaygeometry'], { env: { ...process.env, DISPLAY: env.DISPLAY } }).status === 0) return;
+          await sleep(50);
+        }
+        throw new Error('Xvfb did not start again');
+      },
+    });
+  } finally {
+    if (xvfb) xvfb.kill('SIGKILL');
+    fs.rmSync(folder, { recursive: true, force: true });
+  }
+});
+
+test('the disk full, then space freed', async (t) => {
+  const folder = folderFor('disk');
+  if (spawnSync('mount', ['-t', 'tmpfs', '-o', 'size=6m', 'tmpfs', folder]).status !== 0) {
+    t.skip('mounting a small tmpfs needs root');
+    return;
+  }
+  const filler = path.join(folder, 'filler');
+  try {
+    await faultCase({
+      folder,
+      broken: ['dxgi', 'wasapi', 'mfce_audio', 'mfce_video'],
+      fault: async () => {
+        // What is left fills up within a moment.
+        spawnSync('fallocate', ['-l', String(Math.max(0, fs.statfsSync(folder).bavail * fs.statfsSync(folder).bsize - 300000)), filler]);
+      },
+      repair: () => {
+        for (const name of fs.readdirSync(folder)) fs.rmSync(path.join(folder, name));
+      },
+    });
+  } finally {
+    spawnSync('umount', ['-l', folder]);
+    fs.rmSync(folder, { recursive: true, force: true });
+  }
+});
