@@ -24,6 +24,7 @@ constexpr LONGLONG sampleDuration = 166666;  // 1/60 s, while the stream declare
 // stays still (or a display server that went away) costs little to keep recording.
 constexpr LONGLONG frameInterval = 1000000;
 constexpr LONGLONG ticksPerMillisecond = 10000;
+constexpr LONGLONG slotsPerSecond = 30;  // the declared rate
 // A lone new picture is written once it has stayed for a frame interval; while pictures keep
 // coming, each one is taken out of the queue when the next arrives, without a copy.
 constexpr int64_t stillMilliseconds = 34;
@@ -74,7 +75,7 @@ void MFTEncoder::record() {
     } else if (repeat) {
       // Behind the clock (a busy machine), the repeats skip ahead instead of piling up.
       const LONGLONG now = (currentTimeMillis() - clip->start) * ticksPerMillisecond;
-      const LONGLONG time = std::max(lastTime + frameInterval, now - 2 * frameInterval);
+      const LONGLONG time = timeOfSlot(slotOf(std::max(lastTime + frameInterval, now - 2 * frameInterval)));
       ++frameCount;
       writeFrame(*last, time);
       lastTime = time;
@@ -135,21 +136,28 @@ void MFTEncoder::finish() {
     write(std::move(picture), time);
   }
   // It lasts until the stop: the last sample is placed so that it ends there.
-  const LONGLONG end = (stop - clip->start) * ticksPerMillisecond;
-  if (last && end - sampleDuration > lastTime) {
+  const LONGLONG held = timeOfSlot(slotOf((stop - clip->start) * ticksPerMillisecond) - 1);
+  if (last && held > lastTime) {
     ++frameCount;
-    writeFrame(*last, end - sampleDuration);
-    lastTime = end - sampleDuration;
+    writeFrame(*last, held);
+    lastTime = held;
   }
 }
 
+// Sample times lie on a grid of the declared rate: players and converters that
+// take the stream for constant-rate then never see two pictures in one frame's time. A picture
+// that falls into the slot of the one before replaces it in what is repeated, not in the file.
+LONGLONG MFTEncoder::slotOf(LONGLONG time) { return (time * slotsPerSecond + 5000000) / 10000000; }
+LONGLONG MFTEncoder::timeOfSlot(LONGLONG slot) { return slot * 10000000 / slotsPerSecond; }
+
 void MFTEncoder::write(std::unique_ptr<Frame> picture, LONGLONG time) {
-  // The clip opens with its first picture, wherever it came from; after that, sample times rise
-  // even for a picture captured within the same millisecond as the one before.
-  time = lastTime < 0 ? 0 : std::max(time, lastTime + ticksPerMillisecond);
-  ++frameCount;
-  writeFrame(*picture, time);
-  lastTime = time;
+  // The clip opens with its first picture, wherever it came from.
+  const LONGLONG slot = lastTime < 0 ? 0 : slotOf(time);
+  if (lastTime < 0 || slot > slotOf(lastTime)) {
+    ++frameCount;
+    writeFrame(*picture, timeOfSlot(slot));
+    lastTime = timeOfSlot(slot);
+  }
   lastTimestamp = picture->timestamp;
   last = std::move(picture);
 }
