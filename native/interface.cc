@@ -15,16 +15,14 @@
 #include <vector>
 
 #include "capture/audio/source.h"
-#include "capture/audio/wasapi/capturemethod.h"
 #include "capture/check.h"
 #include "capture/clock.h"
 #include "capture/log.h"
 #include "capture/threadname.h"
-#include "capture/video/camera/mfce/mfcecapturemethod.h"
-#include "capture/video/screen/dxgi/capturemethod.h"
 #include "capture/video/screen/dxgi/source.h"
 #include "capture/video/source.h"
 #include "descriptor.h"
+#include "discovery.h"
 #include "platform/com.h"
 #include "platform/user32.h"
 
@@ -33,7 +31,7 @@ namespace {
 constexpr const char* kFile = "native/interface";
 constexpr WPARAM kTransferCommand = 0x7F8F;
 
-using SourceList = std::vector<std::shared_ptr<capture::Source>>;
+using capture::SourceList;
 
 // Process-wide state. The list and the callback are never destroyed: detached threads use the
 // list until the process ends, and tearing down a V8 handle after V8 is gone would crash at exit.
@@ -83,10 +81,6 @@ v8::Local<v8::Object> newSourceEvent(int32_t uid, capture::Source& source) {
   return event;
 }
 
-void append(SourceList found) {
-  for (auto& source : found) sources.push_back(std::move(source));
-}
-
 // Keeps every display capturing; its pace is the displays' own acquisition time-out. With no
 // display, or after a failure (a display server gone), it pauses instead of spinning.
 void screenPump() {
@@ -122,45 +116,7 @@ NAN_METHOD(initialize) {
     return;
   }
   try {
-    const size_t firstNew = sources.size();
-    {
-      capture::video::camera::mfce::MFCECaptureMethod cameras;
-      append(cameras.sources());
-      for (auto& microphone : cameras.audioSources()) sources.push_back(microphone);
-    }
-
-    try {
-      capture::checkResult(kFile, 47, CoInitializeEx(nullptr, COINIT_APARTMENTTHREADED | COINIT_SPEED_OVER_MEMORY),
-                           "Failed to initialize the COM library.");
-    } catch (const std::runtime_error&) {
-      CoUninitialize();
-    }
-
-    append(capture::audio::wasapi::CaptureMethod().sources());
-
-    // Sources of an earlier initialize already run; starting them again from here would race
-    // the screen pump on displays, so only this call's sources are started.
-    for (size_t i = firstNew; i < sources.size(); ++i) {
-      std::shared_ptr<capture::Source> source = sources[i];
-      try {
-        source->capture();
-      } catch (const std::runtime_error& e) {
-        capture::logWarning(e.what());
-      }
-      try {
-        source->startPreview();
-      } catch (const std::runtime_error& e) {
-        capture::logWarning(e.what());
-      }
-    }
-
-    // A display the grab cannot handle costs the displays, not the cameras and endpoints found
-    // above: they are announced all the same.
-    try {
-      append(capture::video::screen::dxgi::CaptureMethod().sources());
-    } catch (const std::runtime_error& e) {
-      capture::logWarning(e.what());
-    }
+    capture::discoverSources(sources);
 
     std::thread(screenPump).detach();
 

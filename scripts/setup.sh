@@ -5,13 +5,14 @@ set -euo pipefail
 
 packages=(
   build-essential python3 pkg-config cmake git
-  libgtest-dev libgmock-dev
+  libgtest-dev libgmock-dev googletest
   libavformat-dev libavcodec-dev libavdevice-dev libavutil-dev libswscale-dev libswresample-dev
   libxcb1-dev libxcb-shm0-dev libxcb-damage0-dev libxcb-xfixes0-dev libxcb-randr0-dev libxcb-render0-dev
   libpulse-dev libdbus-1-dev
   xvfb x11-xserver-utils xdotool pulseaudio pulseaudio-utils ffmpeg sox
   g++-mingw-w64-x86-64-posix mingw-w64-x86-64-dev
   chromium
+  wine wine64
 )
 # A machine without Node gets Debian's, with its headers and node-gyp.
 command -v node >/dev/null 2>&1 || packages+=(nodejs npm node-gyp libnode-dev)

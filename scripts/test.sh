@@ -1,7 +1,8 @@
 #!/usr/bin/env bash
 # Every test: the add-on and the unit tests are built, the unit tests run plainly, under
-# AddressSanitizer + UndefinedBehaviorSanitizer and under ThreadSanitizer, then the JavaScript
-# integration tests (each starts its own Xvfb and PulseAudio) and the Windows compile check.
+# AddressSanitizer + UndefinedBehaviorSanitizer and under ThreadSanitizer, then the Windows checks
+# (every Windows source compiles; the capture code links for Windows and its unit tests and start-up
+# run under Wine), then the JavaScript integration tests (each starts its own Xvfb and PulseAudio).
 set -euo pipefail
 cd "$(dirname "$0")/.."
 jobs=$(nproc)
@@ -26,8 +27,10 @@ ASAN_OPTIONS=detect_leaks=1 unit build-asan -DSANITIZE=address,undefined
 echo "== unit tests, thread sanitizer"
 TSAN_OPTIONS=halt_on_error=1 unit build-tsan -DSANITIZE=thread
 
+echo "== windows: every source compiles"
+bash scripts/check-windows.sh
+echo "== windows: unit tests and start-up under Wine"
+bash scripts/wine-tests.sh
+
 echo "== integration tests"
 node --test --test-concurrency=1 test/js/
-
-echo "== windows"
-bash scripts/check-windows.sh

@@ -12,6 +12,7 @@
 #include <vector>
 
 #include "capture/audio/encoder.h"
+#include "fakes/com.h"
 #include "platform/wasapi.h"
 
 namespace fakes {
@@ -72,7 +73,7 @@ struct AudioLog {
   }
 };
 
-class CaptureClient : public platform::ComObject<IAudioCaptureClient, IID_IAudioCaptureClient> {
+class CaptureClient : public ComObject<IAudioCaptureClient, IID_IAudioCaptureClient> {
  public:
   explicit CaptureClient(std::shared_ptr<AudioLog> log) : log_(std::move(log)) {}
 
@@ -119,7 +120,7 @@ class CaptureClient : public platform::ComObject<IAudioCaptureClient, IID_IAudio
   bool pending_ = false;
 };
 
-class RenderClient : public platform::ComObject<IAudioRenderClient, IID_IAudioRenderClient> {
+class RenderClient : public ComObject<IAudioRenderClient, IID_IAudioRenderClient> {
  public:
   explicit RenderClient(std::shared_ptr<AudioLog> log) : log_(std::move(log)) {}
   HRESULT GetBuffer(UINT32 frames, BYTE** data) override {
@@ -141,7 +142,7 @@ class RenderClient : public platform::ComObject<IAudioRenderClient, IID_IAudioRe
   std::vector<uint8_t> bytes_;
 };
 
-class AudioClient : public platform::ComObject<IAudioClient, IID_IAudioClient> {
+class AudioClient : public ComObject<IAudioClient, IID_IAudioClient> {
  public:
   explicit AudioClient(std::shared_ptr<AudioLog> log) : log_(std::move(log)) {}
 
@@ -214,7 +215,7 @@ class AudioClient : public platform::ComObject<IAudioClient, IID_IAudioClient> {
   bool loopback_ = false;
 };
 
-class PropertyStore : public platform::ComObject<IPropertyStore, IID_IPropertyStore> {
+class PropertyStore : public ComObject<IPropertyStore, IID_IPropertyStore> {
  public:
   explicit PropertyStore(std::wstring name) : name_(std::move(name)) {}
   HRESULT GetCount(DWORD*) override { return E_NOTIMPL; }
@@ -223,7 +224,7 @@ class PropertyStore : public platform::ComObject<IPropertyStore, IID_IPropertySt
     PropVariantInit(value);
     if (!(key.fmtid == PKEY_Device_FriendlyName.fmtid) || key.pid != PKEY_Device_FriendlyName.pid) return E_FAIL;
     value->vt = VT_LPWSTR;
-    value->pwszVal = platform::taskString(name_);
+    value->pwszVal = taskString(name_);
     return S_OK;
   }
   HRESULT SetValue(REFPROPERTYKEY, REFPROPVARIANT) override { return E_NOTIMPL; }
@@ -233,7 +234,7 @@ class PropertyStore : public platform::ComObject<IPropertyStore, IID_IPropertySt
   std::wstring name_;
 };
 
-class Endpoint : public platform::ComObject<IMMDevice, IID_IMMDevice> {
+class Endpoint : public ComObject<IMMDevice, IID_IMMDevice> {
  public:
   Endpoint(std::shared_ptr<AudioLog> log, std::wstring name) : log_(std::move(log)), name_(std::move(name)) {}
   HRESULT Activate(REFIID iid, DWORD, PROPVARIANT*, void** object) override {
@@ -250,7 +251,7 @@ class Endpoint : public platform::ComObject<IMMDevice, IID_IMMDevice> {
     return S_OK;
   }
   HRESULT GetId(LPWSTR* id) override {
-    *id = platform::taskString(name_);
+    *id = taskString(name_);
     return S_OK;
   }
   HRESULT GetState(DWORD* state) override {

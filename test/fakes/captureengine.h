@@ -5,12 +5,12 @@
 #include <string>
 #include <vector>
 
-#include "platform/linux/com.h"
+#include "fakes/com.h"
 #include "platform/mfcapture.h"
 
 namespace fakes {
 
-class FakeCaptureSource : public platform::ComObject<IMFCaptureSource, IID_IMFCaptureSource> {
+class FakeCaptureSource : public ComObject<IMFCaptureSource, IID_IMFCaptureSource> {
  public:
   IMFMediaType* videoType = nullptr;  // borrowed; null: no such stream
   IMFMediaType* audioType = nullptr;
@@ -38,7 +38,7 @@ class FakeCaptureSource : public platform::ComObject<IMFCaptureSource, IID_IMFCa
 };
 
 // One object serves as the record sink and the preview sink.
-class FakeSink : public platform::ComObject<IMFCaptureRecordSink, IID_IMFCaptureSink, IID_IMFCaptureRecordSink> {
+class FakeSink : public ComObject<IMFCaptureRecordSink, IID_IMFCaptureSink, IID_IMFCaptureRecordSink> {
  public:
   ~FakeSink() override {
     for (IMFMediaType* type : added) type->Release();
@@ -76,7 +76,7 @@ class FakeSink : public platform::ComObject<IMFCaptureRecordSink, IID_IMFCapture
 };
 
 class FakePreviewSink
-    : public platform::ComObject<IMFCapturePreviewSink, IID_IMFCaptureSink, IID_IMFCapturePreviewSink> {
+    : public ComObject<IMFCapturePreviewSink, IID_IMFCaptureSink, IID_IMFCapturePreviewSink> {
  public:
   ~FakePreviewSink() override {
     for (IMFMediaType* type : added) type->Release();
@@ -116,7 +116,7 @@ class FakePreviewSink
   HRESULT SetCustomSink(IMFMediaSink*) override { return E_NOTIMPL; }
 };
 
-class FakeCaptureEngine : public platform::ComObject<IMFCaptureEngine, IID_IMFCaptureEngine> {
+class FakeCaptureEngine : public ComObject<IMFCaptureEngine, IID_IMFCaptureEngine> {
  public:
   FakeCaptureEngine() : source(new FakeCaptureSource), sink(new FakeSink), preview(new FakePreviewSink) {}
   ~FakeCaptureEngine() override {

@@ -8,13 +8,14 @@
 #include <memory>
 #include <vector>
 
+#include "fakes/com.h"
 #include "platform/dxgi.h"
 
 namespace fakes {
 
 // Reference counting that lets a test see whether the code under test released an object.
 template <class I>
-class Counted : public I {
+class Counted : public Stub<I> {
  public:
   HRESULT QueryInterface(REFIID riid, void** object) override {
     if (riid == IID_IUnknown || answers(riid)) {

@@ -2,16 +2,18 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
+#include <cstring>
+#include <iostream>
 #include <regex>
 #include <sstream>
 
 #include "capture/check.h"
 #include "capture/log.h"
 #include "capture/text.h"
+#include "wine.h"
 
 using ::testing::EndsWith;
 using ::testing::HasSubstr;
-using ::testing::MatchesRegex;
 
 namespace {
 
@@ -42,14 +44,20 @@ TEST(CheckResult, SuccessCodesPass) {
 
 TEST(CheckResult, FailureTextHasTimeLineFileCodeMessageAndSystemText) {
   const std::string text = failureText(E_POINTER, "x");
-  // asctime's form, its own newline, then a tab.
-  EXPECT_THAT(text, MatchesRegex("(Sun|Mon|Tue|Wed|Thu|Fri|Sat) (Jan|Feb|Mar|Apr|May|Jun|Jul|Aug|Sep|Oct|Nov|Dec) "
-                                 "[ 123][0-9] [0-2][0-9]:[0-5][0-9]:[0-6][0-9] [0-9]{4}\n\t.*"));
+  // asctime's form, its own newline, then a tab. std::regex, since GoogleTest's own regex on
+  // Windows knows neither groups nor alternation.
+  const std::regex form("(Sun|Mon|Tue|Wed|Thu|Fri|Sat) (Jan|Feb|Mar|Apr|May|Jun|Jul|Aug|Sep|Oct|Nov|Dec) "
+                        "[ 123][0-9] [0-2][0-9]:[0-5][0-9]:[0-6][0-9] [0-9]{4}\n\t[^\n]*");
+  EXPECT_TRUE(std::regex_match(text, form)) << text;
+  EXPECT_THAT(text, HasSubstr("\tnative/interface(47): 0x80004003: x ("));
+  if (testsupport::underWine()) GTEST_SKIP() << "Wine has no system text for E_POINTER";
   EXPECT_THAT(text, EndsWith("\tnative/interface(47): 0x80004003: x (Invalid pointer)"));
 }
 
 TEST(CheckResult, CodesPrintAsLowercaseHexOfTheirBitPattern) {
   EXPECT_THAT(failureText(static_cast<HRESULT>(0xC00D36B4), "m"), HasSubstr("(47): 0xc00d36b4: m ("));
+  EXPECT_THAT(failureText(static_cast<HRESULT>(0x887A0026), "m"), HasSubstr("(47): 0x887a0026: m ("));
+  if (testsupport::underWine()) GTEST_SKIP() << "Wine has no system text for DXGI_ERROR_ACCESS_LOST (0x887A0026)";
   EXPECT_THAT(failureText(static_cast<HRESULT>(0x887A0026), "m"), HasSubstr("0x887a0026: m (The desktop duplication"));
 }
 
@@ -70,11 +78,14 @@ TEST(SystemMessage, FallbacksForCodesWithoutText) {
 }
 
 TEST(SystemMessage, ComesFromTheSystemTable) {
-  EXPECT_EQ(capture::systemMessage(E_POINTER), "Invalid pointer");
-  EXPECT_EQ(capture::systemMessage(HRESULT_FROM_WIN32(ERROR_PATH_NOT_FOUND)), "The system cannot find the path specified.");
-  EXPECT_EQ(capture::systemMessage(RPC_E_CHANGED_MODE), "Cannot change thread mode after it is set.");
   // WASAPI's codes have no system text on Windows either.
   EXPECT_EQ(capture::systemMessage(static_cast<HRESULT>(0x88890004)), "Unknown error 0x88890004");
+  if (testsupport::underWine())
+    GTEST_SKIP() << "Wine has no system text for E_POINTER, RPC_E_CHANGED_MODE and REGDB_E_CLASSNOTREG, and words "
+                    "ERROR_PATH_NOT_FOUND's as \"" << capture::systemMessage(HRESULT_FROM_WIN32(ERROR_PATH_NOT_FOUND)) << '"';
+  EXPECT_EQ(capture::systemMessage(HRESULT_FROM_WIN32(ERROR_PATH_NOT_FOUND)), "The system cannot find the path specified.");
+  EXPECT_EQ(capture::systemMessage(E_POINTER), "Invalid pointer");
+  EXPECT_EQ(capture::systemMessage(RPC_E_CHANGED_MODE), "Cannot change thread mode after it is set.");
   EXPECT_EQ(capture::systemMessage(static_cast<HRESULT>(0x80040154)), "Class not registered");
 }
 
@@ -83,12 +94,15 @@ TEST(FormatMessage, AllocatesATextEndingInCarriageReturnLineFeed) {
   DWORD length = FormatMessageA(FORMAT_MESSAGE_ALLOCATE_BUFFER | FORMAT_MESSAGE_FROM_SYSTEM | FORMAT_MESSAGE_IGNORE_INSERTS,
                                 nullptr, static_cast<DWORD>(E_OUTOFMEMORY), 0, reinterpret_cast<LPSTR>(&text), 0, nullptr);
   ASSERT_NE(text, nullptr);
-  EXPECT_EQ(std::string(text), "Not enough memory resources are available to complete this operation.\r\n");
+  const std::string message = text;
+  EXPECT_THAT(message, EndsWith(".\r\n"));
   EXPECT_EQ(length, std::strlen(text));
   LocalFree(text);
   text = nullptr;
   EXPECT_EQ(FormatMessageA(0x1300, nullptr, 0x88890001, 0, reinterpret_cast<LPSTR>(&text), 0, nullptr), 0u);
   EXPECT_EQ(text, nullptr);
+  if (testsupport::underWine()) GTEST_SKIP() << "Wine words E_OUTOFMEMORY's system text as \"" << message.substr(0, message.size() - 2) << '"';
+  EXPECT_EQ(message, "Not enough memory resources are available to complete this operation.\r\n");
 }
 
 TEST(Log, WarningAndTestingLines) {
@@ -112,7 +126,9 @@ TEST(Text, RoundTripsOutsideTheBasicPlane) {
   EXPECT_EQ(wide[5], 0xD83C);
   EXPECT_EQ(wide[6], 0xDFA5);
   EXPECT_EQ(capture::toUtf8(wide), utf8);
-  EXPECT_EQ(platform::narrow(wide.c_str()), utf8);  // the platform layer reads the same units
+#ifndef _WIN32
+  EXPECT_EQ(platform::narrow(wide.c_str()), utf8);  // our platform layer reads the same units
+#endif
   EXPECT_THROW(capture::toWide("Caf\xE9 Display"), std::range_error);  // an ANSI name
 }
 

@@ -6,6 +6,9 @@ namespace {
 
 using namespace capture::audio;
 
+// The SDK declares MFAudioFormat_Float_SpatialObjects only for newer targets than the add-on's.
+constexpr GUID kFloatSpatialObjects = {0xFA39CD94, 0xBC64, 0x4AB1, {0x9B, 0x71, 0xDC, 0xD0, 0x9D, 0x5A, 0x7E, 0x7A}};
+
 TEST(AudioFormats, TableHasTheTwentyThreeRowsInOrder) {
   const auto& table = audioSubtypes();
   ASSERT_EQ(table.size(), 23u);
@@ -24,10 +27,9 @@ TEST(AudioFormats, TableHasTheTwentyThreeRowsInOrder) {
   }
   const GUID ac3 = {0xE06D802C, 0xDB46, 0x11CF, {0xB4, 0xD1, 0x00, 0x80, 0x5F, 0x6C, 0xBB, 0xEA}};
   const GUID ddPlus = {0xA7FB87AF, 0x2D02, 0x42FB, {0xA4, 0xD4, 0x05, 0xCD, 0x93, 0x84, 0x3B, 0xDD}};
-  const GUID spatial = {0xFA39CD94, 0xBC64, 0x4AB1, {0x9B, 0x71, 0xDC, 0xD0, 0x9D, 0x5A, 0x7E, 0x7A}};
   EXPECT_EQ(table[6].subtype, ac3);
   EXPECT_EQ(table[8].subtype, ddPlus);
-  EXPECT_EQ(table[13].subtype, spatial);
+  EXPECT_EQ(table[13].subtype, kFloatSpatialObjects);
 }
 
 TEST(AudioFormats, LookUpNamesAndTags) {
@@ -39,7 +41,11 @@ TEST(AudioFormats, LookUpNamesAndTags) {
   const GUID unknown = {0x12345678, 0x1, 0x2, {1, 2, 3, 4, 5, 6, 7, 8}};
   EXPECT_EQ(nameOfSubtype(unknown), "Unknown");
   EXPECT_EQ(tagOfSubtype(unknown), 0);
-  EXPECT_EQ(tagOfSubtype(MFAudioFormat_Float_SpatialObjects), 0);
+  EXPECT_EQ(nameOfSubtype(kFloatSpatialObjects), "Uncompressed Floating-Point Audio (SO)");
+  EXPECT_EQ(tagOfSubtype(kFloatSpatialObjects), 0);
+#ifndef _WIN32
+  EXPECT_EQ(MFAudioFormat_Float_SpatialObjects, kFloatSpatialObjects);
+#endif
   EXPECT_EQ(tagOfSubtype(MFAudioFormat_WMAudioV9), 0);
   // All sixteen bytes count.
   GUID almost = MFAudioFormat_AAC;

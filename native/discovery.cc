@@ -1,0 +1,64 @@
+#include "discovery.h"
+
+#include <stdexcept>
+
+#include "capture/audio/wasapi/capturemethod.h"
+#include "capture/check.h"
+#include "capture/log.h"
+#include "capture/video/camera/mfce/mfcecapturemethod.h"
+#include "capture/video/screen/dxgi/capturemethod.h"
+#include "platform/com.h"
+
+namespace capture {
+
+namespace {
+
+void append(SourceList& sources, SourceList found) {
+  for (auto& source : found) sources.push_back(std::move(source));
+}
+
+}  // namespace
+
+void discoverSources(SourceList& sources) {
+  const size_t firstNew = sources.size();
+  {
+    video::camera::mfce::MFCECaptureMethod cameras;
+    append(sources, cameras.sources());
+    for (auto& microphone : cameras.audioSources()) sources.push_back(microphone);
+  }
+
+  try {
+    checkResult("native/interface", 47, CoInitializeEx(nullptr, COINIT_APARTMENTTHREADED | COINIT_SPEED_OVER_MEMORY),
+                "Failed to initialize the COM library.");
+  } catch (const std::runtime_error&) {
+    CoUninitialize();
+  }
+
+  append(sources, audio::wasapi::CaptureMethod().sources());
+
+  // Sources of an earlier initialize already run; starting them again from here would race
+  // the screen pump on displays, so only this call's sources are started.
+  for (size_t i = firstNew; i < sources.size(); ++i) {
+    std::shared_ptr<Source> source = sources[i];
+    try {
+      source->capture();
+    } catch (const std::runtime_error& e) {
+      logWarning(e.what());
+    }
+    try {
+      source->startPreview();
+    } catch (const std::runtime_error& e) {
+      logWarning(e.what());
+    }
+  }
+
+  // A display the grab cannot handle costs the displays, not the cameras and endpoints found
+  // above: they are announced all the same.
+  try {
+    append(sources, video::screen::dxgi::CaptureMethod().sources());
+  } catch (const std::runtime_error& e) {
+    logWarning(e.what());
+  }
+}
+
+}  // namespace capture
