@@ -76,7 +76,7 @@ function checkUnitTests({ code, output, ended }) {
 }
 
 // The lines where Wine stops the capture code, in the add-on's own failure form.
-const duplicationLine = /^\w{3} \w{3} [ \d]\d \d\d:\d\d:\d\d \d{4}\n\tnative\/capture\/video\/screen\/dxgi\/duplicate\(10\): 0x80004001: Could not get output duplicator from device\. \(.*\)$/m;
+const duplicationLine = /^(?:\d+: Warning: )?\w{3} \w{3} [ \d]\d \d\d:\d\d:\d\d \d{4}\n\tnative\/capture\/video\/screen\/dxgi\/duplicate\(10\): 0x80004001: Could not get output duplicator from device\. \(.*\)$/m;
 const loopbackLine = /^\d{13}: Warning: \w{3} \w{3} [ \d]\d \d\d:\d\d:\d\d \d{4}\n\tnative\/capture\/audio\/wasapi\/source\(243\): 0x88890003: Could not get the audio capture client service from the audio client\. \(.*\)$/gm;
 const endpointLine = /^source id=\d+ name=".+" selected=[01] type="wasapi"$/gm;
 

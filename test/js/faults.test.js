@@ -195,7 +195,7 @@ test('the sink unloaded and loaded again', async () => {
       },
       repair: async ({ env, helpers }) => {
         pactl(env, 'load-module', 'module-null-sink', 'sink_name=tavio_speakers', 'rate=48000', 'channels=2',
-          "sink_properties=device.description='Tavio Speakers'");
+          'sink_properties="device.description=\'Tavio Speakers\'"');
         pactl(env, 'set-default-sink', 'tavio_speakers');
         helpers.push(playTone(env));
       },
@@ -239,9 +239,15 @@ test('the disk full, then space freed', async (t) => {
     await faultCase({
       folder,
       broken: ['dxgi', 'wasapi', 'mfce_audio', 'mfce_video'],
-      fault: async () => {
-        // What is left fills up within a moment.
-        spawnSync('fallocate', ['-l', String(Math.max(0, fs.statfsSync(folder).bavail * fs.statfsSync(folder).bsize - 300000)), filler]);
+      fault: () => {
+        // Fill the disk, then leave a little that the recordings use up within a moment.
+        const fd = fs.openSync(filler, 'w');
+        const chunk = Buffer.alloc(1 << 16);
+        try {
+          for (;;) fs.writeSync(fd, chunk);
+        } catch (_) { /* full */ }
+        fs.ftruncateSync(fd, Math.max(0, fs.fstatSync(fd).size - 300000));
+        fs.closeSync(fd);
       },
       repair: () => {
         for (const name of fs.readdirSync(folder)) fs.rmSync(path.join(folder, name));

@@ -114,7 +114,7 @@ void Mp4File::commit() {
 void Mp4File::rollback() {
   if (fd_ < 0) return;
   if (::ftruncate(fd_, committed_) == 0) end_ = position_ = committed_;
-  if (io_) io_->buf_ptr = io_->buffer;  // drop the unwritten rest of the failed piece
+  if (io_) io_->buf_ptr = io_->buf_ptr_max = io_->buffer;  // drop the unwritten rest of the failed piece
 }
 
 void Mp4File::setTrackEnd(size_t track, double seconds) {
@@ -170,6 +170,7 @@ int Mp4File::close() {
   if (io_) {
     avio_flush(io_);
     result = io_->error;
+    if (result < 0) rollback();  // what did not fit stays out: the file ends with a whole piece
   }
   if (fd_ >= 0 && ::close(fd_) != 0 && result >= 0) result = AVERROR(errno);
   fd_ = -1;

@@ -1000,7 +1000,9 @@ class SinkWriter : public ComObject<IMFSinkWriter, IID_IMFSinkWriter> {
     }
     bool anyPackets = false;
     for (const StreamSlot& slot : streams_) anyPackets = anyPackets || slot.encoder->packets() > 0;
-    const int trailer = av_write_trailer(format_);
+    int trailer = av_write_trailer(format_);
+    avio_flush(format_->pb);
+    if (trailer >= 0 && format_->pb->error < 0) trailer = format_->pb->error;
     if (trailer < 0) {
       file_->rollback();
     } else {
