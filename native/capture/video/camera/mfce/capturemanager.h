@@ -108,8 +108,21 @@ class CaptureManager {
   UINT resetToken = 0;
 
  private:
+  // Engine events handled so far, by kind. A wait ends when the event it waits for has been
+  // handled (or the engine failed), not at the next signal of engineEvent: a signal of an earlier
+  // event stays pending and would end it before the engine has answered.
+  enum EventKind { PreviewStarted, PreviewStopped, RecordStarted, RecordStopped, EngineFailed, EventKinds };
+  struct Mark {
+    uint32_t handled[EventKinds];
+  };
+  Mark mark() const;
+  void waitFor(const Mark& before, EventKind kind);
+
   HRESULT AddVideoRecordStream(IMFCaptureSource* source, IMFCaptureRecordSink* sink);
   HRESULT AddAudioRecordStream(IMFCaptureRecordSink* sink);
+
+  std::atomic<uint32_t> handled_[EventKinds] = {};
+  std::atomic<HRESULT> recordStartStatus_{S_OK};
 };
 
 }  // namespace capture::video::camera::mfce
