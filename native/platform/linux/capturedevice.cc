@@ -126,8 +126,8 @@ GUID videoSubtype(const AVCodecParameters* codec) {
 
 }  // namespace
 
-HRESULT openInput(Device& device, std::unique_ptr<Input>& result) {
-  auto input = std::make_unique<Input>();
+HRESULT openInput(Device& device, std::shared_ptr<Input>& result) {
+  auto input = std::make_shared<Input>();
   const AVInputFormat* format = av_find_input_format(device.formatName.c_str());
   if (!format) return MF_E_NO_CAPTURE_DEVICES_AVAILABLE;
   AVDictionary* options = nullptr;
