@@ -618,10 +618,12 @@ void EngineThread::deliverVideo(AVFrame* frame, int64_t pts, AVRational timeBase
 }
 
 // Where a picture goes in its clip: its device time, which is steadier than the moments reads
-// return, counted from the clip's first picture, placed by when that one was read. The first
+// return, counted from the clip's first picture, placed by when that one was read, and never
+// after its own read (a first picture read late would push the rest past the stop). The first
 // picture itself is shown from the start.
-LONGLONG clipTime(const Recording& recording, LONGLONG deviceTime) {
-  return deviceTime - recording.firstDeviceTime + (recording.firstReadAt - recording.startAt) * 10;
+LONGLONG clipTime(const Recording& recording, LONGLONG deviceTime, int64_t readAt) {
+  return std::min<LONGLONG>(deviceTime - recording.firstDeviceTime + (recording.firstReadAt - recording.startAt) * 10,
+                            (readAt - recording.startAt) * 10);
 }
 
 // A picture read before the clip's start (it waited behind a command) replaces the opening one;
@@ -639,7 +641,7 @@ void EngineThread::recordPicture(Recording& recording, IMFSample* picture, LONGL
     recording.firstReadAt = readAt;
     return;
   }
-  LONGLONG time = clipTime(recording, deviceTime);
+  LONGLONG time = clipTime(recording, deviceTime, readAt);
   if (time <= recording.heldTime) time = recording.heldTime + recording.frameDuration;  // the device's clock jumped back
   writeHeld(recording, time - recording.heldTime);
   recording.held = ComPtr<IMFSample>(picture, true);
@@ -792,8 +794,8 @@ void EngineThread::passThrough(Recording& recording, const AVPacket* packet, AVR
   }
   LONGLONG time = recording.heldTime + recording.frameDuration;  // no time of its own: the packets follow one another
   if (deviceTime != AV_NOPTS_VALUE && recording.firstDeviceTime != AV_NOPTS_VALUE &&
-      clipTime(recording, deviceTime) > recording.heldTime)
-    time = clipTime(recording, deviceTime);
+      clipTime(recording, deviceTime, readAt) > recording.heldTime)
+    time = clipTime(recording, deviceTime, readAt);
   writeHeld(recording, time - recording.heldTime);
   recording.held = sample;
   recording.heldTime = time;
