@@ -120,6 +120,7 @@ void prepareRecord(IMFCaptureEngine* engine, const std::string& clip, UINT32 bit
   EXPECT_EQ(engine->GetSink(MF_CAPTURE_ENGINE_SINK_TYPE_RECORD, &sink), S_OK);
   EXPECT_EQ(sink->QueryInterface(IID_IMFCaptureRecordSink, reinterpret_cast<void**>(&recordSink)), S_OK);
   DWORD index = 0;
+  EXPECT_EQ(recordSink->RemoveAllStreams(), S_OK);
   EXPECT_EQ(recordSink->AddStream(MF_CAPTURE_ENGINE_PREFERRED_SOURCE_STREAM_FOR_VIDEO_RECORD, recordType, nullptr, &index),
             S_OK);
   EXPECT_EQ(recordSink->SetOutputFileName(platform::widen(clip).c_str()), S_OK);

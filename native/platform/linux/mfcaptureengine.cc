@@ -362,7 +362,11 @@ HRESULT EngineThread::startRecording(const Order& order) {
   auto recording = std::make_unique<Recording>();
   recording->startAt = order.at;
   const std::wstring url = widen(order.path);
-  HRESULT hr = MFCreateSinkWriterFromURL(url.c_str(), nullptr, nullptr, &recording->writer.p);
+  // Fragmented MP4: what was written before a failed write (a full disk) stays a file that plays.
+  ComPtr<IMFAttributes> settings;
+  HRESULT hr = MFCreateAttributes(&settings.p, 1);
+  if (SUCCEEDED(hr)) hr = settings->SetGUID(MF_TRANSCODE_CONTAINERTYPE, MFTranscodeContainerType_FMPEG4);
+  if (SUCCEEDED(hr)) hr = MFCreateSinkWriterFromURL(url.c_str(), nullptr, settings.p, &recording->writer.p);
   for (const SinkStream& stream : order.streams) {
     if (FAILED(hr)) break;
     Device* device = stream.video ? state_->video.get() : state_->audio.get();
