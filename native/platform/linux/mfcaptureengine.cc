@@ -398,10 +398,14 @@ HRESULT EngineThread::startRecording(const Order& order) {
       const int width = evenpicture::evenSize(f.width);
       const int height = evenpicture::evenSize(f.height);
       recording->padded = width != f.width || height != f.height;
-      if (recording->padded) {
+      // libx264 counts its rate in whole kbit/s: a tiny picture's estimate would be none at all.
+      constexpr UINT32 lowestBitRate = 1000;
+      const bool slow = SUCCEEDED(stream.type->GetUINT32(MF_MT_AVG_BITRATE, &bitRate)) && bitRate < lowestBitRate;
+      if (recording->padded || slow) {
         hr = MFCreateMediaType(&output.p);
         if (SUCCEEDED(hr)) hr = stream.type->CopyAllItems(output.p);
         if (SUCCEEDED(hr)) hr = MFSetAttributeSize(output.p, MF_MT_FRAME_SIZE, width, height);
+        if (SUCCEEDED(hr) && slow) hr = output->SetUINT32(MF_MT_AVG_BITRATE, lowestBitRate);
       }
       if (SUCCEEDED(hr)) hr = input->SetGUID(MF_MT_MAJOR_TYPE, MFMediaType_Video);
       if (SUCCEEDED(hr)) hr = input->SetGUID(MF_MT_SUBTYPE, MFVideoFormat_RGB32);
