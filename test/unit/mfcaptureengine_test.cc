@@ -14,7 +14,9 @@
 #include "capture/video/camera/mfce/capturemanager.h"
 #include "capture/video/camera/mfce/mfcesource.h"
 #include "media.h"
+#include "platform/linux/evenpicture.h"
 #include "platform/linux/mfcapture.h"
+#include "platform/linux/testcameragraph.h"
 
 namespace {
 
@@ -324,6 +326,76 @@ TEST(LinuxCaptureEngine, APictureACallbackKeepsIsNotOverwrittenByTheNextOnes) {
   EXPECT_TRUE(now == atDelivery);
   for (IUnknown* object : std::initializer_list<IUnknown*>{type, previewSink, sink, callback})
     object->Release();
+}
+
+// Odd sizes are recorded at the next even size, the last column and row repeated.
+TEST(LinuxCaptureEngine, OddPicturesArePaddedToEvenWithTheirLastColumnAndRow) {
+  EXPECT_EQ(platform::evenpicture::evenSize(1), 2);
+  EXPECT_EQ(platform::evenpicture::evenSize(32), 32);
+  EXPECT_EQ(platform::evenpicture::evenSize(33), 34);
+  // 3x3 pixels whose four bytes are all their index.
+  std::vector<uint8_t> source;
+  for (uint8_t pixel = 0; pixel < 9; ++pixel) source.insert(source.end(), 4, pixel);
+  std::vector<uint8_t> padded(4 * 4 * 4, 0xEE);
+  platform::evenpicture::pad(source.data(), 3, 3, padded.data());
+  const uint8_t expected[4][4] = {{0, 1, 2, 2}, {3, 4, 5, 5}, {6, 7, 8, 8}, {6, 7, 8, 8}};
+  for (int y = 0; y < 4; ++y)
+    for (int x = 0; x < 4; ++x)
+      for (int byte = 0; byte < 4; ++byte) EXPECT_EQ(padded[(y * 4 + x) * 4 + byte], expected[y][x]) << x << "," << y;
+}
+
+// Test cameras take generators and drawing filters; anything else, file readers and writers
+// above all, is refused, however its graph is written.
+TEST(LinuxCaptureEngine, TestCameraGraphsTakeOnlyGeneratorsAndDrawingFilters) {
+  using platform::testcamera::filterNames;
+  using platform::testcamera::refusedFilter;
+  EXPECT_EQ(filterNames("testsrc2=size=640x480:rate=30, drawbox=x=0:y=0:w=320:h=60:color=red:t=fill"),
+            (std::vector<std::string>{"testsrc2", "drawbox"}));
+  EXPECT_EQ(filterNames("color@bg=c=red[a];[a]scale=w='iw\\,2':h=2[out]"),
+            (std::vector<std::string>{"color", "scale"}));
+  for (const char* graph : {"testsrc2=size=640x480:rate=30", "color=c=red:size=1x1:rate=30", "smptebars",
+                            "mandelbrot=size=320x240", "color=c=blue:size=320x240,drawbox=x=0:y=0:w=9:h=9:t=fill",
+                            "testsrc=d=5,format=yuyv422,realtime"})
+    EXPECT_EQ(refusedFilter(graph), "") << graph;
+  const std::pair<const char*, const char*> refused[] = {
+      {"movie=/etc/passwd", "movie"},
+      {"amovie=/tmp/a.wav", "amovie"},
+      {"color=c=red,drawtext=textfile=/etc/shadow", "drawtext"},
+      {"testsrc2,metadata=mode=print:file=/tmp/out", "metadata"},
+      {"testsrc2 , 'mov'ie=/etc/passwd", "movie"},  // spaces and quotes do not hide a filter
+      {"[in]movie=/etc/passwd", "movie"},
+      {"testsrc2;movie=/etc/passwd[b]", "movie"},
+      {"drawbox", "drawbox"},  // a filter with no source
+      {"", "(no name)"},
+  };
+  for (const auto& [graph, filter] : refused) EXPECT_EQ(refusedFilter(graph), filter) << graph;
+}
+
+// A handle closed while another thread waits on it keeps its object until that wait returns (under
+// AddressSanitizer a freed object in use fails the run).
+TEST(LinuxCaptureEngine, AnEventClosedWhileWaitedOnLivesUntilTheWaitEnds) {
+  HANDLE event = CreateEventA(nullptr, FALSE, FALSE, nullptr);
+  ASSERT_NE(event, nullptr);
+  std::mutex mutex;
+  std::condition_variable entered;
+  bool waiting = false;
+  DWORD result = WAIT_FAILED;
+  std::thread waiter([&] {
+    {
+      std::lock_guard<std::mutex> lock(mutex);
+      waiting = true;
+    }
+    entered.notify_all();
+    result = WaitForSingleObject(event, 300);
+  });
+  {
+    std::unique_lock<std::mutex> lock(mutex);
+    entered.wait(lock, [&] { return waiting; });
+  }
+  std::this_thread::sleep_for(std::chrono::milliseconds(30));
+  EXPECT_TRUE(CloseHandle(event));  // nobody can signal it now: the wait ends by its time-out
+  waiter.join();
+  EXPECT_EQ(result, static_cast<DWORD>(WAIT_TIMEOUT));
 }
 
 // Clips started and stopped back to back, the second stopped the moment it started: the engine

@@ -39,7 +39,10 @@ std::vector<std::string> filterNames(const std::string& graph) {
   for (size_t i = 0; i < graph.size(); ++i) {
     const char c = graph[i];
     if (quoted) {
-      if (c == '\'') quoted = false;
+      if (c == '\'')
+        quoted = false;
+      else if (inName && !brackets)
+        name += c;
       continue;
     }
     if (c == '\\') {  // an escaped character belongs to an option value (or a name, kept as is)
