@@ -217,10 +217,16 @@ HRESULT CaptureManager::ConfigurePreview(UINT32& width, UINT32& height) {
   return hr;
 }
 
-CaptureManager::Mark CaptureManager::mark() const {
-  Mark result{};
-  for (int kind = 0; kind < EventKinds; ++kind) result.handled[kind] = handled_[kind].load();
-  return result;
+CaptureManager::Mark::~Mark() {
+  if (event) CloseHandle(event);
+}
+
+void CaptureManager::mark(Mark& before) const {
+  for (int kind = 0; kind < EventKinds; ++kind) before.handled[kind] = handled_[kind].load();
+  if (engineEvent &&
+      !DuplicateHandle(GetCurrentProcess(), engineEvent, GetCurrentProcess(), &before.event, 0, FALSE,
+                       DUPLICATE_SAME_ACCESS))
+    before.event = nullptr;
 }
 
 // Every handled event signals engineEvent after counting itself, so a wait that finds its count
@@ -228,8 +234,7 @@ CaptureManager::Mark CaptureManager::mark() const {
 void CaptureManager::waitFor(const Mark& before, EventKind kind) {
   while (handled_[kind].load() == before.handled[kind] &&
          handled_[EngineFailed].load() == before.handled[EngineFailed]) {
-    HANDLE event = engineEvent;
-    if (!event || WaitForSingleObject(event, INFINITE) != WAIT_OBJECT_0) return;
+    if (!before.event || WaitForSingleObject(before.event, INFINITE) != WAIT_OBJECT_0) return;
   }
 }
 
@@ -237,7 +242,8 @@ HRESULT CaptureManager::StartPreview(capture::video::FrameQueue* queue) {
   if (!engine) return MF_E_NOT_INITIALIZED;
   if (previewing) return S_OK;
   if (!frameQueue) frameQueue = queue;
-  const Mark before = mark();
+  Mark before;
+  mark(before);
   HRESULT hr = engine->StartPreview();
   if (!powerRequestSet && powerRequest != INVALID_HANDLE_VALUE)
     powerRequestSet = PowerSetRequest(powerRequest, PowerRequestExecutionRequired) == TRUE;
@@ -249,7 +255,8 @@ HRESULT CaptureManager::StartPreview(capture::video::FrameQueue* queue) {
 HRESULT CaptureManager::StopPreview() {
   if (!engine) return MF_E_NOT_INITIALIZED;
   if (!previewing) return S_OK;
-  const Mark before = mark();
+  Mark before;
+  mark(before);
   HRESULT hr = engine->StopPreview();
   if (FAILED(hr)) return hr;
   waitFor(before, PreviewStopped);
@@ -329,7 +336,8 @@ HRESULT CaptureManager::StartRecord(LPCWSTR path) {
   if (SUCCEEDED(hr) && videoEncoding != GUID_NULL) hr = AddVideoRecordStream(source, recordSink);
   if (SUCCEEDED(hr) && audioEncoding != GUID_NULL) hr = AddAudioRecordStream(recordSink);
   if (SUCCEEDED(hr)) {
-    const Mark before = mark();
+    Mark before;
+    mark(before);
     hr = engine->StartRecord();
     if (SUCCEEDED(hr)) {
       waitFor(before, RecordStarted);
@@ -345,7 +353,8 @@ HRESULT CaptureManager::StartRecord(LPCWSTR path) {
 
 HRESULT CaptureManager::StopRecord() {
   if (!recording) return S_OK;
-  const Mark before = mark();
+  Mark before;
+  mark(before);
   HRESULT hr = engine->StopRecord(TRUE, FALSE);
   if (SUCCEEDED(hr)) waitFor(before, RecordStopped);
   return hr;

@@ -112,10 +112,17 @@ class CaptureManager {
   // handled (or the engine failed), not at the next signal of engineEvent: a signal of an earlier
   // event stays pending and would end it before the engine has answered.
   enum EventKind { PreviewStarted, PreviewStopped, RecordStarted, RecordStopped, EngineFailed, EventKinds };
+  // The counts before a command, and a handle of the wait's own to engineEvent, so that an engine
+  // error closing the manager's handle meanwhile cannot take the event from under the wait.
   struct Mark {
-    uint32_t handled[EventKinds];
+    Mark() = default;
+    Mark(const Mark&) = delete;
+    Mark& operator=(const Mark&) = delete;
+    ~Mark();
+    uint32_t handled[EventKinds] = {};
+    HANDLE event = nullptr;
   };
-  Mark mark() const;
+  void mark(Mark& before) const;
   void waitFor(const Mark& before, EventKind kind);
 
   HRESULT AddVideoRecordStream(IMFCaptureSource* source, IMFCaptureRecordSink* sink);
