@@ -29,7 +29,7 @@ function startXvfb(width, height, extra, depth = 24) {
   });
 }
 
-function pulseConfig(dir, sinks, microphone) {
+function pulseConfig(dir, sinks, microphone, remapped) {
   const lines = [`load-module module-native-protocol-unix auth-anonymous=1 socket=${dir}/native`];
   for (const sink of sinks) {
     lines.push(`load-module module-null-sink sink_name=${sink.name} rate=${sink.rate || 48000} channels=${sink.channels || 2} ` +
@@ -42,11 +42,19 @@ function pulseConfig(dir, sinks, microphone) {
     lines.push(`load-module module-sine-source source_name=${microphone.name} rate=${microphone.rate || 48000} ` +
       `frequency=${microphone.frequency || 440} source_properties="device.description='${microphone.description}'"`);
   }
+  if (remapped) {
+    // A low-latency microphone: a null sink's monitor remapped as a source of its own (a monitor
+    // is no microphone), with a tone played into the sink. Its sound comes 20 ms at a time.
+    lines.push(`load-module module-null-sink sink_name=${remapped.name}_feed rate=48000 channels=2 ` +
+      `sink_properties="device.description='${remapped.description} Feed'"`);
+    lines.push(`load-module module-remap-source master=${remapped.name}_feed.monitor source_name=${remapped.name} ` +
+      `source_properties="device.description='${remapped.description}'"`);
+  }
   return lines.join('\n') + '\n';
 }
 
-async function startPulse(dir, sinks, microphone) {
-  fs.writeFileSync(path.join(dir, 'conf.pa'), pulseConfig(dir, sinks, microphone));
+async function startPulse(dir, sinks, microphone, remapped) {
+  fs.writeFileSync(path.join(dir, 'conf.pa'), pulseConfig(dir, sinks, microphone, remapped));
   const env = { ...process.env, HOME: dir, XDG_RUNTIME_DIR: dir };
   const r = spawnSync('pulseaudio', ['--daemonize=yes', '--exit-idle-time=-1', '--system=false', '-n',
     '-F', path.join(dir, 'conf.pa'), '--use-pid-file=yes', '--log-target=stderr'], { env, encoding: 'utf8' });
@@ -64,7 +72,9 @@ async function startPulse(dir, sinks, microphone) {
  * Options: width, height, monitors (xrandr --setmonitor arguments, e.g. ['LEFT 960/254x1080/286+0+0 screen']),
  * sinks ([{name, description, rate, channels, channelMap, default}], channelMap e.g. 'aux0,aux1'),
  * microphone ({name, description, frequency}), display (false: no X server), depth (the screen's
- * depth, 24 by default), xvfbArguments (more Xvfb arguments), audio (false: no sound server).
+ * depth, 24 by default), xvfbArguments (more Xvfb arguments), audio (false: no sound server),
+ * remappedMicrophone ({name, description, frequency}: a low-latency microphone beside the sine
+ * source, a null sink "<name>_feed" with a tone playing into it, its monitor remapped as a source).
  * Resolves with { env, dir, stop() }: env holds DISPLAY and PULSE_SERVER for child processes.
  */
 async function startDesktop(options = {}) {
@@ -72,11 +82,13 @@ async function startDesktop(options = {}) {
     width = 1920, height = 1080, depth = 24, monitors = [], display = true, xvfbArguments = [], audio = true,
     sinks = [{ name: 'tavio_speakers', description: 'Tavio Speakers', default: true }],
     microphone = { name: 'tavio_mic', description: 'Tavio Microphone', frequency: 440 },
+    remappedMicrophone = null,
   } = options;
   const own = options.private !== false;
   const dir = fs.mkdtempSync(path.join(os.tmpdir(), 'tavio-desktop-'));
   const env = {};
   let xvfb = null;
+  let tone = null;
   try {
     if (display && (own || !process.env.DISPLAY)) {
       xvfb = await startXvfb(width, height, xvfbArguments, depth);
@@ -88,15 +100,26 @@ async function startDesktop(options = {}) {
       env.DISPLAY = process.env.DISPLAY;
     }
     if (audio && (own || !process.env.PULSE_SERVER)) {
-      env.PULSE_SERVER = await startPulse(dir, sinks, microphone);
+      env.PULSE_SERVER = await startPulse(dir, sinks, microphone, remappedMicrophone);
+      if (remappedMicrophone) {
+        tone = playTone(env, { frequency: remappedMicrophone.frequency || 880, sink: `${remappedMicrophone.name}_feed` });
+      }
     } else if (audio) {
       env.PULSE_SERVER = process.env.PULSE_SERVER;
     }
   } catch (e) {
+    if (tone) tone.kill('SIGKILL');
     stopAll(xvfb, dir);
     throw e;
   }
-  return { env, dir, xvfbPid: xvfb && xvfb.process.pid, stop: () => stopAll(xvfb, dir), stopAfterExit: () => stopAfterExit(xvfb, dir) };
+  const stopTone = () => { if (tone) tone.kill('SIGKILL'); };
+  return {
+    env,
+    dir,
+    xvfbPid: xvfb && xvfb.process.pid,
+    stop: () => { stopTone(); stopAll(xvfb, dir); },
+    stopAfterExit: () => { if (tone) tone.unref(); stopAfterExit(xvfb, dir); },
+  };
 }
 
 function stopAll(xvfb, dir) {

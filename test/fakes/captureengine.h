@@ -2,6 +2,7 @@
 // remember what they were given, for the capture-engine manager's tests.
 #pragma once
 
+#include <functional>
 #include <string>
 #include <vector>
 
@@ -128,16 +129,24 @@ class FakeCaptureEngine : public ComObject<IMFCaptureEngine, IID_IMFCaptureEngin
   FakeSink* sink;  // the record sink
   FakePreviewSink* preview;
   int startRecordCalls = 0;
+  int stopRecordCalls = 0;
   int getSinkCalls = 0;
+  // How the engine answers a command: called with the event it would send (type and status);
+  // unset, nothing is answered.
+  std::function<void(const GUID&, HRESULT)> answer;
+  HRESULT recordStartStatus = S_OK;  // the status of the record-started answer
 
   HRESULT Initialize(IMFCaptureEngineOnEventCallback*, IMFAttributes*, IUnknown*, IUnknown*) override { return S_OK; }
-  HRESULT StartPreview() override { return S_OK; }
-  HRESULT StopPreview() override { return S_OK; }
+  HRESULT StartPreview() override { return answered(MF_CAPTURE_ENGINE_PREVIEW_STARTED, S_OK); }
+  HRESULT StopPreview() override { return answered(MF_CAPTURE_ENGINE_PREVIEW_STOPPED, S_OK); }
   HRESULT StartRecord() override {
     ++startRecordCalls;
-    return S_OK;
+    return answered(MF_CAPTURE_ENGINE_RECORD_STARTED, recordStartStatus);
   }
-  HRESULT StopRecord(BOOL, BOOL) override { return S_OK; }
+  HRESULT StopRecord(BOOL, BOOL) override {
+    ++stopRecordCalls;
+    return answered(MF_CAPTURE_ENGINE_RECORD_STOPPED, S_OK);
+  }
   HRESULT TakePhoto() override { return E_NOTIMPL; }
   HRESULT GetSink(MF_CAPTURE_ENGINE_SINK_TYPE type, IMFCaptureSink** result) override {
     ++getSinkCalls;
@@ -150,6 +159,12 @@ class FakeCaptureEngine : public ComObject<IMFCaptureEngine, IID_IMFCaptureEngin
   HRESULT GetSource(IMFCaptureSource** result) override {
     source->AddRef();
     *result = source;
+    return S_OK;
+  }
+
+ private:
+  HRESULT answered(const GUID& type, HRESULT status) {
+    if (answer) answer(type, status);
     return S_OK;
   }
 };

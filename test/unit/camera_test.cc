@@ -5,6 +5,8 @@
 #include <chrono>
 #include <cstdio>
 #include <cstring>
+#include <stdexcept>
+#include <string>
 #include <thread>
 #include <vector>
 
@@ -210,11 +212,17 @@ TEST(CameraCaptureManager, RecordsOnlyToDotMp4SpeltExactly) {
   engine->Release();
 }
 
+// The fake engine answers each command at once, as its event handled by the manager.
+void answerThrough(mfce::CaptureManager& manager, fakes::FakeCaptureEngine* engine) {
+  engine->answer = [&manager](const GUID& type, HRESULT status) { manager.HandleEngineEvent(new FakeEvent(type, status)); };
+}
+
 TEST(CameraCaptureManager, VideoRecordStreamAsksForH264) {
   mfce::CaptureManager manager;
-  manager.engineEvent = CreateEventA(nullptr, FALSE, TRUE, nullptr);  // lets the wait for the start pass
+  manager.engineEvent = CreateEventA(nullptr, FALSE, FALSE, nullptr);
   auto* engine = new fakes::FakeCaptureEngine;
   manager.engine = engine;
+  answerThrough(manager, engine);
   manager.hasVideo = 1;
   IMFMediaType* mjpg = videoType(MFVideoFormat_MJPG, 640, 480, 30, 1);
   engine->source->videoType = mjpg;
@@ -234,7 +242,7 @@ TEST(CameraCaptureManager, VideoRecordStreamAsksForH264) {
   // A camera that sends H.264 passes its stream through: no bit rate is asked for.
   IMFMediaType* h264 = videoType(MFVideoFormat_H264_ES, 1280, 720, 30, 1);
   engine->source->videoType = h264;
-  SetEvent(manager.engineEvent);
+  ASSERT_EQ(S_OK, manager.StopRecord());
   ASSERT_EQ(S_OK, manager.StartRecord(L"/tmp/clip.mp4"));
   ASSERT_EQ(2u, engine->sink->added.size());
   engine->sink->added[1]->GetGUID(MF_MT_SUBTYPE, &subtype);
@@ -248,9 +256,10 @@ TEST(CameraCaptureManager, VideoRecordStreamAsksForH264) {
 
 TEST(CameraCaptureManager, AudioRecordStreamIsTheFirstAacType) {
   mfce::CaptureManager manager;
-  manager.engineEvent = CreateEventA(nullptr, FALSE, TRUE, nullptr);
+  manager.engineEvent = CreateEventA(nullptr, FALSE, FALSE, nullptr);
   auto* engine = new fakes::FakeCaptureEngine;
   manager.engine = engine;
+  answerThrough(manager, engine);
   manager.hasAudio = 1;
   ASSERT_EQ(S_OK, manager.StartRecord(L"/tmp/clip.mp4"));
   ASSERT_EQ(1u, engine->sink->added.size());
@@ -261,9 +270,10 @@ TEST(CameraCaptureManager, AudioRecordStreamIsTheFirstAacType) {
 
   // A device without sound still records.
   engine->sink->audioAnswer = MF_E_INVALIDSTREAMNUMBER;
-  SetEvent(manager.engineEvent);
+  EXPECT_EQ(S_OK, manager.StopRecord());
   EXPECT_EQ(S_OK, manager.StartRecord(L"/tmp/clip.mp4"));
   EXPECT_EQ(2, engine->startRecordCalls);
+  EXPECT_EQ(S_OK, manager.StopRecord());
   engine->sink->audioAnswer = E_FAIL;
   EXPECT_EQ(E_FAIL, manager.StartRecord(L"/tmp/clip.mp4"));
   EXPECT_EQ(2, engine->startRecordCalls);
@@ -399,6 +409,85 @@ TEST(CameraCaptureManager, APreviewThatFailedAfterGettingItsSinkIsNotConfiguredA
   manager.DestroyEngine();
 }
 
+// The engine answers later, on a thread of its own, as the real one does, while a signal of an
+// earlier event (the initialised event) is still pending: each wait must last until its own event.
+TEST(CameraCaptureManager, WaitsForTheEventOfItsOwnCommand) {
+  mfce::CaptureManager manager;
+  manager.engineEvent = CreateEventA(nullptr, FALSE, TRUE, nullptr);  // the initialised event's signal
+  auto* engine = new fakes::FakeCaptureEngine;
+  manager.engine = engine;
+  manager.hasAudio = 1;
+  std::vector<std::thread> answers;
+  engine->answer = [&](const GUID& type, HRESULT status) {
+    answers.emplace_back([&manager, type, status] {
+      std::this_thread::sleep_for(std::chrono::milliseconds(30));
+      manager.HandleEngineEvent(new FakeEvent(type, status));
+    });
+  };
+  for (int clip = 0; clip < 3; ++clip) {
+    // Stopped the moment it started: the stop still reaches the engine and is waited for.
+    ASSERT_EQ(S_OK, manager.StartRecord(L"/tmp/clip.mp4"));
+    EXPECT_TRUE(manager.IsRecording());
+    EXPECT_EQ(S_OK, manager.StopRecord());
+    EXPECT_FALSE(manager.IsRecording());
+  }
+  EXPECT_EQ(3, engine->startRecordCalls);
+  EXPECT_EQ(3, engine->stopRecordCalls);
+  EXPECT_EQ(S_OK, manager.StartPreview(nullptr));
+  EXPECT_TRUE(manager.IsPreviewing());
+  EXPECT_EQ(S_OK, manager.StopPreview());
+  EXPECT_FALSE(manager.IsPreviewing());
+  for (std::thread& answer : answers) answer.join();
+  manager.DestroyEngine();
+}
+
+TEST(CameraCaptureManager, AStartTheEngineRefusesOrAnEngineErrorEndsTheWait) {
+  mfce::CaptureManager manager;
+  manager.engineEvent = CreateEventA(nullptr, FALSE, FALSE, nullptr);
+  auto* engine = new fakes::FakeCaptureEngine;
+  manager.engine = engine;
+  manager.hasVideo = 1;
+  IMFMediaType* yuy2 = videoType(MFVideoFormat_YUY2, 64, 48, 30, 1);
+  engine->source->videoType = yuy2;
+  answerThrough(manager, engine);
+  // The file could not be made: the start's answer carries the system's code.
+  engine->recordStartStatus = HRESULT_FROM_WIN32(ERROR_PATH_NOT_FOUND);
+  EXPECT_EQ(HRESULT_FROM_WIN32(ERROR_PATH_NOT_FOUND), manager.StartRecord(L"/missing/clip.mp4"));
+  EXPECT_FALSE(manager.IsRecording());
+
+  // A device lost before the engine answered: the wait ends with the engine.
+  engine->source->videoType = nullptr;
+  yuy2->Release();
+  std::thread lost;
+  engine->answer = [&](const GUID&, HRESULT) {
+    lost = std::thread([&manager] {
+      std::this_thread::sleep_for(std::chrono::milliseconds(30));
+      manager.HandleEngineEvent(new FakeEvent(MF_CAPTURE_ENGINE_ERROR, MF_E_VIDEO_RECORDING_DEVICE_INVALIDATED));
+    });
+  };
+  EXPECT_EQ(S_OK, manager.StartPreview(nullptr));
+  lost.join();
+  EXPECT_EQ(nullptr, manager.engine);
+}
+
+TEST(CameraCaptureManager, ARecordingThatCouldNotBeWrittenIsAWarningLine) {
+  mfce::CaptureManager manager;
+  manager.engineEvent = CreateEventA(nullptr, FALSE, FALSE, nullptr);
+  manager.recording = true;
+  ::testing::internal::CaptureStdout();
+  manager.HandleEngineEvent(new FakeEvent(MF_CAPTURE_ENGINE_RECORD_STOPPED, HRESULT_FROM_WIN32(ERROR_DISK_FULL)));
+  manager.HandleEngineEvent(new FakeEvent(MF_CAPTURE_ENGINE_RECORD_STOPPED, S_OK));
+  const std::string out = ::testing::internal::GetCapturedStdout();
+  EXPECT_FALSE(manager.IsRecording());
+  EXPECT_NE(std::string::npos, out.find(": Warning: ")) << out;
+  EXPECT_NE(std::string::npos, out.find("native/capture/video/camera/mfce/capturemanager(")) << out;
+  EXPECT_NE(std::string::npos, out.find("0x80070070")) << out;
+  EXPECT_NE(std::string::npos, out.find("There is not enough space on the disk.")) << out;
+  EXPECT_EQ(out.find(": Warning: "), out.rfind(": Warning: ")) << "one line for the one failure: " << out;
+  CloseHandle(manager.engineEvent);
+  manager.engineEvent = nullptr;
+}
+
 TEST(CameraCaptureManager, CallbacksAnswerTheirOneInterface) {
   auto* callback = new mfce::CaptureManager::CaptureEngineCB(nullptr);
   void* object = nullptr;
@@ -486,8 +575,14 @@ TEST_F(CameraSource, PreviewShowsTheCameraAndEncodeRepeatsAreQuiet) {
   std::remove(path.c_str());
 
   const std::string refused = ::testing::TempDir() + "camera_test_clip.MP4";
-  source.startEncode(refused);  // only ".mp4" records
-  std::this_thread::sleep_for(std::chrono::milliseconds(100));
+  // Only ".mp4" records; the refusal says so, with the name.
+  try {
+    source.startEncode(refused);
+    ADD_FAILURE() << "a .MP4 name was taken";
+  } catch (const std::runtime_error& error) {
+    EXPECT_NE(std::string::npos, std::string(error.what()).find("mfcesource(312): 0xc00d36b4")) << error.what();
+    EXPECT_NE(std::string::npos, std::string(error.what()).find(refused)) << error.what();
+  }
   EXPECT_FALSE(source.manager()->IsRecording());
   EXPECT_EQ(nullptr, std::fopen(refused.c_str(), "rb"));
   source.stopPreview();

@@ -14,7 +14,9 @@
 #include "capture/video/camera/mfce/capturemanager.h"
 #include "capture/video/camera/mfce/mfcesource.h"
 #include "media.h"
+#include "platform/linux/evenpicture.h"
 #include "platform/linux/mfcapture.h"
+#include "platform/linux/testcameragraph.h"
 
 namespace {
 
@@ -36,19 +38,29 @@ class Events : public platform::ComObject<IMFCaptureEngineOnEventCallback, IID_I
     return S_OK;
   }
 
-  // The status of the first event of this type, waiting up to 20 seconds for it; S_FALSE if none came.
-  HRESULT waitFor(const GUID& type) {
+  // The status of the nth event (from 1) of this type, waiting up to 20 seconds for it; S_FALSE if
+  // none came.
+  HRESULT waitFor(const GUID& type, int nth = 1) {
     std::unique_lock<std::mutex> lock(mutex_);
     HRESULT status = S_FALSE;
     changed_.wait_for(lock, std::chrono::seconds(20), [&] {
+      int seen = 0;
       for (const auto& [seenType, seenStatus] : seen_)
-        if (seenType == type) {
+        if (seenType == type && ++seen == nth) {
           status = seenStatus;
           return true;
         }
       return false;
     });
     return status;
+  }
+
+  // The types of the events so far, in order.
+  std::vector<GUID> types() {
+    std::lock_guard<std::mutex> lock(mutex_);
+    std::vector<GUID> result;
+    for (const auto& seen : seen_) result.push_back(seen.first);
+    return result;
   }
 
  private:
@@ -92,38 +104,52 @@ struct InitializedEngine {
   Events* events = new Events;
 };
 
-void record(const std::string& camera, const std::string& clip, UINT32 bitRate) {
-  InitializedEngine initialized(platform::widen("h264:" + camera));
-  IMFCaptureEngine* engine = initialized.engine;
-  Events* events = initialized.events;
-
+// Gives the engine's record sink one H.264 stream of the camera's size (with `bitRate` when it is
+// not 0) and the clip's name.
+void prepareRecord(IMFCaptureEngine* engine, const std::string& clip, UINT32 bitRate) {
   IMFCaptureSource* source = nullptr;
   IMFMediaType* deviceType = nullptr;
   EXPECT_EQ(engine->GetSource(&source), S_OK);
   EXPECT_EQ(source->GetCurrentDeviceMediaType(MF_CAPTURE_ENGINE_PREFERRED_SOURCE_STREAM_FOR_VIDEO_RECORD, &deviceType),
             S_OK);
-  GUID subtype = GUID_NULL;
-  deviceType->GetGUID(MF_MT_SUBTYPE, &subtype);
-  EXPECT_EQ(subtype, MFVideoFormat_H264);
-
   IMFMediaType* recordType = nullptr;
   MFCreateMediaType(&recordType);
   deviceType->CopyAllItems(recordType);
+  recordType->SetGUID(MF_MT_SUBTYPE, MFVideoFormat_H264);
   if (bitRate) recordType->SetUINT32(MF_MT_AVG_BITRATE, bitRate);
   IMFCaptureSink* sink = nullptr;
   IMFCaptureRecordSink* recordSink = nullptr;
   EXPECT_EQ(engine->GetSink(MF_CAPTURE_ENGINE_SINK_TYPE_RECORD, &sink), S_OK);
   EXPECT_EQ(sink->QueryInterface(IID_IMFCaptureRecordSink, reinterpret_cast<void**>(&recordSink)), S_OK);
   DWORD index = 0;
+  EXPECT_EQ(recordSink->RemoveAllStreams(), S_OK);
   EXPECT_EQ(recordSink->AddStream(MF_CAPTURE_ENGINE_PREFERRED_SOURCE_STREAM_FOR_VIDEO_RECORD, recordType, nullptr, &index),
             S_OK);
   EXPECT_EQ(recordSink->SetOutputFileName(platform::widen(clip).c_str()), S_OK);
-  EXPECT_EQ(engine->StartRecord(), S_OK);
-  EXPECT_EQ(events->waitFor(MF_CAPTURE_ENGINE_RECORD_STARTED), S_OK);
-  EXPECT_EQ(events->waitFor(MF_CAPTURE_ENGINE_ERROR), MF_E_VIDEO_RECORDING_DEVICE_INVALIDATED);
-
   for (IUnknown* object : std::initializer_list<IUnknown*>{recordSink, sink, recordType, deviceType, source})
     object->Release();
+}
+
+GUID deviceSubtype(IMFCaptureEngine* engine) {
+  IMFCaptureSource* source = nullptr;
+  IMFMediaType* deviceType = nullptr;
+  GUID subtype = GUID_NULL;
+  EXPECT_EQ(engine->GetSource(&source), S_OK);
+  EXPECT_EQ(source->GetCurrentDeviceMediaType(MF_CAPTURE_ENGINE_PREFERRED_SOURCE_STREAM_FOR_VIDEO_RECORD, &deviceType),
+            S_OK);
+  deviceType->GetGUID(MF_MT_SUBTYPE, &subtype);
+  deviceType->Release();
+  source->Release();
+  return subtype;
+}
+
+void record(const std::string& camera, const std::string& clip, UINT32 bitRate) {
+  InitializedEngine initialized(platform::widen("h264:" + camera));
+  EXPECT_EQ(deviceSubtype(initialized.engine), MFVideoFormat_H264);
+  prepareRecord(initialized.engine, clip, bitRate);
+  EXPECT_EQ(initialized.engine->StartRecord(), S_OK);
+  EXPECT_EQ(initialized.events->waitFor(MF_CAPTURE_ENGINE_RECORD_STARTED), S_OK);
+  EXPECT_EQ(initialized.events->waitFor(MF_CAPTURE_ENGINE_ERROR), MF_E_VIDEO_RECORDING_DEVICE_INVALIDATED);
 }
 
 TEST(LinuxCaptureEngine, H264CameraIsRecordedAsItSendsItFromItsFirstKeyFrame) {
@@ -145,7 +171,11 @@ TEST(LinuxCaptureEngine, H264CameraIsRecordedAsItSendsItFromItsFirstKeyFrame) {
   EXPECT_EQ(video.codec, "h264");
   EXPECT_EQ(video.profile, FF_PROFILE_H264_HIGH);  // the camera's; the engine's own encoding is Baseline
   ASSERT_EQ(video.packets.size(), keys.size());
-  for (size_t i = 0; i < video.packets.size(); ++i) EXPECT_NEAR(video.packets[i].time, i / 30.0, 1e-3) << "packet " << i;
+  // The first packet opens the clip at 0; the others keep the camera's spacing after it, placed
+  // by when the camera's first one came (the device opens after the start).
+  EXPECT_EQ(video.packets[0].time, 0.0);
+  for (size_t i = 2; i < video.packets.size(); ++i)
+    EXPECT_NEAR(video.packets[i].time - video.packets[i - 1].time, 1 / 30.0, 1e-3) << "packet " << i;
   EXPECT_EQ(media::containerKeys(clip), keys);
   const media::Decoded decoded = media::decode(clip, AVMEDIA_TYPE_VIDEO);
   EXPECT_EQ(decoded.errors, 0);
@@ -296,6 +326,113 @@ TEST(LinuxCaptureEngine, APictureACallbackKeepsIsNotOverwrittenByTheNextOnes) {
   EXPECT_TRUE(now == atDelivery);
   for (IUnknown* object : std::initializer_list<IUnknown*>{type, previewSink, sink, callback})
     object->Release();
+}
+
+// Odd sizes are recorded at the next even size, the last column and row repeated.
+TEST(LinuxCaptureEngine, OddPicturesArePaddedToEvenWithTheirLastColumnAndRow) {
+  EXPECT_EQ(platform::evenpicture::evenSize(1), 2);
+  EXPECT_EQ(platform::evenpicture::evenSize(32), 32);
+  EXPECT_EQ(platform::evenpicture::evenSize(33), 34);
+  // 3x3 pixels whose four bytes are all their index.
+  std::vector<uint8_t> source;
+  for (uint8_t pixel = 0; pixel < 9; ++pixel) source.insert(source.end(), 4, pixel);
+  std::vector<uint8_t> padded(4 * 4 * 4, 0xEE);
+  platform::evenpicture::pad(source.data(), 3, 3, padded.data());
+  const uint8_t expected[4][4] = {{0, 1, 2, 2}, {3, 4, 5, 5}, {6, 7, 8, 8}, {6, 7, 8, 8}};
+  for (int y = 0; y < 4; ++y)
+    for (int x = 0; x < 4; ++x)
+      for (int byte = 0; byte < 4; ++byte) EXPECT_EQ(padded[(y * 4 + x) * 4 + byte], expected[y][x]) << x << "," << y;
+}
+
+// Test cameras take generators and drawing filters; anything else, file readers and writers
+// above all, is refused, however its graph is written.
+TEST(LinuxCaptureEngine, TestCameraGraphsTakeOnlyGeneratorsAndDrawingFilters) {
+  using platform::testcamera::filterNames;
+  using platform::testcamera::refusedFilter;
+  EXPECT_EQ(filterNames("testsrc2=size=640x480:rate=30, drawbox=x=0:y=0:w=320:h=60:color=red:t=fill"),
+            (std::vector<std::string>{"testsrc2", "drawbox"}));
+  EXPECT_EQ(filterNames("color@bg=c=red[a];[a]scale=w='iw\\,2':h=2[out]"),
+            (std::vector<std::string>{"color", "scale"}));
+  for (const char* graph : {"testsrc2=size=640x480:rate=30", "color=c=red:size=1x1:rate=30", "smptebars",
+                            "mandelbrot=size=320x240", "color=c=blue:size=320x240,drawbox=x=0:y=0:w=9:h=9:t=fill",
+                            "testsrc=d=5,format=yuyv422,realtime"})
+    EXPECT_EQ(refusedFilter(graph), "") << graph;
+  const std::pair<const char*, const char*> refused[] = {
+      {"movie=/etc/passwd", "movie"},
+      {"amovie=/tmp/a.wav", "amovie"},
+      {"color=c=red,drawtext=textfile=/etc/shadow", "drawtext"},
+      {"testsrc2,metadata=mode=print:file=/tmp/out", "metadata"},
+      {"testsrc2 , 'mov'ie=/etc/passwd", "movie"},  // spaces and quotes do not hide a filter
+      {"[in]movie=/etc/passwd", "movie"},
+      {"testsrc2;movie=/etc/passwd[b]", "movie"},
+      {"drawbox", "drawbox"},  // a filter with no source
+      {"", "(no name)"},
+  };
+  for (const auto& [graph, filter] : refused) EXPECT_EQ(refusedFilter(graph), filter) << graph;
+}
+
+// A handle closed while another thread waits on it keeps its object until that wait returns (under
+// AddressSanitizer a freed object in use fails the run).
+TEST(LinuxCaptureEngine, AnEventClosedWhileWaitedOnLivesUntilTheWaitEnds) {
+  HANDLE event = CreateEventA(nullptr, FALSE, FALSE, nullptr);
+  ASSERT_NE(event, nullptr);
+  std::mutex mutex;
+  std::condition_variable entered;
+  bool waiting = false;
+  DWORD result = WAIT_FAILED;
+  std::thread waiter([&] {
+    {
+      std::lock_guard<std::mutex> lock(mutex);
+      waiting = true;
+    }
+    entered.notify_all();
+    result = WaitForSingleObject(event, 300);
+  });
+  {
+    std::unique_lock<std::mutex> lock(mutex);
+    entered.wait(lock, [&] { return waiting; });
+  }
+  std::this_thread::sleep_for(std::chrono::milliseconds(30));
+  EXPECT_TRUE(CloseHandle(event));  // nobody can signal it now: the wait ends by its time-out
+  waiter.join();
+  EXPECT_EQ(result, static_cast<DWORD>(WAIT_TIMEOUT));
+}
+
+// Clips started and stopped back to back, the second stopped the moment it started: the engine
+// answers each command in order, and each clip is a file of its own with the pictures of its time.
+TEST(LinuxCaptureEngine, BackToBackClipsAreAnsweredInOrderAndEachIsAFile) {
+  MediaFoundation started;
+  media::TempFolder folder;
+  InitializedEngine initialized(L"lavfi:testsrc2=size=64x48:rate=30");
+  IMFCaptureEngine* engine = initialized.engine;
+  Events* events = initialized.events;
+  const std::string clips[] = {folder.file("first.mp4"), folder.file("second.mp4")};
+
+  prepareRecord(engine, clips[0], 200000);
+  EXPECT_EQ(engine->StartRecord(), S_OK);
+  EXPECT_EQ(events->waitFor(MF_CAPTURE_ENGINE_RECORD_STARTED), S_OK);
+  std::this_thread::sleep_for(std::chrono::milliseconds(300));
+  EXPECT_EQ(engine->StopRecord(TRUE, FALSE), S_OK);
+  EXPECT_EQ(events->waitFor(MF_CAPTURE_ENGINE_RECORD_STOPPED), S_OK);
+  prepareRecord(engine, clips[1], 200000);
+  EXPECT_EQ(engine->StartRecord(), S_OK);
+  EXPECT_EQ(events->waitFor(MF_CAPTURE_ENGINE_RECORD_STARTED, 2), S_OK);
+  EXPECT_EQ(engine->StopRecord(TRUE, FALSE), S_OK);
+  EXPECT_EQ(events->waitFor(MF_CAPTURE_ENGINE_RECORD_STOPPED, 2), S_OK);
+  const std::vector<GUID> order{MF_CAPTURE_ENGINE_INITIALIZED, MF_CAPTURE_ENGINE_RECORD_STARTED,
+                                MF_CAPTURE_ENGINE_RECORD_STOPPED, MF_CAPTURE_ENGINE_RECORD_STARTED,
+                                MF_CAPTURE_ENGINE_RECORD_STOPPED};
+  EXPECT_TRUE(events->types() == order);
+
+  for (const std::string& clip : clips) {
+    const media::File file = media::probe(clip);
+    ASSERT_TRUE(file.opened) << clip;
+    ASSERT_EQ(file.streams.size(), 1u);
+    const media::Decoded decoded = media::decode(clip, AVMEDIA_TYPE_VIDEO);
+    EXPECT_EQ(decoded.errors, 0);
+    EXPECT_GE(decoded.frames, 1) << clip;
+  }
+  EXPECT_GE(media::decode(clips[0], AVMEDIA_TYPE_VIDEO).frames, 5);  // 300 ms at 30 a second, give or take a few
 }
 
 }  // namespace

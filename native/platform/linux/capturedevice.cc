@@ -126,8 +126,8 @@ GUID videoSubtype(const AVCodecParameters* codec) {
 
 }  // namespace
 
-HRESULT openInput(Device& device, std::unique_ptr<Input>& result) {
-  auto input = std::make_unique<Input>();
+HRESULT openInput(Device& device, std::shared_ptr<Input>& result) {
+  auto input = std::make_shared<Input>();
   const AVInputFormat* format = av_find_input_format(device.formatName.c_str());
   if (!format) return MF_E_NO_CAPTURE_DEVICES_AVAILABLE;
   AVDictionary* options = nullptr;
@@ -143,6 +143,11 @@ HRESULT openInput(Device& device, std::unique_ptr<Input>& result) {
     url += device.encodesH264 ? ",format=yuv420p,realtime" : ",format=yuyv422,realtime";
   }
   int error = avformat_open_input(&input->format, url.c_str(), format, &options);
+  if (error < 0 && device.formatName == "lavfi" && !device.encodesH264) {
+    // Some generators cannot make 4:2:2 pictures one pixel wide: such a camera sends BGRA.
+    url = device.url + ",format=bgra,realtime";
+    error = avformat_open_input(&input->format, url.c_str(), format, &options);
+  }
   av_dict_free(&options);
   if (error < 0) return device.video ? MF_E_VIDEO_RECORDING_DEVICE_INVALIDATED : MF_E_AUDIO_RECORDING_DEVICE_INVALIDATED;
   if (avformat_find_stream_info(input->format, nullptr) < 0) return MF_E_INVALID_STREAM_DATA;

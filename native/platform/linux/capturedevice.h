@@ -53,14 +53,14 @@ struct Device {
   int rate = 48000;  // microphones: what to ask the server for
   int channels = 2;
   DeviceFormat current;
-  std::unique_ptr<Input> input;
+  std::shared_ptr<Input> input;  // shared with the device's reader while it reads
 };
 
 // The device behind a device object (an IMFActivate or an IMFAttributes with its link), or null.
 std::unique_ptr<Device> deviceFrom(IUnknown* object, bool video);
 
 // Opens the device, learns its current format into device.current and readies its decoder.
-HRESULT openInput(Device& device, std::unique_ptr<Input>& result);
+HRESULT openInput(Device& device, std::shared_ptr<Input>& result);
 
 // Asks a device that encodes H.264 for a key frame at its next picture.
 void requestKeyFrame(Device& device);

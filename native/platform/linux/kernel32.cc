@@ -5,7 +5,9 @@
 #include <dbus/dbus.h>
 #include <unistd.h>
 
+#include <atomic>
 #include <chrono>
+#include <cstdint>
 #include <condition_variable>
 #include <cstdio>
 #include <mutex>
@@ -13,9 +15,35 @@
 
 namespace {
 
-// What a HANDLE of this layer points at; CloseHandle deletes it through the virtual destructor.
+// What a HANDLE of this layer points at. The handle holds one reference and every wait or
+// signal in progress another, so CloseHandle while another thread waits leaves the object alive
+// until that wait returns, as closing a handle does on Windows.
 struct KernelObject {
   virtual ~KernelObject() = default;
+  std::atomic<uint32_t> references{1};
+};
+
+void release(KernelObject* object) {
+  if (object->references.fetch_sub(1, std::memory_order_acq_rel) == 1) delete object;
+}
+
+// A reference to the object behind a handle for the length of one call.
+template <class T>
+class Held {
+ public:
+  explicit Held(T* object) : object_(object) {
+    if (object_) object_->references.fetch_add(1, std::memory_order_relaxed);
+  }
+  ~Held() {
+    if (object_) release(object_);
+  }
+  Held(const Held&) = delete;
+  Held& operator=(const Held&) = delete;
+  T* operator->() const { return object_; }
+  explicit operator bool() const { return object_ != nullptr; }
+
+ private:
+  T* object_;
 };
 
 struct Event : KernelObject {
@@ -63,7 +91,7 @@ HANDLE CreateEventA(LPSECURITY_ATTRIBUTES, BOOL manualReset, BOOL initialState, 
 }
 
 BOOL SetEvent(HANDLE handle) {
-  Event* event = as<Event>(handle);
+  Held<Event> event(as<Event>(handle));
   if (!event) {
     SetLastError(ERROR_INVALID_HANDLE);
     return FALSE;
@@ -80,7 +108,7 @@ BOOL SetEvent(HANDLE handle) {
 }
 
 BOOL ResetEvent(HANDLE handle) {
-  Event* event = as<Event>(handle);
+  Held<Event> event(as<Event>(handle));
   if (!event) {
     SetLastError(ERROR_INVALID_HANDLE);
     return FALSE;
@@ -91,13 +119,13 @@ BOOL ResetEvent(HANDLE handle) {
 }
 
 DWORD WaitForSingleObject(HANDLE handle, DWORD milliseconds) {
-  Event* event = as<Event>(handle);
+  Held<Event> event(as<Event>(handle));
   if (!event) {
     SetLastError(ERROR_INVALID_HANDLE);
     return WAIT_FAILED;
   }
   std::unique_lock<std::mutex> lock(event->mutex);
-  auto ready = [event] { return event->signalled; };
+  auto ready = [&event] { return event->signalled; };
   if (milliseconds == INFINITE) {
     event->changed.wait(lock, ready);
   } else if (!event->changed.wait_for(lock, std::chrono::milliseconds(milliseconds), ready)) {
@@ -112,7 +140,22 @@ BOOL CloseHandle(HANDLE handle) {
     SetLastError(ERROR_INVALID_HANDLE);
     return FALSE;
   }
-  delete static_cast<KernelObject*>(handle);
+  release(static_cast<KernelObject*>(handle));
+  return TRUE;
+}
+
+HANDLE GetCurrentProcess() { return INVALID_HANDLE_VALUE; }  // Windows' pseudo handle has the same value
+
+BOOL DuplicateHandle(HANDLE sourceProcess, HANDLE source, HANDLE targetProcess, HANDLE* target, DWORD, BOOL,
+                     DWORD options) {
+  // Handles of this process only, with the access they have.
+  if (sourceProcess != GetCurrentProcess() || targetProcess != GetCurrentProcess() || !target ||
+      invalid(source) || !(options & DUPLICATE_SAME_ACCESS)) {
+    SetLastError(ERROR_INVALID_PARAMETER);
+    return FALSE;
+  }
+  static_cast<KernelObject*>(source)->references.fetch_add(1, std::memory_order_relaxed);
+  *target = source;
   return TRUE;
 }
 

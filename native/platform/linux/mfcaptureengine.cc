@@ -1,9 +1,10 @@
 // The capture engine on Linux. One engine thread per engine opens the device (capturedevice.h)
-// while a preview or a recording runs, decodes what it reads, hands ARGB32 pictures and PCM
-// buffers to the preview sink's callbacks, feeds the record sink's sink writer, and delivers the
-// engine's events to its event callback. Callers only queue commands. A camera that sends H.264
-// is recorded as it sends it when the record stream asks for H.264 without a bit rate of its
-// own; its pictures are still decoded for the preview.
+// while a preview or a recording runs, decodes what the device's reader (devicereader.h) hands
+// over, gives ARGB32 pictures and PCM buffers to the preview sink's callbacks, feeds the record
+// sink's sink writer, and delivers the engine's events to its event callback. Callers only queue
+// commands, and since the thread never reads a device itself, it takes them between two packets.
+// A camera that sends H.264 is recorded as it sends it when the record stream asks for H.264
+// without a bit rate of its own; its pictures are still decoded for the preview.
 #include <pthread.h>
 
 extern "C" {
@@ -28,6 +29,8 @@ extern "C" {
 #include <vector>
 
 #include "platform/linux/capturedevice.h"
+#include "platform/linux/devicereader.h"
+#include "platform/linux/evenpicture.h"
 #include "platform/linux/mfattributes.h"
 #include "platform/linux/mfcapture.h"
 
@@ -142,40 +145,72 @@ struct SinkStream {
   ComPtr<IMFCaptureEngineOnSampleCallback> callback;
 };
 
-// The record sink's writer and its converters, alive from record start to record stop.
+// One clip: the record sink's writer and its converters, from record start until the file is
+// finished. A clip covers the wall-clock interval from the StartRecord call to the StopRecord
+// call: what the devices captured in it goes in, a picture lasts until the next one (the last one
+// until the stop), and sound missing at the ends is silence.
 struct Recording {
-  ~Recording() {
-    sws_freeContext(scaler);
-    swr_free(&resampler);
-  }
+  ~Recording() { swr_free(&resampler); }
   ComPtr<IMFSinkWriter> writer;
+  int64_t startAt = 0;     // wall clock (µs) of the StartRecord call
+  int64_t stopAt = 0;      // of the StopRecord call; 0 while it records
+  HRESULT failure = S_OK;  // the first write that failed; nothing is written after it
   DWORD videoStream = 0;
   DWORD audioStream = 0;
   bool hasVideo = false;
   bool hasAudio = false;
   bool videoPassthrough = false;  // the device's H.264 packets go into the file as they are
-  LONGLONG nextVideoTime = 0;     // passthrough: where a packet without a time goes
-  SwsContext* scaler = nullptr;
+  bool padded = false;            // an odd-sized picture is encoded at the next even size
+  int width = 0;                  // the device's picture size
+  int height = 0;
+  LONGLONG frameDuration = 0;     // at the device's frame rate
+  // The last picture, written when the next one shows how long it lasted.
+  ComPtr<IMFSample> held;
+  LONGLONG heldTime = 0;
+  int64_t firstDeviceTime = AV_NOPTS_VALUE;  // the device's time of the clip's first picture
+  int64_t firstReadAt = 0;                   // and the wall clock (µs) when it was read
+  bool videoDone = false;                    // a picture from after the stop has come
   SwrContext* resampler = nullptr;
   int audioRate = 0;
   int audioChannels = 0;
-  int64_t firstVideoPts = AV_NOPTS_VALUE;
   LONGLONG audioSamples = 0;
-  int64_t audioReachedAt = INT64_MIN;  // wall clock (µs) just after the last sound read
+  int64_t audioReachedAt = INT64_MIN;  // wall clock (µs) up to which sound has come
 };
 
 enum class Command { StartPreview, StopPreview, StartRecord, StopRecord, Quit };
+
+// A command as it was given: when, and for a record start the sink's settings at that moment.
+struct Order {
+  Order(Command command, int64_t at) : command(command), at(at) {}
+  Command command;
+  int64_t at;  // av_gettime() of the call
+  std::string path;
+  std::vector<SinkStream> streams;
+};
+
+// What a device's reader handed over: a packet, or the failure that ended its reads.
+struct Arrival {
+  uint64_t generation = 0;  // of the device's opening; packets of an earlier one are dropped
+  bool video = false;
+  AVPacket* packet = nullptr;
+  int64_t readAt = 0;
+  int error = 0;
+};
 
 bool isVideoStream(DWORD index) {
   return index == MF_CAPTURE_ENGINE_PREFERRED_SOURCE_STREAM_FOR_VIDEO_PREVIEW ||
          index == MF_CAPTURE_ENGINE_PREFERRED_SOURCE_STREAM_FOR_VIDEO_RECORD;
 }
 
-// Everything the engine, its source, its sinks and its thread share.
+// Everything the engine, its source, its sinks, its thread and the device readers share.
 struct EngineState {
+  ~EngineState() {
+    for (Arrival& arrival : arrivals) av_packet_free(&arrival.packet);
+  }
   std::mutex mutex;
   std::condition_variable changed;
-  std::deque<Command> commands;
+  std::deque<Order> commands;
+  std::deque<Arrival> arrivals;
   bool initialized = false;
   HRESULT initStatus = S_OK;
   ComPtr<IMFCaptureEngineOnEventCallback> events;
@@ -185,11 +220,7 @@ struct EngineState {
   std::vector<SinkStream> recordStreams;
   std::string recordPath;
   bool previewing = false;
-  std::unique_ptr<Recording> recording;
-  // When StopRecord was called (av_gettime); 0 while no stop is pending. A microphone's read can
-  // return late with sound captured after it, which does not belong in the file.
-  int64_t stopRequestedAt = 0;
-  int64_t startRequestedAt = 0;  // likewise, sound captured before StartRecord was called
+  bool recording = false;  // a clip has started and its StopRecord has not been taken yet
   std::thread::id threadId;
 
   // The device behind a source stream index, or null.
@@ -206,6 +237,9 @@ struct EngineState {
   }
 };
 
+constexpr int64_t videoGrace = 250000;  // µs after the stop to wait for the stop's picture
+constexpr int64_t soundGrace = 500000;  // and for its sound, which may come in large lumps
+
 class EngineThread {
  public:
   explicit EngineThread(std::shared_ptr<EngineState> state) : state_(std::move(state)) {}
@@ -215,30 +249,43 @@ class EngineThread {
   void send(const GUID& type, HRESULT status);
   HRESULT openDevices();
   void closeDevices();
-  HRESULT startRecording();
-  void stopRecording();
-  void readSoundUntilStop();
+  void execute(Order& order);
+  HRESULT startRecording(const Order& order);
+  void stopRecording(int64_t at);
+  void finishDue(bool all);
+  HRESULT finish(Recording& recording);
+  int64_t nextDeadline() const;
   void fail(HRESULT status);
-  void readOnce(Device& device);
-  void receive(Device& device, AVPacket* packet);
-  void passThrough(const AVPacket* packet, AVRational timeBase);
+  void arrive(Arrival& arrival);
+  void receive(Device& device, AVPacket* packet, int64_t readAt);
+  void passThrough(Recording& recording, const AVPacket* packet, AVRational timeBase, int64_t readAt);
   const AVFrame* unpacked(const AVFrame* frame);
   IMFMediaBuffer* pictureBuffer(DWORD length);
-  void deliverVideo(AVFrame* frame, int64_t pts, AVRational timeBase);
+  void deliverVideo(AVFrame* frame, int64_t pts, AVRational timeBase, int64_t readAt);
   void deliverAudio(AVFrame* frame, int64_t pts, AVRational timeBase);
-  void recordSound(AVFrame* frame, int64_t pts, AVRational timeBase);
+  void recordPicture(Recording& recording, IMFSample* picture, LONGLONG deviceTime, int64_t readAt);
+  void writeHeld(Recording& recording, LONGLONG duration);
+  void recordSound(Recording& recording, AVFrame* frame, int64_t capturedAt);
+  void writeSound(Recording& recording, const uint8_t* data, int samples);
+  void write(Recording& recording, DWORD stream, IMFSample* sample);
+  std::vector<Recording*> recordings();
 
   std::shared_ptr<EngineState> state_;
+  std::unique_ptr<Recording> current_;                   // the clip being recorded
+  std::vector<std::unique_ptr<Recording>> finishing_;    // stopped clips waiting for their last data
+  std::unique_ptr<capturedevice::DeviceReader> readers_[2];  // video, audio
+  uint64_t generations_[2] = {0, 0};
   SwsContext* previewScaler_ = nullptr;
   SwsContext* unpacker_ = nullptr;  // packed 4:2:2 pictures into planar_
   AVFrame* planar_ = nullptr;
-  SwrContext* previewConverter_ = nullptr;
-  AVPacket* packet_ = nullptr;
   AVFrame* frame_ = nullptr;
-  // The buffer of the last picture, used again when nothing else holds it any more (the preview
-  // copies a picture, the sink writer encodes it at once): a new one for each picture costs the
-  // kernel a fresh zeroed page for every 4 KB of it.
-  ComPtr<IMFMediaBuffer> picture_;
+  // Picture buffers, used again when nothing else holds them any more (the preview copies a
+  // picture, the sink writer encodes it at once): a new one for each picture costs the kernel a
+  // fresh zeroed page for every 4 KB of it.
+  std::vector<ComPtr<IMFMediaBuffer>> pictures_;
+  ComPtr<IMFSample> lastPicture_;  // the picture current now, which a clip starting now opens with
+  LONGLONG lastPictureTime_ = 0;
+  int64_t lastPictureReadAt_ = 0;
   AVFrame* lastSound_ = nullptr;  // the microphone's last buffer
 };
 
@@ -255,47 +302,79 @@ void EngineThread::send(const GUID& type, HRESULT status) {
 }
 
 HRESULT EngineThread::openDevices() {
-  for (Device* device : {state_->video.get(), state_->audio.get()}) {
+  Device* devices[2] = {state_->video.get(), state_->audio.get()};
+  for (int i = 0; i < 2; ++i) {
+    Device* device = devices[i];
     if (!device || device->input) continue;
     HRESULT hr = openInput(*device, device->input);
-    if (FAILED(hr)) return hr;
+    if (FAILED(hr)) {
+      device->input.reset();
+      return hr;
+    }
+    const uint64_t generation = ++generations_[i];
+    const bool video = device->video;
+    std::weak_ptr<EngineState> weak = state_;
+    readers_[i] = std::make_unique<capturedevice::DeviceReader>(
+        device->input,
+        [weak, generation, video](AVPacket* packet, int64_t readAt, int error) {
+          std::shared_ptr<EngineState> state = weak.lock();
+          if (!state) {
+            av_packet_free(&packet);
+            return;
+          }
+          {
+            std::lock_guard<std::mutex> lock(state->mutex);
+            state->arrivals.push_back({generation, video, packet, readAt, error});
+          }
+          state->changed.notify_all();
+        },
+        device->formatName == "v4l2");
   }
   return S_OK;
 }
 
 void EngineThread::closeDevices() {
-  for (Device* device : {state_->video.get(), state_->audio.get()})
-    if (device) device->input.reset();
-  picture_ = ComPtr<IMFMediaBuffer>();
+  Device* devices[2] = {state_->video.get(), state_->audio.get()};
+  for (int i = 0; i < 2; ++i) {
+    readers_[i].reset();
+    ++generations_[i];  // whatever the old reader still hands over is dropped
+    if (devices[i]) devices[i]->input.reset();
+  }
+  pictures_.clear();
+  lastPicture_ = ComPtr<IMFSample>();
   av_frame_unref(lastSound_);
   sws_freeContext(previewScaler_);
   previewScaler_ = nullptr;
   sws_freeContext(unpacker_);
   unpacker_ = nullptr;
   av_frame_free(&planar_);
-  swr_free(&previewConverter_);
 }
 
-HRESULT EngineThread::startRecording() {
-  std::vector<SinkStream> streams;
-  std::string path;
-  {
-    std::lock_guard<std::mutex> lock(state_->mutex);
-    streams = state_->recordStreams;
-    path = state_->recordPath;
-  }
-  if (path.empty() || streams.empty()) return MF_E_INVALIDREQUEST;
+std::vector<Recording*> EngineThread::recordings() {
+  std::vector<Recording*> all;
+  for (auto& recording : finishing_) all.push_back(recording.get());
+  if (current_) all.push_back(current_.get());
+  return all;
+}
+
+HRESULT EngineThread::startRecording(const Order& order) {
+  if (order.path.empty() || order.streams.empty()) return MF_E_INVALIDREQUEST;
   auto recording = std::make_unique<Recording>();
-  const std::wstring url = widen(path);
-  HRESULT hr = MFCreateSinkWriterFromURL(url.c_str(), nullptr, nullptr, &recording->writer.p);
-  for (const SinkStream& stream : streams) {
+  recording->startAt = order.at;
+  const std::wstring url = widen(order.path);
+  // Fragmented MP4: what was written before a failed write (a full disk) stays a file that plays.
+  ComPtr<IMFAttributes> settings;
+  HRESULT hr = MFCreateAttributes(&settings.p, 1);
+  if (SUCCEEDED(hr)) hr = settings->SetGUID(MF_TRANSCODE_CONTAINERTYPE, MFTranscodeContainerType_FMPEG4);
+  if (SUCCEEDED(hr)) hr = MFCreateSinkWriterFromURL(url.c_str(), nullptr, settings.p, &recording->writer.p);
+  for (const SinkStream& stream : order.streams) {
     if (FAILED(hr)) break;
     Device* device = stream.video ? state_->video.get() : state_->audio.get();
     const DeviceFormat& f = device->current;
     DWORD index = 0;
-    hr = recording->writer->AddStream(stream.type.p, &index);
+    ComPtr<IMFMediaType> output(stream.type.p, true);
     ComPtr<IMFMediaType> input;
-    if (SUCCEEDED(hr)) hr = MFCreateMediaType(&input.p);
+    hr = MFCreateMediaType(&input.p);
     if (FAILED(hr)) break;
     GUID wanted = GUID_NULL;
     UINT32 bitRate = 0;
@@ -313,19 +392,27 @@ HRESULT EngineThread::startRecording() {
       if (SUCCEEDED(hr) && delivered->extradata_size > 0)
         hr = input->SetBlob(MF_MT_MPEG_SEQUENCE_HEADER, delivered->extradata,
                             static_cast<UINT32>(delivered->extradata_size));
-      recording->videoStream = index;
-      recording->hasVideo = true;
       recording->videoPassthrough = true;
     } else if (stream.video) {
-      // The encoder is given top-down BGRA rows, as the preview gets them.
-      hr = input->SetGUID(MF_MT_MAJOR_TYPE, MFMediaType_Video);
+      // The encoder is given top-down BGRA rows at the device's size, made even (see evenpicture.h).
+      const int width = evenpicture::evenSize(f.width);
+      const int height = evenpicture::evenSize(f.height);
+      recording->padded = width != f.width || height != f.height;
+      // libx264 counts its rate in whole kbit/s: a tiny picture's estimate would be none at all.
+      constexpr UINT32 lowestBitRate = 1000;
+      const bool slow = SUCCEEDED(stream.type->GetUINT32(MF_MT_AVG_BITRATE, &bitRate)) && bitRate < lowestBitRate;
+      if (recording->padded || slow) {
+        hr = MFCreateMediaType(&output.p);
+        if (SUCCEEDED(hr)) hr = stream.type->CopyAllItems(output.p);
+        if (SUCCEEDED(hr)) hr = MFSetAttributeSize(output.p, MF_MT_FRAME_SIZE, width, height);
+        if (SUCCEEDED(hr) && slow) hr = output->SetUINT32(MF_MT_AVG_BITRATE, lowestBitRate);
+      }
+      if (SUCCEEDED(hr)) hr = input->SetGUID(MF_MT_MAJOR_TYPE, MFMediaType_Video);
       if (SUCCEEDED(hr)) hr = input->SetGUID(MF_MT_SUBTYPE, MFVideoFormat_RGB32);
-      if (SUCCEEDED(hr)) hr = MFSetAttributeSize(input.p, MF_MT_FRAME_SIZE, f.width, f.height);
+      if (SUCCEEDED(hr)) hr = MFSetAttributeSize(input.p, MF_MT_FRAME_SIZE, width, height);
       if (SUCCEEDED(hr)) hr = MFSetAttributeRatio(input.p, MF_MT_FRAME_RATE, f.rate.num, f.rate.den);
-      if (SUCCEEDED(hr)) hr = input->SetUINT32(MF_MT_DEFAULT_STRIDE, static_cast<UINT32>(f.width * 4));
+      if (SUCCEEDED(hr)) hr = input->SetUINT32(MF_MT_DEFAULT_STRIDE, static_cast<UINT32>(width * 4));
       if (SUCCEEDED(hr)) hr = input->SetUINT32(MF_MT_INTERLACE_MODE, MFVideoInterlace_Progressive);
-      recording->videoStream = index;
-      recording->hasVideo = true;
     } else {
       UINT32 rate = 0, channels = 0;
       stream.type->GetUINT32(MF_MT_AUDIO_SAMPLES_PER_SECOND, &rate);
@@ -341,47 +428,111 @@ HRESULT EngineThread::startRecording() {
       if (SUCCEEDED(hr)) hr = input->SetUINT32(MF_MT_AUDIO_BITS_PER_SAMPLE, 16);
       if (SUCCEEDED(hr)) hr = input->SetUINT32(MF_MT_AUDIO_BLOCK_ALIGNMENT, 2 * channels);
       if (SUCCEEDED(hr)) hr = input->SetUINT32(MF_MT_AUDIO_AVG_BYTES_PER_SECOND, 2 * channels * rate);
+    }
+    if (SUCCEEDED(hr)) hr = recording->writer->AddStream(output.p, &index);
+    if (SUCCEEDED(hr)) hr = recording->writer->SetInputMediaType(index, input.p, nullptr);
+    if (FAILED(hr)) break;
+    if (stream.video) {
+      recording->videoStream = index;
+      recording->hasVideo = true;
+      recording->width = f.width;
+      recording->height = f.height;
+      recording->frameDuration = av_rescale(ticksPerSecond, f.rate.den, f.rate.num);
+    } else {
       recording->audioStream = index;
       recording->hasAudio = true;
     }
-    if (SUCCEEDED(hr)) hr = recording->writer->SetInputMediaType(index, input.p, nullptr);
   }
   if (SUCCEEDED(hr)) hr = recording->writer->BeginWriting();
   if (FAILED(hr)) return hr;
-  // The file starts at a key frame: ask for one now rather than wait for the device's next.
-  if (recording->videoPassthrough) requestKeyFrame(*state_->video);
-  state_->recording = std::move(recording);
+  if (recording->videoPassthrough) {
+    // The file starts at a key frame: ask for one now rather than wait for the device's next.
+    requestKeyFrame(*state_->video);
+  } else if (recording->hasVideo && lastPicture_) {
+    // The picture current at the start opens the clip.
+    recording->held = lastPicture_;
+    recording->firstDeviceTime = lastPictureTime_;
+    recording->firstReadAt = lastPictureReadAt_;
+  }
+  // The microphone's last buffer may hold sound from after the start.
+  if (recording->hasAudio && lastSound_->nb_samples > 0 && state_->audio && state_->audio->input)
+    recordSound(*recording, lastSound_,
+                av_rescale_q(timeOf(lastSound_), state_->audio->input->timeBase, AVRational{1, 1000000}));
+  current_ = std::move(recording);
   return S_OK;
 }
 
-void EngineThread::stopRecording() {
-  if (!state_->recording) return;
-  state_->recording->writer->Finalize();
-  state_->recording.reset();
+void EngineThread::stopRecording(int64_t at) {
+  if (!current_) return;
+  current_->stopAt = std::max(at, current_->startAt);
+  finishing_.push_back(std::move(current_));
+  finishDue(false);
 }
 
-// Sound reaches the engine some time after it was captured, and a source may hand over seconds
-// of it at once: before the file is closed, the microphone is read on until the sound of the
-// moment StopRecord was called has arrived, for a few seconds at most.
-void EngineThread::readSoundUntilStop() {
-  Device* audio = state_->audio.get();
-  int64_t stopAt = 0;
-  {
-    std::lock_guard<std::mutex> lock(state_->mutex);
-    stopAt = state_->stopRequestedAt;
+// When the next stopped clip must be finished whatever has come (wall clock, µs); 0: none waits.
+int64_t EngineThread::nextDeadline() const {
+  int64_t next = 0;
+  for (const auto& recording : finishing_) {
+    const int64_t due = recording->stopAt + (recording->hasAudio ? soundGrace : videoGrace);
+    if (!next || due < next) next = due;
   }
-  const int64_t deadline = av_gettime_relative() + 3 * AV_TIME_BASE;
-  while (stopAt && audio && audio->input && state_->recording && state_->recording->hasAudio &&
-         state_->recording->audioReachedAt < stopAt && av_gettime_relative() < deadline)
-    readOnce(*audio);
+  return next;
 }
 
-// A device that stops answering ends preview and recording, as a vanished camera does.
+// Finishes the stopped clips whose last picture and sound have come, or whose grace has run out
+// (all: every one, now), and answers each StopRecord once its file is complete.
+void EngineThread::finishDue(bool all) {
+  const int64_t now = av_gettime();
+  for (auto it = finishing_.begin(); it != finishing_.end();) {
+    Recording& recording = **it;
+    const bool pictures = !recording.hasVideo || recording.videoDone || FAILED(recording.failure);
+    const bool sound = !recording.hasAudio || recording.audioReachedAt >= recording.stopAt || FAILED(recording.failure);
+    const int64_t due = recording.stopAt + (recording.hasAudio ? soundGrace : videoGrace);
+    if (!all && !(pictures && sound) && now < due) {
+      ++it;
+      continue;
+    }
+    const HRESULT hr = finish(recording);
+    it = finishing_.erase(it);
+    send(MF_CAPTURE_ENGINE_RECORD_STOPPED, hr);
+  }
+}
+
+// The last picture held until the stop, sound missing at the end as silence, then the file's end.
+HRESULT EngineThread::finish(Recording& recording) {
+  const LONGLONG length = recording.stopAt ? (recording.stopAt - recording.startAt) * 10 : 0;
+  if (recording.held) {
+    const LONGLONG rest = length - recording.heldTime;
+    writeHeld(recording, rest > 0 ? rest : recording.frameDuration);
+  }
+  if (recording.hasAudio && recording.stopAt && SUCCEEDED(recording.failure)) {
+    // At least one sample, so that even a clip stopped at once is a file that plays.
+    const LONGLONG wanted = std::max<LONGLONG>(1, av_rescale(recording.stopAt - recording.startAt, recording.audioRate, 1000000));
+    std::vector<uint8_t> silence(static_cast<size_t>(recording.audioRate / 10) * recording.audioChannels * 2, 0);
+    while (recording.audioSamples < wanted && SUCCEEDED(recording.failure))
+      writeSound(recording, silence.data(),
+                 static_cast<int>(std::min<LONGLONG>(wanted - recording.audioSamples, recording.audioRate / 10)));
+  }
+  const HRESULT finalized = recording.writer->Finalize();
+  return FAILED(recording.failure) ? recording.failure : finalized;
+}
+
+void EngineThread::write(Recording& recording, DWORD stream, IMFSample* sample) {
+  if (FAILED(recording.failure)) return;
+  const HRESULT hr = recording.writer->WriteSample(stream, sample);
+  if (FAILED(hr)) recording.failure = hr;
+}
+
+// A device that stops answering ends preview and recording, as a vanished camera does; the
+// clips keep what was written.
 void EngineThread::fail(HRESULT status) {
-  stopRecording();
+  if (current_) finishing_.push_back(std::move(current_));
+  for (auto& recording : finishing_) finish(*recording);
+  finishing_.clear();
   {
     std::lock_guard<std::mutex> lock(state_->mutex);
     state_->previewing = false;
+    state_->recording = false;
   }
   closeDevices();
   send(MF_CAPTURE_ENGINE_ERROR, status);
@@ -412,36 +563,41 @@ const AVFrame* EngineThread::unpacked(const AVFrame* frame) {
   return planar_;
 }
 
-// The last picture's buffer when nothing else holds it any more and it is large enough, else a
-// new one; null if none could be made.
+// A picture buffer that nothing else holds any more and that is large enough, else a new one;
+// null if none could be made.
 IMFMediaBuffer* EngineThread::pictureBuffer(DWORD length) {
-  if (picture_) {
-    picture_->AddRef();
+  for (auto& buffer : pictures_) {
+    buffer->AddRef();
     DWORD room = 0;
-    if (picture_->Release() > 1 || FAILED(picture_->GetMaxLength(&room)) || room < length) picture_ = ComPtr<IMFMediaBuffer>();
+    if (buffer->Release() == 1 && SUCCEEDED(buffer->GetMaxLength(&room)) && room >= length) return buffer.p;
   }
-  if (!picture_ && FAILED(MFCreateMemoryBuffer(length, &picture_.p))) return nullptr;
-  return picture_.p;
+  ComPtr<IMFMediaBuffer> made;
+  if (FAILED(MFCreateMemoryBuffer(length, &made.p))) return nullptr;
+  // A clip holds a picture until the next, the engine the current one, a preview one more.
+  if (pictures_.size() < 4) pictures_.push_back(made);
+  else pictures_[pictures_.size() - 1] = made;
+  return made.p;
 }
 
-void EngineThread::deliverVideo(AVFrame* frame, int64_t pts, AVRational timeBase) {
-  const int width = frame->width;
-  const int height = frame->height;
+// Pictures go to the preview and into the clips at the size the device was found with: a device
+// that changes its size mid-stream is scaled back to it.
+void EngineThread::deliverVideo(AVFrame* frame, int64_t pts, AVRational timeBase, int64_t readAt) {
+  const DeviceFormat& f = state_->video->current;
+  const int width = f.width;
+  const int height = f.height;
+  if (width <= 0 || height <= 0 || frame->width <= 0 || frame->height <= 0) return;
   const DWORD length = static_cast<DWORD>(width * height * 4);
   const AVFrame* picture = unpacked(frame);
   if (!picture) return;
-  previewScaler_ = sws_getCachedContext(previewScaler_, width, height, static_cast<AVPixelFormat>(picture->format), width,
-                                        height, AV_PIX_FMT_BGRA, SWS_POINT, nullptr, nullptr, nullptr);
+  const bool sameSize = frame->width == width && frame->height == height;
+  previewScaler_ = sws_getCachedContext(previewScaler_, frame->width, frame->height,
+                                        static_cast<AVPixelFormat>(picture->format), width, height, AV_PIX_FMT_BGRA,
+                                        sameSize ? SWS_POINT : SWS_BILINEAR, nullptr, nullptr, nullptr);
   if (!previewScaler_) return;
-  Recording* recording = state_->recording.get();
-  if (recording && recording->videoPassthrough) recording = nullptr;  // the file has the device's packets
-  const AVRational rate = state_->video->current.rate;
+  const AVRational rate = f.rate;
   const LONGLONG duration = av_rescale(ticksPerSecond, rate.den, rate.num);
-  LONGLONG time = av_rescale_q(pts, timeBase, AVRational{1, static_cast<int>(ticksPerSecond)});
-  if (recording && recording->hasVideo) {
-    if (recording->firstVideoPts == AV_NOPTS_VALUE) recording->firstVideoPts = time;
-    time -= recording->firstVideoPts;
-  }
+  const LONGLONG time = pts != AV_NOPTS_VALUE ? av_rescale_q(pts, timeBase, AVRational{1, static_cast<int>(ticksPerSecond)})
+                                              : (readAt * 10);
 
   IMFMediaBuffer* buffer = pictureBuffer(length);
   if (!buffer) return;
@@ -449,9 +605,12 @@ void EngineThread::deliverVideo(AVFrame* frame, int64_t pts, AVRational timeBase
   HRESULT hr = fillSample(buffer, length, time, duration, [&](BYTE* data) {
     uint8_t* planes[1] = {data};
     int strides[1] = {width * 4};
-    sws_scale(previewScaler_, picture->data, picture->linesize, 0, height, planes, strides);
+    sws_scale(previewScaler_, picture->data, picture->linesize, 0, frame->height, planes, strides);
   }, &sample.p);
   if (FAILED(hr)) return;
+  lastPicture_ = sample;
+  lastPictureTime_ = time;
+  lastPictureReadAt_ = readAt;
 
   std::vector<ComPtr<IMFCaptureEngineOnSampleCallback>> callbacks;
   bool previewing;
@@ -463,7 +622,62 @@ void EngineThread::deliverVideo(AVFrame* frame, int64_t pts, AVRational timeBase
   }
   if (previewing)
     for (auto& callback : callbacks) callback->OnSample(sample.p);
-  if (recording && recording->hasVideo) recording->writer->WriteSample(recording->videoStream, sample.p);
+  for (Recording* recording : recordings()) recordPicture(*recording, sample.p, time, readAt);
+}
+
+// Where a picture goes in its clip: its device time, which is steadier than the moments reads
+// return, counted from the clip's first picture, placed by when that one was read, and never
+// after its own read (a first picture read late would push the rest past the stop). The first
+// picture itself is shown from the start.
+LONGLONG clipTime(const Recording& recording, LONGLONG deviceTime, int64_t readAt) {
+  return std::min<LONGLONG>(deviceTime - recording.firstDeviceTime + (recording.firstReadAt - recording.startAt) * 10,
+                            (readAt - recording.startAt) * 10);
+}
+
+// A picture read before the clip's start (it waited behind a command) replaces the opening one;
+// from then on each picture writes the one before it, now that its length is known.
+void EngineThread::recordPicture(Recording& recording, IMFSample* picture, LONGLONG deviceTime, int64_t readAt) {
+  if (!recording.hasVideo || recording.videoPassthrough || recording.videoDone || FAILED(recording.failure)) return;
+  if (recording.stopAt && readAt >= recording.stopAt) {
+    recording.videoDone = true;
+    return;
+  }
+  if (!recording.held || readAt < recording.startAt) {
+    recording.held = ComPtr<IMFSample>(picture, true);
+    recording.heldTime = 0;
+    recording.firstDeviceTime = deviceTime;
+    recording.firstReadAt = readAt;
+    return;
+  }
+  LONGLONG time = clipTime(recording, deviceTime, readAt);
+  if (time <= recording.heldTime) time = recording.heldTime + recording.frameDuration;  // the device's clock jumped back
+  writeHeld(recording, time - recording.heldTime);
+  recording.held = ComPtr<IMFSample>(picture, true);
+  recording.heldTime = time;
+}
+
+void EngineThread::writeHeld(Recording& recording, LONGLONG duration) {
+  ComPtr<IMFSample> sample = recording.held;
+  recording.held = ComPtr<IMFSample>();
+  if (!sample || FAILED(recording.failure)) return;
+  if (recording.padded) {
+    // The encoder takes the even size: a copy with the last column and row repeated.
+    const int width = evenpicture::evenSize(recording.width);
+    const int height = evenpicture::evenSize(recording.height);
+    ComPtr<IMFMediaBuffer> source;
+    BYTE* data = nullptr;
+    if (FAILED(sample->GetBufferByIndex(0, &source.p)) || FAILED(source->Lock(&data, nullptr, nullptr))) return;
+    ComPtr<IMFSample> copy;
+    const HRESULT hr = makeSample(static_cast<DWORD>(width * height * 4), 0, 0, [&](BYTE* to) {
+      evenpicture::pad(data, recording.width, recording.height, to);
+    }, &copy.p);
+    source->Unlock();
+    if (FAILED(hr)) return;
+    sample = copy;
+  }
+  sample->SetSampleTime(recording.heldTime);
+  sample->SetSampleDuration(duration);
+  write(recording, recording.videoStream, sample.p);
 }
 
 void EngineThread::deliverAudio(AVFrame* frame, int64_t pts, AVRational timeBase) {
@@ -473,10 +687,12 @@ void EngineThread::deliverAudio(AVFrame* frame, int64_t pts, AVRational timeBase
   const DWORD length = static_cast<DWORD>(frame->nb_samples * channels * 2);
   const LONGLONG duration = av_rescale(frame->nb_samples, ticksPerSecond, f.sampleRate);
 
-  // Kept for a recording that is asked for while the device's next read is already waiting.
+  // Kept for a clip that starts while this buffer's sound is still current.
   av_frame_unref(lastSound_);
   av_frame_ref(lastSound_, frame);
-  recordSound(frame, pts, timeBase);
+  // The pulse input stamps a packet with the wall clock (µs) of its first sample.
+  const int64_t capturedAt = av_rescale_q(pts, timeBase, AVRational{1, 1000000});
+  for (Recording* recording : recordings()) recordSound(*recording, frame, capturedAt);
 
   if (interleaved16) {
     std::vector<ComPtr<IMFCaptureEngineOnSampleCallback>> callbacks;
@@ -496,92 +712,110 @@ void EngineThread::deliverAudio(AVFrame* frame, int64_t pts, AVRational timeBase
   }
 }
 
-void EngineThread::recordSound(AVFrame* frame, int64_t pts, AVRational timeBase) {
-  Recording* recording = state_->recording.get();
+// Only what was captured between the clip's start and stop goes in, cut inside the buffer, since a
+// source may deliver seconds in one; a clip whose first sound comes after its start begins with
+// silence up to it.
+void EngineThread::recordSound(Recording& recording, AVFrame* frame, int64_t capturedAt) {
+  if (!recording.hasAudio || FAILED(recording.failure)) return;
   const int channels = frame->ch_layout.nb_channels;
-  int64_t stopAt = 0;
-  int64_t startAt = 0;
-  {
-    std::lock_guard<std::mutex> lock(state_->mutex);
-    stopAt = state_->stopRequestedAt;
-    startAt = state_->startRequestedAt;
-  }
-  // The pulse input stamps a packet with the wall clock (µs) of its first sample. Only what was
-  // captured between StartRecord and StopRecord goes into the file, cut inside the packet, since
-  // a source may deliver seconds in one.
-  const int64_t captured = av_rescale_q(pts, timeBase, AVRational{1, 1000000});
   const int rate = frame->sample_rate;
   const int count = frame->nb_samples;
+  if (rate <= 0 || count <= 0) return;
+  const int64_t end = capturedAt + av_rescale(count, 1000000, rate);
+  const int64_t startAt = recording.startAt;
+  const int64_t stopAt = recording.stopAt;
   int first = 0;
   int last = count;
-  if (captured < startAt) first = static_cast<int>(std::min<int64_t>(count, av_rescale_rnd(startAt - captured, rate, 1000000, AV_ROUND_UP)));
-  if (stopAt) last = static_cast<int>(std::clamp<int64_t>(av_rescale(stopAt - captured, rate, 1000000), 0, count));
-  if (recording) recording->audioReachedAt = captured + av_rescale(count, 1000000, rate);
-  if (recording && recording->hasAudio && last > first) {
-    if (!recording->resampler) {
-      AVChannelLayout out;
-      av_channel_layout_default(&out, recording->audioChannels);
-      swr_alloc_set_opts2(&recording->resampler, &out, AV_SAMPLE_FMT_S16, recording->audioRate, &frame->ch_layout,
-                          static_cast<AVSampleFormat>(frame->format), frame->sample_rate, 0, nullptr);
-      av_channel_layout_uninit(&out);
-      if (!recording->resampler || swr_init(recording->resampler) < 0) return;
+  if (capturedAt < startAt) first = static_cast<int>(std::min<int64_t>(count, av_rescale_rnd(startAt - capturedAt, rate, 1000000, AV_ROUND_UP)));
+  if (stopAt) last = static_cast<int>(std::clamp<int64_t>(av_rescale(stopAt - capturedAt, rate, 1000000), 0, count));
+  if (stopAt && recording.audioReachedAt >= stopAt) return;  // the clip has all its sound
+  recording.audioReachedAt = std::max(recording.audioReachedAt, end);
+  if (last <= first) return;
+  if (!recording.resampler) {
+    AVChannelLayout out;
+    av_channel_layout_default(&out, recording.audioChannels);
+    swr_alloc_set_opts2(&recording.resampler, &out, AV_SAMPLE_FMT_S16, recording.audioRate, &frame->ch_layout,
+                        static_cast<AVSampleFormat>(frame->format), frame->sample_rate, 0, nullptr);
+    av_channel_layout_uninit(&out);
+    if (!recording.resampler || swr_init(recording.resampler) < 0) {
+      recording.failure = MF_E_INVALIDMEDIATYPE;
+      return;
     }
-    const AVSampleFormat format = static_cast<AVSampleFormat>(frame->format);
-    const bool planar = av_sample_fmt_is_planar(format);
-    const int skip = first * av_get_bytes_per_sample(format) * (planar ? 1 : channels);
-    std::vector<const uint8_t*> in(planar ? channels : 1);
-    for (size_t plane = 0; plane < in.size(); ++plane) in[plane] = frame->extended_data[plane] + skip;
-    const int room = swr_get_out_samples(recording->resampler, last - first);
-    std::vector<uint8_t> converted(static_cast<size_t>(room) * recording->audioChannels * 2);
-    uint8_t* out[1] = {converted.data()};
-    const int made = swr_convert(recording->resampler, out, room, in.data(), last - first);
-    if (made <= 0) return;
-    const DWORD bytes = static_cast<DWORD>(made * recording->audioChannels * 2);
-    const LONGLONG time = av_rescale(recording->audioSamples, ticksPerSecond, recording->audioRate);
-    const LONGLONG span = av_rescale(made, ticksPerSecond, recording->audioRate);
-    recording->audioSamples += made;
-    ComPtr<IMFSample> sample;
-    if (SUCCEEDED(makeSample(bytes, time, span, [&](BYTE* data) { std::memcpy(data, converted.data(), bytes); },
-                             &sample.p)))
-      recording->writer->WriteSample(recording->audioStream, sample.p);
+    if (capturedAt > startAt) {
+      const int64_t gap = av_rescale(capturedAt - startAt, recording.audioRate, 1000000);
+      std::vector<uint8_t> silence(static_cast<size_t>(std::max<int64_t>(gap, 0)) * recording.audioChannels * 2, 0);
+      if (gap > 0) writeSound(recording, silence.data(), static_cast<int>(gap));
+    }
   }
+  const AVSampleFormat format = static_cast<AVSampleFormat>(frame->format);
+  const bool planar = av_sample_fmt_is_planar(format);
+  const int skip = first * av_get_bytes_per_sample(format) * (planar ? 1 : channels);
+  std::vector<const uint8_t*> in(planar ? channels : 1);
+  for (size_t plane = 0; plane < in.size(); ++plane) in[plane] = frame->extended_data[plane] + skip;
+  const int room = swr_get_out_samples(recording.resampler, last - first);
+  std::vector<uint8_t> converted(static_cast<size_t>(room) * recording.audioChannels * 2);
+  uint8_t* out[1] = {converted.data()};
+  const int made = swr_convert(recording.resampler, out, room, in.data(), last - first);
+  if (made > 0) writeSound(recording, converted.data(), made);
 }
 
-// Writes a packet of an H.264 device into a passthrough recording as it came. The clip starts
-// at 0 with the first key frame after the recording started: what comes before it cannot be
-// decoded without the pictures it refers to.
-void EngineThread::passThrough(const AVPacket* packet, AVRational timeBase) {
-  Recording* recording = state_->recording.get();
-  if (!recording || !recording->videoPassthrough) return;
-  const bool key = (packet->flags & AV_PKT_FLAG_KEY) != 0;
-  if (recording->firstVideoPts == AV_NOPTS_VALUE && !key) return;
-  const AVRational rate = state_->video->current.rate;
-  const AVRational ticks{1, static_cast<int>(ticksPerSecond)};
-  const LONGLONG duration =
-      packet->duration > 0 ? av_rescale_q(packet->duration, timeBase, ticks) : av_rescale(ticksPerSecond, rate.den, rate.num);
-  const int64_t pts = packet->pts != AV_NOPTS_VALUE ? packet->pts : packet->dts;
-  LONGLONG time = recording->nextVideoTime;
-  if (pts != AV_NOPTS_VALUE) {
-    time = av_rescale_q(pts, timeBase, ticks);
-    if (recording->firstVideoPts == AV_NOPTS_VALUE) recording->firstVideoPts = time;
-    time -= recording->firstVideoPts;
-  } else if (recording->firstVideoPts == AV_NOPTS_VALUE) {
-    recording->firstVideoPts = 0;  // no time to start from: the packets follow one another
+// Interleaved 16-bit samples at the clip's rate, placed after the ones before.
+void EngineThread::writeSound(Recording& recording, const uint8_t* data, int samples) {
+  const DWORD bytes = static_cast<DWORD>(samples * recording.audioChannels * 2);
+  const LONGLONG time = av_rescale(recording.audioSamples, ticksPerSecond, recording.audioRate);
+  const LONGLONG span = av_rescale(samples, ticksPerSecond, recording.audioRate);
+  recording.audioSamples += samples;
+  ComPtr<IMFSample> sample;
+  if (SUCCEEDED(makeSample(bytes, time, span, [&](BYTE* to) { std::memcpy(to, data, bytes); }, &sample.p)))
+    write(recording, recording.audioStream, sample.p);
+}
+
+// Writes a packet of an H.264 device into a passthrough clip as it came. The clip starts at 0
+// with the first key frame after it started: what comes before cannot be decoded without the
+// pictures it refers to.
+void EngineThread::passThrough(Recording& recording, const AVPacket* packet, AVRational timeBase, int64_t readAt) {
+  if (!recording.videoPassthrough || recording.videoDone || FAILED(recording.failure)) return;
+  if (recording.stopAt && readAt >= recording.stopAt) {
+    recording.videoDone = true;
+    return;
   }
-  recording->nextVideoTime = time + duration;
+  const bool key = (packet->flags & AV_PKT_FLAG_KEY) != 0;
+  const bool started = recording.held || recording.heldTime > 0;
+  if (!started && !key) return;
+  const AVRational ticks{1, static_cast<int>(ticksPerSecond)};
+  const LONGLONG duration = packet->duration > 0 ? av_rescale_q(packet->duration, timeBase, ticks) : recording.frameDuration;
+  const int64_t pts = packet->pts != AV_NOPTS_VALUE ? packet->pts : packet->dts;
+  const LONGLONG deviceTime = pts != AV_NOPTS_VALUE ? av_rescale_q(pts, timeBase, ticks) : AV_NOPTS_VALUE;
 
   const DWORD length = static_cast<DWORD>(packet->size);
   ComPtr<IMFSample> sample;
-  HRESULT hr = makeSample(length, time, duration, [&](BYTE* data) { std::memcpy(data, packet->data, length); }, &sample.p);
+  HRESULT hr = makeSample(length, 0, duration, [&](BYTE* data) { std::memcpy(data, packet->data, length); }, &sample.p);
   if (SUCCEEDED(hr) && key) hr = sample->SetUINT32(MFSampleExtension_CleanPoint, TRUE);
-  if (SUCCEEDED(hr)) recording->writer->WriteSample(recording->videoStream, sample.p);
+  if (FAILED(hr)) return;
+  if (!started) {
+    recording.held = sample;
+    recording.heldTime = 0;
+    recording.firstDeviceTime = deviceTime;
+    recording.firstReadAt = readAt;
+    recording.frameDuration = duration;
+    return;
+  }
+  LONGLONG time = recording.heldTime + recording.frameDuration;  // no time of its own: the packets follow one another
+  if (deviceTime != AV_NOPTS_VALUE && recording.firstDeviceTime != AV_NOPTS_VALUE &&
+      clipTime(recording, deviceTime, readAt) > recording.heldTime)
+    time = clipTime(recording, deviceTime, readAt);
+  writeHeld(recording, time - recording.heldTime);
+  recording.held = sample;
+  recording.heldTime = time;
+  recording.frameDuration = duration;
 }
 
-// One packet as the device delivered it: into a passthrough recording as it is, and decoded for
-// the preview and the recordings that encode.
-void EngineThread::receive(Device& device, AVPacket* packet) {
+// One packet as the device delivered it: into passthrough clips as it is, and decoded for the
+// preview and the clips that encode.
+void EngineThread::receive(Device& device, AVPacket* packet, int64_t readAt) {
   Input& input = *device.input;
-  if (device.video) passThrough(packet, input.timeBase);
+  if (device.video)
+    for (Recording* recording : recordings()) passThrough(*recording, packet, input.timeBase, readAt);
   if (!input.keyFrameSeen) {
     // Pictures that refer to ones never received only make the decoder complain.
     if (input.delivered->codec_id == AV_CODEC_ID_H264 && !(packet->flags & AV_PKT_FLAG_KEY)) return;
@@ -591,27 +825,78 @@ void EngineThread::receive(Device& device, AVPacket* packet) {
   while (avcodec_receive_frame(input.decoder, frame_) >= 0) {
     const int64_t pts = timeOf(frame_);
     if (device.video)
-      deliverVideo(frame_, pts, input.timeBase);
+      deliverVideo(frame_, pts, input.timeBase, readAt);
     else
       deliverAudio(frame_, pts, input.timeBase);
     av_frame_unref(frame_);
   }
 }
 
-void EngineThread::readOnce(Device& device) {
-  Input& input = *device.input;
-  int error = av_read_frame(input.format, packet_);
-  if (error == AVERROR(EAGAIN)) return;
-  if (error < 0) {
-    fail(device.video ? MF_E_VIDEO_RECORDING_DEVICE_INVALIDATED : MF_E_AUDIO_RECORDING_DEVICE_INVALIDATED);
+void EngineThread::arrive(Arrival& arrival) {
+  const int index = arrival.video ? 0 : 1;
+  Device* device = arrival.video ? state_->video.get() : state_->audio.get();
+  if (arrival.generation != generations_[index] || !device || !device->input) return;  // from a closed reader
+  if (arrival.error) {
+    fail(arrival.video ? MF_E_VIDEO_RECORDING_DEVICE_INVALIDATED : MF_E_AUDIO_RECORDING_DEVICE_INVALIDATED);
     return;
   }
-  if (packet_->stream_index == input.stream) input.deliver(packet_, [&](AVPacket* delivered) { receive(device, delivered); });
-  av_packet_unref(packet_);
+  Input& input = *device->input;
+  if (arrival.packet->stream_index == input.stream)
+    input.deliver(arrival.packet, [&](AVPacket* delivered) { receive(*device, delivered, arrival.readAt); });
+  if (current_ && FAILED(current_->failure)) {
+    // A write failed (a full disk): the clip ends here with what it has, and says so.
+    finishing_.push_back(std::move(current_));
+    {
+      std::lock_guard<std::mutex> lock(state_->mutex);
+      state_->recording = false;
+    }
+    finishDue(true);
+  }
+}
+
+void EngineThread::execute(Order& order) {
+  switch (order.command) {
+    case Command::StartPreview: {
+      HRESULT hr = SUCCEEDED(state_->initStatus) ? openDevices() : state_->initStatus;
+      {
+        std::lock_guard<std::mutex> lock(state_->mutex);
+        state_->previewing = SUCCEEDED(hr);
+      }
+      send(MF_CAPTURE_ENGINE_PREVIEW_STARTED, hr);
+      break;
+    }
+    case Command::StopPreview: {
+      {
+        std::lock_guard<std::mutex> lock(state_->mutex);
+        state_->previewing = false;
+      }
+      send(MF_CAPTURE_ENGINE_PREVIEW_STOPPED, S_OK);
+      break;
+    }
+    case Command::StartRecord: {
+      HRESULT hr = current_ ? MF_E_INVALIDREQUEST : SUCCEEDED(state_->initStatus) ? openDevices() : state_->initStatus;
+      if (SUCCEEDED(hr)) hr = startRecording(order);
+      {
+        std::lock_guard<std::mutex> lock(state_->mutex);
+        state_->recording = current_ != nullptr;
+      }
+      send(MF_CAPTURE_ENGINE_RECORD_STARTED, hr);
+      break;
+    }
+    case Command::StopRecord:
+      // A clip that already ended on a failed write has had its answer.
+      {
+        std::lock_guard<std::mutex> lock(state_->mutex);
+        state_->recording = false;
+      }
+      stopRecording(order.at);
+      break;
+    case Command::Quit:
+      break;
+  }
 }
 
 void EngineThread::run() {
-  packet_ = av_packet_alloc();
   frame_ = av_frame_alloc();
   lastSound_ = av_frame_alloc();
 
@@ -632,77 +917,48 @@ void EngineThread::run() {
   state_->changed.notify_all();
   send(MF_CAPTURE_ENGINE_INITIALIZED, status);
 
-  for (;;) {
-    std::vector<Command> commands;
-    bool active;
+  // Commands first, then one packet at a time, so a command waits for one packet's work at most.
+  for (bool quit = false; !quit;) {
+    std::deque<Order> orders;
+    Arrival arrival;
+    bool hasArrival = false;
     {
       std::unique_lock<std::mutex> lock(state_->mutex);
-      if (!state_->previewing && !state_->recording)
-        state_->changed.wait(lock, [this] { return !state_->commands.empty(); });
-      commands.assign(state_->commands.begin(), state_->commands.end());
-      state_->commands.clear();
-    }
-    bool quit = false;
-    for (Command command : commands) {
-      switch (command) {
-        case Command::StartPreview: {
-          HRESULT hr = SUCCEEDED(state_->initStatus) ? openDevices() : state_->initStatus;
-          {
-            std::lock_guard<std::mutex> lock(state_->mutex);
-            state_->previewing = SUCCEEDED(hr);
-          }
-          send(MF_CAPTURE_ENGINE_PREVIEW_STARTED, hr);
-          break;
-        }
-        case Command::StopPreview: {
-          {
-            std::lock_guard<std::mutex> lock(state_->mutex);
-            state_->previewing = false;
-          }
-          send(MF_CAPTURE_ENGINE_PREVIEW_STOPPED, S_OK);
-          break;
-        }
-        case Command::StartRecord: {
-          HRESULT hr = SUCCEEDED(state_->initStatus) ? openDevices() : state_->initStatus;
-          {
-            std::lock_guard<std::mutex> lock(state_->mutex);
-            state_->stopRequestedAt = 0;
-          }
-          if (SUCCEEDED(hr) && !state_->recording) {
-            hr = startRecording();
-            // The device's last read may have ended after StartRecord was called, since commands
-            // wait for the read in progress: its sound from that moment on is the clip's start.
-            if (SUCCEEDED(hr) && lastSound_->nb_samples > 0 && state_->audio && state_->audio->input)
-              recordSound(lastSound_, timeOf(lastSound_), state_->audio->input->timeBase);
-          }
-          send(MF_CAPTURE_ENGINE_RECORD_STARTED, hr);
-          break;
-        }
-        case Command::StopRecord:
-          readSoundUntilStop();
-          stopRecording();
-          send(MF_CAPTURE_ENGINE_RECORD_STOPPED, S_OK);
-          break;
-        case Command::Quit:
-          quit = true;
-          break;
+      auto ready = [this] { return !state_->commands.empty() || !state_->arrivals.empty(); };
+      const int64_t deadline = nextDeadline();
+      if (deadline)
+        state_->changed.wait_for(lock, std::chrono::microseconds(std::max<int64_t>(0, deadline - av_gettime())), ready);
+      else
+        state_->changed.wait(lock, ready);
+      orders.swap(state_->commands);
+      if (orders.empty() && !state_->arrivals.empty()) {
+        arrival = state_->arrivals.front();
+        state_->arrivals.pop_front();
+        hasArrival = true;
       }
     }
-    if (quit) break;
+    for (Order& order : orders) {
+      if (order.command == Command::Quit) quit = true;
+      if (!quit) execute(order);
+    }
+    if (hasArrival) {
+      if (!quit) arrive(arrival);
+      av_packet_free(&arrival.packet);
+    }
+    finishDue(quit);
+    bool previewing;
     {
       std::lock_guard<std::mutex> lock(state_->mutex);
-      active = state_->previewing || state_->recording;
+      previewing = state_->previewing;
     }
-    if (!active) {
-      closeDevices();
-      continue;
-    }
-    for (Device* device : {state_->video.get(), state_->audio.get()})
-      if (device && device->input) readOnce(*device);
+    if (!previewing && !current_ && finishing_.empty()) closeDevices();
   }
-  stopRecording();
+  if (current_) {
+    current_->stopAt = av_gettime();
+    finishing_.push_back(std::move(current_));
+  }
+  finishDue(true);
   closeDevices();
-  av_packet_free(&packet_);
   av_frame_free(&frame_);
   av_frame_free(&lastSound_);
 }
@@ -887,7 +1143,7 @@ class CaptureEngine : public ComObject<IMFCaptureEngine, IID_IMFCaptureEngine> {
     if (!thread_.joinable()) return;
     {
       std::lock_guard<std::mutex> lock(state_->mutex);
-      state_->commands.push_back(Command::Quit);
+      state_->commands.push_back(Order(Command::Quit, 0));
     }
     state_->changed.notify_all();
     // Released from inside one of its own callbacks (an error event), the thread finishes alone.
@@ -924,20 +1180,8 @@ class CaptureEngine : public ComObject<IMFCaptureEngine, IID_IMFCaptureEngine> {
   }
   HRESULT StartPreview() override { return queue(Command::StartPreview); }
   HRESULT StopPreview() override { return queue(Command::StopPreview); }
-  HRESULT StartRecord() override {
-    {
-      std::lock_guard<std::mutex> lock(state_->mutex);
-      state_->startRequestedAt = av_gettime();
-    }
-    return queue(Command::StartRecord);
-  }
-  HRESULT StopRecord(BOOL, BOOL) override {
-    {
-      std::lock_guard<std::mutex> lock(state_->mutex);
-      state_->stopRequestedAt = av_gettime();
-    }
-    return queue(Command::StopRecord);
-  }
+  HRESULT StartRecord() override { return queue(Command::StartRecord); }
+  HRESULT StopRecord(BOOL, BOOL) override { return queue(Command::StopRecord); }
   HRESULT TakePhoto() override { return E_NOTIMPL; }
   HRESULT GetSink(MF_CAPTURE_ENGINE_SINK_TYPE type, IMFCaptureSink** sink) override {
     if (!sink) return E_POINTER;
@@ -964,11 +1208,18 @@ class CaptureEngine : public ComObject<IMFCaptureEngine, IID_IMFCaptureEngine> {
   }
 
  private:
+  // A command takes the moment of the call, and a record start the sink's settings as they are
+  // now: the thread may come to it later.
   HRESULT queue(Command command) {
     if (!thread_.joinable()) return MF_E_NOT_INITIALIZED;
     {
       std::lock_guard<std::mutex> lock(state_->mutex);
-      state_->commands.push_back(command);
+      Order order(command, av_gettime());
+      if (command == Command::StartRecord) {
+        order.path = state_->recordPath;
+        order.streams = state_->recordStreams;
+      }
+      state_->commands.push_back(std::move(order));
     }
     state_->changed.notify_all();
     return S_OK;

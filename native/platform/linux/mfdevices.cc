@@ -10,11 +10,15 @@
 #include <algorithm>
 #include <cstdlib>
 #include <cstring>
+#include <stdexcept>
 #include <string>
 #include <vector>
 
+#include "capture/check.h"
+#include "capture/log.h"
 #include "platform/linux/mfattributes.h"
 #include "platform/linux/mfcapture.h"
+#include "platform/linux/testcameragraph.h"
 
 namespace platform {
 
@@ -63,7 +67,8 @@ std::vector<Device> videoDevices() {
     close(fd);
   }
   // Test cameras: "Name=lavfi graph" entries separated by ';'; a graph written "h264:<graph>"
-  // makes a camera that sends H.264 (the engine reads the link "lavfi:h264:<graph>").
+  // makes a camera that sends H.264 (the engine reads the link "lavfi:h264:<graph>"). Graphs that
+  // could touch files are refused (testcameragraph.h).
   if (const char* list = std::getenv("TAVIO_TEST_CAMERAS")) {
     std::string text = list;
     size_t start = 0;
@@ -72,8 +77,24 @@ std::vector<Device> videoDevices() {
       if (end == std::string::npos) end = text.size();
       const std::string entry = text.substr(start, end - start);
       const size_t equals = entry.find('=');
-      if (equals != std::string::npos && equals > 0 && equals + 1 < entry.size())
-        devices.push_back({widen(entry.substr(0, equals)), widen("lavfi:" + entry.substr(equals + 1))});
+      if (equals != std::string::npos && equals > 0 && equals + 1 < entry.size()) {
+        const std::string graph = entry.substr(equals + 1);
+        static const char h264[] = "h264:";
+        const bool encodes = graph.compare(0, sizeof h264 - 1, h264) == 0;
+        const std::string refused = testcamera::refusedFilter(encodes ? graph.substr(sizeof h264 - 1) : graph);
+        if (refused.empty()) {
+          devices.push_back({widen(entry.substr(0, equals)), widen("lavfi:" + graph)});
+        } else {
+          // The camera is left out and the host is told why.
+          const std::string message = "Test camera " + entry.substr(0, equals) + " refused: \"" + refused +
+                                      "\" is not a picture generator or a drawing filter";
+          try {
+            capture::checkResult("native/platform/linux/mfdevices", 92, E_ACCESSDENIED, message.c_str());
+          } catch (const std::runtime_error& error) {
+            capture::logWarning(error.what());
+          }
+        }
+      }
       start = end + 1;
     }
   }

@@ -1,7 +1,10 @@
 #include "capture/video/camera/mfce/capturemanager.h"
 
 #include <new>
+#include <stdexcept>
 
+#include "capture/check.h"
+#include "capture/log.h"
 #include "capture/video/camera/mfce/mediatypes.h"
 #include "platform/user32.h"
 
@@ -19,6 +22,17 @@ void releaseAndClear(T*& object) {
   if (object) {
     object->Release();
     object = nullptr;
+  }
+}
+
+const char* const file = "native/capture/video/camera/mfce/capturemanager";
+
+// A failure the engine reports on its own thread, where nobody catches: a warning line.
+void warn(int32_t line, HRESULT hr, const char* message) {
+  try {
+    checkResult(file, line, hr, message);
+  } catch (const std::runtime_error& error) {
+    logWarning(error.what());
   }
 }
 
@@ -203,23 +217,49 @@ HRESULT CaptureManager::ConfigurePreview(UINT32& width, UINT32& height) {
   return hr;
 }
 
+CaptureManager::Mark::~Mark() {
+  if (event) CloseHandle(event);
+}
+
+void CaptureManager::mark(Mark& before) const {
+  for (int kind = 0; kind < EventKinds; ++kind) before.handled[kind] = handled_[kind].load();
+  if (engineEvent &&
+      !DuplicateHandle(GetCurrentProcess(), engineEvent, GetCurrentProcess(), &before.event, 0, FALSE,
+                       DUPLICATE_SAME_ACCESS))
+    before.event = nullptr;
+}
+
+// Every handled event signals engineEvent after counting itself, so a wait that finds its count
+// unchanged is released by a later signal. An engine error ends every wait: nothing else comes.
+void CaptureManager::waitFor(const Mark& before, EventKind kind) {
+  while (handled_[kind].load() == before.handled[kind] &&
+         handled_[EngineFailed].load() == before.handled[EngineFailed]) {
+    if (!before.event || WaitForSingleObject(before.event, INFINITE) != WAIT_OBJECT_0) return;
+  }
+}
+
 HRESULT CaptureManager::StartPreview(capture::video::FrameQueue* queue) {
   if (!engine) return MF_E_NOT_INITIALIZED;
   if (previewing) return S_OK;
   if (!frameQueue) frameQueue = queue;
+  Mark before;
+  mark(before);
   HRESULT hr = engine->StartPreview();
   if (!powerRequestSet && powerRequest != INVALID_HANDLE_VALUE)
     powerRequestSet = PowerSetRequest(powerRequest, PowerRequestExecutionRequired) == TRUE;
-  WaitForSingleObject(engineEvent, INFINITE);
+  // A call the engine refused has no event to wait for.
+  if (SUCCEEDED(hr)) waitFor(before, PreviewStarted);
   return hr;
 }
 
 HRESULT CaptureManager::StopPreview() {
   if (!engine) return MF_E_NOT_INITIALIZED;
   if (!previewing) return S_OK;
+  Mark before;
+  mark(before);
   HRESULT hr = engine->StopPreview();
   if (FAILED(hr)) return hr;
-  WaitForSingleObject(engineEvent, INFINITE);
+  waitFor(before, PreviewStopped);
   if (powerRequestSet && powerRequest != INVALID_HANDLE_VALUE) {
     PowerClearRequest(powerRequest, PowerRequestExecutionRequired);
     powerRequestSet = false;
@@ -296,8 +336,14 @@ HRESULT CaptureManager::StartRecord(LPCWSTR path) {
   if (SUCCEEDED(hr) && videoEncoding != GUID_NULL) hr = AddVideoRecordStream(source, recordSink);
   if (SUCCEEDED(hr) && audioEncoding != GUID_NULL) hr = AddAudioRecordStream(recordSink);
   if (SUCCEEDED(hr)) {
+    Mark before;
+    mark(before);
     hr = engine->StartRecord();
-    if (SUCCEEDED(hr)) WaitForSingleObject(engineEvent, INFINITE);
+    if (SUCCEEDED(hr)) {
+      waitFor(before, RecordStarted);
+      // The engine's answer says whether the file could be made: its failure is the start's.
+      if (handled_[RecordStarted].load() != before.handled[RecordStarted]) hr = recordStartStatus_.load();
+    }
   }
   releaseAndClear(sink);
   releaseAndClear(recordSink);
@@ -307,8 +353,10 @@ HRESULT CaptureManager::StartRecord(LPCWSTR path) {
 
 HRESULT CaptureManager::StopRecord() {
   if (!recording) return S_OK;
+  Mark before;
+  mark(before);
   HRESULT hr = engine->StopRecord(TRUE, FALSE);
-  WaitForSingleObject(engineEvent, INFINITE);
+  if (SUCCEEDED(hr)) waitFor(before, RecordStopped);
   return hr;
 }
 
@@ -320,15 +368,26 @@ HRESULT CaptureManager::HandleEngineEvent(IMFMediaEvent* event) {
       if (status == MF_E_NO_CAPTURE_DEVICES_AVAILABLE) status = S_OK;
     } else if (type == MF_CAPTURE_ENGINE_PREVIEW_STARTED) {
       previewing = SUCCEEDED(status);
+      ++handled_[PreviewStarted];
     } else if (type == MF_CAPTURE_ENGINE_PREVIEW_STOPPED) {
       previewing = false;
+      ++handled_[PreviewStopped];
     } else if (type == MF_CAPTURE_ENGINE_RECORD_STARTED) {
       recording = SUCCEEDED(status);
+      recordStartStatus_ = status;
+      ++handled_[RecordStarted];
     } else if (type == MF_CAPTURE_ENGINE_RECORD_STOPPED) {
+      // A failed stop is a write that failed: the file keeps what was written before it.
+      if (FAILED(status)) warn(402, status, "CaptureManager: the recording could not be written to the end");
       recording = false;
+      ++handled_[RecordStopped];
     } else if (type == MF_CAPTURE_ENGINE_PHOTO_TAKEN) {
       photoPending = false;
     } else if (type == MF_CAPTURE_ENGINE_ERROR) {
+      if (recording) warn(411, status, "CaptureManager: the device failed while recording");
+      // Waits in progress end before the handle goes; the handle keeps its object while they do.
+      ++handled_[EngineFailed];
+      SetEvent(engineEvent);
       DestroyEngine();
     }
   }

@@ -108,8 +108,28 @@ class CaptureManager {
   UINT resetToken = 0;
 
  private:
+  // Engine events handled so far, by kind. A wait ends when the event it waits for has been
+  // handled (or the engine failed), not at the next signal of engineEvent: a signal of an earlier
+  // event stays pending and would end it before the engine has answered.
+  enum EventKind { PreviewStarted, PreviewStopped, RecordStarted, RecordStopped, EngineFailed, EventKinds };
+  // The counts before a command, and a handle of the wait's own to engineEvent, so that an engine
+  // error closing the manager's handle meanwhile cannot take the event from under the wait.
+  struct Mark {
+    Mark() = default;
+    Mark(const Mark&) = delete;
+    Mark& operator=(const Mark&) = delete;
+    ~Mark();
+    uint32_t handled[EventKinds] = {};
+    HANDLE event = nullptr;
+  };
+  void mark(Mark& before) const;
+  void waitFor(const Mark& before, EventKind kind);
+
   HRESULT AddVideoRecordStream(IMFCaptureSource* source, IMFCaptureRecordSink* sink);
   HRESULT AddAudioRecordStream(IMFCaptureRecordSink* sink);
+
+  std::atomic<uint32_t> handled_[EventKinds] = {};
+  std::atomic<HRESULT> recordStartStatus_{S_OK};
 };
 
 }  // namespace capture::video::camera::mfce

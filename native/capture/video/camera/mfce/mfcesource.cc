@@ -127,11 +127,15 @@ void MFCESource::startEncode(std::string filename) {
   }
   log("MFCESource::startEncode() calling StartRecord");
   const std::wstring path = toWide(filename);
-  if (SUCCEEDED(captureManager->StartRecord(path.c_str()))) {
+  const HRESULT hr = captureManager->StartRecord(path.c_str());
+  if (SUCCEEDED(hr)) {
     capturing = true;
     log("MFCESource::startEncode() capture started");
   } else {
     log("MFCESource::startEncode() failed to start capture");
+    // A refused name, a file that cannot be made, a size the encoder takes not: the host hears why.
+    const std::string message = "MFCESource::startEncode() could not start capture of " + filename;
+    checkResult(file, 312, hr, message.c_str());
   }
 }
 
@@ -150,6 +154,7 @@ void MFCESource::stopEncode() {
     log("MFCESource::stopEncode() capture stopped");
   } else {
     log("MFCESource::stopEncode() failed to stop capture");
+    checkResult(file, 343, hr, "MFCESource::stopEncode() could not stop capture");
   }
 }
 

@@ -1,0 +1,16 @@
+// libx264 takes 4:2:0 pictures only, whose width and height must be even: a camera of an odd size
+// is recorded at the next even size, its last column and last row repeated into the added ones.
+#pragma once
+
+#include <cstdint>
+
+namespace platform::evenpicture {
+
+// The size rounded up to the next even number.
+int evenSize(int size);
+
+// Copies a 4-byte-per-pixel picture of width x height (rows of width * 4 bytes) into dst, whose
+// rows are evenSize(width) * 4 bytes and which has evenSize(height) rows.
+void pad(const uint8_t* source, int width, int height, uint8_t* dst);
+
+}  // namespace platform::evenpicture
