@@ -732,6 +732,13 @@ void EngineThread::recordSound(Recording& recording, AVFrame* frame, int64_t cap
   if (stopAt) last = static_cast<int>(std::clamp<int64_t>(av_rescale(stopAt - capturedAt, rate, 1000000), 0, count));
   if (stopAt && recording.audioReachedAt >= stopAt) return;  // the clip has all its sound
   recording.audioReachedAt = std::max(recording.audioReachedAt, end);
+  if (recording.resampler && last > first) {
+    // A source that stamps lumps of sound as if just captured gives stamps that overlap what the
+    // clip already has: that sound is not written twice (a few ms of jitter are let be).
+    const int64_t position = av_rescale(capturedAt - startAt, rate, 1000000) + first;
+    const int64_t have = av_rescale(recording.audioSamples, rate, recording.audioRate);
+    if (have - position > rate / 200) first = static_cast<int>(std::min<int64_t>(last, first + (have - position)));
+  }
   if (last <= first) return;
   if (!recording.resampler) {
     AVChannelLayout out;
