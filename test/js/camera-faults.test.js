@@ -114,10 +114,10 @@ test('camera recording faults', async (t) => {
       const started = Date.now();
       while (Date.now() - started < 20000 && fs.statfsSync(${JSON.stringify(small)}).bavail > 0) await sleep(100);
       await sleep(3000);  // the write that finds no room comes with the next fragment
-      addon.stopCapture(plain);
       const size = fs.statSync(${JSON.stringify(full)}).size;
       fs.copyFileSync(${JSON.stringify(full)}, ${JSON.stringify(path.join(dir, 'full-copy.mp4'))});
       fs.unlinkSync(${JSON.stringify(full)});
+      // The clip ended at the full disk: the next start needs no stop before it.
       addon.startCapture(plain, ${JSON.stringify(after)});
       await sleep(1000);
       addon.stopCapture(plain);

@@ -639,6 +639,8 @@ LONGLONG clipTime(const Recording& recording, LONGLONG deviceTime, int64_t readA
 void EngineThread::recordPicture(Recording& recording, IMFSample* picture, LONGLONG deviceTime, int64_t readAt) {
   if (!recording.hasVideo || recording.videoPassthrough || recording.videoDone || FAILED(recording.failure)) return;
   if (recording.stopAt && readAt >= recording.stopAt) {
+    // A clip stopped before the device's first picture came shows that picture all along.
+    if (!recording.held) recording.held = ComPtr<IMFSample>(picture, true);
     recording.videoDone = true;
     return;
   }
@@ -730,6 +732,13 @@ void EngineThread::recordSound(Recording& recording, AVFrame* frame, int64_t cap
   if (stopAt) last = static_cast<int>(std::clamp<int64_t>(av_rescale(stopAt - capturedAt, rate, 1000000), 0, count));
   if (stopAt && recording.audioReachedAt >= stopAt) return;  // the clip has all its sound
   recording.audioReachedAt = std::max(recording.audioReachedAt, end);
+  if (recording.resampler && last > first) {
+    // A source that stamps lumps of sound as if just captured gives stamps that overlap what the
+    // clip already has: that sound is not written twice (a few ms of jitter are let be).
+    const int64_t position = av_rescale(capturedAt - startAt, rate, 1000000) + first;
+    const int64_t have = av_rescale(recording.audioSamples, rate, recording.audioRate);
+    if (have - position > rate / 200) first = static_cast<int>(std::min<int64_t>(last, first + (have - position)));
+  }
   if (last <= first) return;
   if (!recording.resampler) {
     AVChannelLayout out;
@@ -775,12 +784,13 @@ void EngineThread::writeSound(Recording& recording, const uint8_t* data, int sam
 // pictures it refers to.
 void EngineThread::passThrough(Recording& recording, const AVPacket* packet, AVRational timeBase, int64_t readAt) {
   if (!recording.videoPassthrough || recording.videoDone || FAILED(recording.failure)) return;
-  if (recording.stopAt && readAt >= recording.stopAt) {
+  const bool key = (packet->flags & AV_PKT_FLAG_KEY) != 0;
+  const bool started = recording.held || recording.heldTime > 0;
+  const bool late = recording.stopAt && readAt >= recording.stopAt;
+  if (late && started) {
     recording.videoDone = true;
     return;
   }
-  const bool key = (packet->flags & AV_PKT_FLAG_KEY) != 0;
-  const bool started = recording.held || recording.heldTime > 0;
   if (!started && !key) return;
   const AVRational ticks{1, static_cast<int>(ticksPerSecond)};
   const LONGLONG duration = packet->duration > 0 ? av_rescale_q(packet->duration, timeBase, ticks) : recording.frameDuration;
@@ -793,11 +803,13 @@ void EngineThread::passThrough(Recording& recording, const AVPacket* packet, AVR
   if (SUCCEEDED(hr) && key) hr = sample->SetUINT32(MFSampleExtension_CleanPoint, TRUE);
   if (FAILED(hr)) return;
   if (!started) {
+    // The first key frame opens the clip, even one that came after the stop.
     recording.held = sample;
     recording.heldTime = 0;
     recording.firstDeviceTime = deviceTime;
     recording.firstReadAt = readAt;
     recording.frameDuration = duration;
+    recording.videoDone = late;
     return;
   }
   LONGLONG time = recording.heldTime + recording.frameDuration;  // no time of its own: the packets follow one another

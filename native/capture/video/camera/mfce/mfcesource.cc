@@ -121,6 +121,8 @@ void MFCESource::stopPreview() {
 void MFCESource::startEncode(std::string filename) {
   if (!captureManager)
     checkResult(file, 295, E_POINTER, "MFCESource::startEncode() could not start preview: bad pointer");
+  // A clip the engine ended by itself (a write that failed) leaves nothing to stop: a new one may start.
+  if (capturing && !captureManager->IsRecording()) capturing = false;
   if (capturing) {
     checkResult(file, 289, 1, "MFCESource::startEncode() could not start capture: already capturing");
     return;
