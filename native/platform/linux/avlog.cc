@@ -28,8 +28,10 @@ std::string prefix(void* context) {
   return line + ": ";
 }
 
+thread_local int quiet = 0;
+
 void logLine(void* context, int level, const char* format, va_list arguments) {
-  if (level > AV_LOG_ERROR) return;
+  if (level > AV_LOG_ERROR || quiet > 0) return;
   // FFmpeg writes some messages in pieces, the last one ending the line; each thread's pieces
   // are gathered into one warning.
   thread_local std::string pending;
@@ -55,6 +57,9 @@ void logLine(void* context, int level, const char* format, va_list arguments) {
 }
 
 }  // namespace
+
+QuietLog::QuietLog() { ++quiet; }
+QuietLog::~QuietLog() { --quiet; }
 
 void routeLog() {
   static std::once_flag once;

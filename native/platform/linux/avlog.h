@@ -8,4 +8,14 @@ namespace platform::ffmpeg {
 // FFmpeg reports become warning lines; everything less severe is dropped.
 void routeLog();
 
+// While one lives on a thread, FFmpeg's messages from that thread are dropped: for an attempt
+// whose failure is expected and answered by another one.
+class QuietLog {
+ public:
+  QuietLog();
+  ~QuietLog();
+  QuietLog(const QuietLog&) = delete;
+  QuietLog& operator=(const QuietLog&) = delete;
+};
+
 }  // namespace platform::ffmpeg

@@ -11,7 +11,9 @@ extern "C" {
 }
 
 #include <algorithm>
+#include <optional>
 
+#include "platform/linux/avlog.h"
 #include "platform/linux/com.h"
 #include "platform/linux/mfattributes.h"
 #include "platform/linux/mfcapture.h"
@@ -142,8 +144,14 @@ HRESULT openInput(Device& device, std::shared_ptr<Input>& result) {
     // and run at their frame rate, not as fast as possible.
     url += device.encodesH264 ? ",format=yuv420p,realtime" : ",format=yuyv422,realtime";
   }
-  int error = avformat_open_input(&input->format, url.c_str(), format, &options);
-  if (error < 0 && device.formatName == "lavfi" && !device.encodesH264) {
+  const bool fallback = device.formatName == "lavfi" && !device.encodesH264;
+  int error;
+  {
+    std::optional<ffmpeg::QuietLog> quiet;
+    if (fallback) quiet.emplace();  // a graph that cannot make YUY2 is tried again below
+    error = avformat_open_input(&input->format, url.c_str(), format, &options);
+  }
+  if (error < 0 && fallback) {
     // Some generators cannot make 4:2:2 pictures one pixel wide: such a camera sends BGRA.
     url = device.url + ",format=bgra,realtime";
     error = avformat_open_input(&input->format, url.c_str(), format, &options);

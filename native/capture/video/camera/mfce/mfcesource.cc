@@ -118,6 +118,17 @@ void MFCESource::stopPreview() {
   log("MFCESource::stopPreview() preview stopped");
 }
 
+// A device that failed (a microphone whose sound server went away) ends the engine; the next
+// clip makes it again, so the source records once the device is back. A device still gone
+// fails the clip's start as before, with its warning line.
+void MFCESource::reopen() {
+  if (captureManager->engine) return;
+  capturing = false;
+  if (FAILED(captureManager->Initialize(audioDevice, videoDevice))) return;
+  captureManager->eventCallback->direct = true;
+  if (frameQueue && SUCCEEDED(captureManager->StartPreview(frameQueue))) log("MFCESource::reopen() preview started");
+}
+
 void MFCESource::startEncode(std::string filename) {
   if (!captureManager)
     checkResult(file, 295, E_POINTER, "MFCESource::startEncode() could not start preview: bad pointer");
@@ -127,6 +138,7 @@ void MFCESource::startEncode(std::string filename) {
     checkResult(file, 289, 1, "MFCESource::startEncode() could not start capture: already capturing");
     return;
   }
+  reopen();
   log("MFCESource::startEncode() calling StartRecord");
   const std::wstring path = toWide(filename);
   const HRESULT hr = captureManager->StartRecord(path.c_str());

@@ -48,6 +48,9 @@ class MFCESource : public capture::video::Source, public capture::audio::Source 
   CaptureManager* manager() { return captureManager; }
 
  private:
+  // Makes the engine again after a device failure ended it, and restarts the preview.
+  void reopen();
+
   capture::video::FrameQueue* frameQueue = nullptr;
   CaptureManager* captureManager = nullptr;
   bool capturing = false;
