@@ -13,6 +13,7 @@ const path = require('path');
 const readline = require('readline');
 const { startDesktop, playTone } = require('../../scripts/desktop');
 const { root } = require('./addon');
+const { duration: probe, decodeErrors } = require('./clips');
 
 const sleep = (ms) => new Promise((resolve) => setTimeout(resolve, ms));
 const CAMERAS = 'Fault Camera=testsrc2=size=320x240:rate=30';
@@ -90,13 +91,6 @@ async function threadLoads(pid, ms) {
   return [...after].map(([task, { name, ticks }]) => ({ name, load: (ticks - (before.get(task)?.ticks ?? ticks)) / hz / (ms / 1000) }));
 }
 
-function probe(file) {
-  const r = spawnSync('ffprobe', ['-v', 'error', '-show_entries', 'format=duration', '-of', 'csv=p=0', file], { encoding: 'utf8' });
-  return r.status === 0 && r.stdout.trim() ? Number(r.stdout.trim()) : NaN;
-}
-function decodeErrors(file) {
-  return spawnSync('ffmpeg', ['-v', 'error', '-i', file, '-f', 'null', '-'], { encoding: 'utf8' }).stderr.trim();
-}
 
 function pulseArguments(dir) {
   return ['--daemonize=yes', '--exit-idle-time=-1', '--system=false', '-n', '-F', path.join(dir, 'conf.pa'),

@@ -10,6 +10,7 @@ const os = require('os');
 const path = require('path');
 const { startDesktop } = require('../../scripts/desktop');
 const { runAddon, root } = require('./addon');
+const { duration: probe, decodeErrors } = require('./clips');
 
 let dir;
 let flashbeep;
@@ -30,15 +31,6 @@ async function withDesktop(fn, options = {}) {
   }
 }
 
-function probe(file) {
-  const r = spawnSync('ffprobe', ['-v', 'error', '-show_entries', 'format=duration', '-of', 'csv=p=0', file], { encoding: 'utf8' });
-  return r.status === 0 && r.stdout.trim() ? Number(r.stdout.trim()) : NaN;
-}
-
-// Decodes the whole file; resolves to the error lines ffmpeg printed.
-function decodeErrors(file) {
-  return spawnSync('ffmpeg', ['-v', 'error', '-i', file, '-f', 'null', '-'], { encoding: 'utf8' }).stderr.trim();
-}
 
 // Seconds into the clip of the first picture whose top-left corner is bright.
 function flashTime(file) {
