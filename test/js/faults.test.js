@@ -257,3 +257,18 @@ test('the disk full, then space freed', async (t) => {
     fs.rmSync(folder, { recursive: true, force: true });
   }
 });
+
+test('with no display server at all, nothing spins', async () => {
+  const desktop = await startDesktop({ ...DESKTOP, display: false });
+  const host = startHost({ ...desktop.env, DISPLAY: '' });
+  try {
+    const { sources } = await host.next();
+    assert.ok(!sources.some((s) => s.type === 'dxgi'));
+    await sleep(1500);
+    const busy = (await threadLoads(host.child.pid, 1000)).filter((t) => t.load > 0.05 && !t.name.startsWith('node'));
+    assert.deepStrictEqual(busy, []);
+  } finally {
+    host.child.kill('SIGKILL');
+    desktop.stop();
+  }
+});
