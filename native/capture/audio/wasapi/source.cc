@@ -52,7 +52,7 @@ constexpr auto kRetryPause = std::chrono::milliseconds(500);
 // The outermost frame of both threads: runs `body` until it returns, trying again after a
 // pause whenever it fails while `wanted()` holds, so an endpoint whose sound server or device
 // went away works again once it is back. The first failure of a row is printed; the same one
-// again is not. `after` runs once after every try.
+// again is not. `after(failed)` runs once after every try.
 template <class Body, class Wanted, class After>
 void keepTrying(Body body, Wanted wanted, After after) {
   std::string lastFailure;
@@ -66,7 +66,7 @@ void keepTrying(Body body, Wanted wanted, After after) {
       failure = "unknown exception";
     }
     if (failure.empty()) {
-      after();
+      after(false);
       return;
     }
     // Checked failures begin with their time; the rest tells whether it is the same again.
@@ -74,7 +74,7 @@ void keepTrying(Body body, Wanted wanted, After after) {
     const std::string what = tab == std::string::npos ? failure : failure.substr(tab);
     if (what != lastFailure) capture::logWarning(failure.c_str());
     lastFailure = what;
-    after();
+    after(true);
     std::this_thread::sleep_for(kRetryPause);
   }
 }
@@ -155,7 +155,7 @@ Source::Source(IMMDevice* endpoint, bool isSelected, EncoderFactory makeEncoder)
   silence->endpoint = endpoint;
   std::thread([state = silence] {
     capture::nameThread("tavio-silence");
-    keepTrying([&] { state->run(); }, [] { return true; }, [] {});
+    keepTrying([&] { state->run(); }, [] { return true; }, [](bool) {});
   }).detach();
 }
 
@@ -196,8 +196,22 @@ void Source::capture() {
   if (capturing.exchange(true)) return;
   std::thread([self = shared_from_this()] {
     capture::nameThread("tavio-capture");
-    // What was recorded up to a failure is kept: the clips end there.
-    keepTrying([&] { self->runCapture(); }, [&] { return self->capturing.load(); }, [&] { self->finishAll(); });
+    IAudioClient* client = nullptr;
+    IAudioCaptureClient* packets = nullptr;
+    keepTrying([&] { self->runCapture(client, packets); }, [&] { return self->capturing.load(); },
+               [&](bool failed) {
+                 // What was recorded up to a failure is kept: the clips end there.
+                 self->finishAll();
+                 if (!failed) return;
+                 // The failed try's clients go before the next (unless a newer capture thread has
+                 // put its own in their place), so a device that stays away costs no memory.
+                 IAudioCaptureClient* ownPackets = packets;
+                 if (packets && self->captureClient.compare_exchange_strong(ownPackets, nullptr)) packets->Release();
+                 IAudioClient* ownClient = client;
+                 if (client && self->audioClient.compare_exchange_strong(ownClient, nullptr)) client->Release();
+                 client = nullptr;
+                 packets = nullptr;
+               });
   }).detach();
 }
 
@@ -291,8 +305,7 @@ double Source::peak(int32_t channel) {
   return capture::at(peaks, static_cast<size_t>(static_cast<uint32_t>(channel)));
 }
 
-void Source::runCapture() {
-  IAudioClient* client = nullptr;
+void Source::runCapture(IAudioClient*& client, IAudioCaptureClient*& packets) {
   capture::checkResult(kFile, 212, endpoint->Activate(IID_IAudioClient, CLSCTX_ALL, nullptr, reinterpret_cast<void**>(&client)),
                        "Could not create audio client.");
   audioClient.exchange(client);
@@ -311,7 +324,14 @@ void Source::runCapture() {
     describeWaveFormat(closest);
   }
   if (closest) CoTaskMemFree(closest);
-  format.exchange(captureFormat);
+  // A try after a failure usually reads the same format again: the block already out is kept.
+  WAVEFORMATEXTENSIBLE* current = format.load();
+  if (current && std::memcmp(current, captureFormat, sizeof(WAVEFORMATEXTENSIBLE)) == 0) {
+    delete captureFormat;
+    captureFormat = current;
+  } else {
+    format.exchange(captureFormat);
+  }
   {
     std::lock_guard<std::mutex> hold(peakLock);
     peaks.resize(captureFormat->Format.nChannels, 0.0);
@@ -321,7 +341,6 @@ void Source::runCapture() {
                        client->Initialize(AUDCLNT_SHAREMODE_SHARED, AUDCLNT_STREAMFLAGS_LOOPBACK, kBufferDuration, 0,
                                           &captureFormat->Format, nullptr),
                        "Could not initialize the audio client.");
-  IAudioCaptureClient* packets = nullptr;
   capture::checkResult(kFile, 243, client->GetService(IID_IAudioCaptureClient, reinterpret_cast<void**>(&packets)),
                        "Could not get the audio capture client service from the audio client.");
   captureClient.exchange(packets);
