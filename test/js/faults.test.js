@@ -41,7 +41,17 @@ require('readline').createInterface({ input: process.stdin }).on('line', (line) 
     for (const s of sources) addon.stopCapture(s.id);
     say({ stopped: Date.now() });
   } else if (command === 'peaks') {
-    say({ peaks: addon.getPreview(sources.find((s) => s.type === 'wasapi' && s.selected).id) });
+    // The loudest of ten readings over a second, as a meter shows it.
+    const uid = sources.find((s) => s.type === 'wasapi' && s.selected).id;
+    let loudest = 0;
+    let readings = 0;
+    const timer = setInterval(() => {
+      loudest = Math.max(loudest, addon.getPreview(uid).left);
+      if (++readings === 10) {
+        clearInterval(timer);
+        say({ peaks: { left: loudest } });
+      }
+    }, 100);
   }
 });
 `;
