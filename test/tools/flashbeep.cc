@@ -31,11 +31,11 @@ int main(int argc, char** argv) {
   paint(c, screen->root, 0x000000);
   free(xcb_get_input_focus_reply(c, xcb_get_input_focus(c), nullptr));
 
-  const pa_sample_spec spec{PA_SAMPLE_FLOAT32LE, 48000, 2};
+  const pa_sample_spec stereoFloat{PA_SAMPLE_FLOAT32LE, 48000, 2};
   pa_buffer_attr attr{static_cast<uint32_t>(-1), 48000 * 8 / 100, static_cast<uint32_t>(-1), static_cast<uint32_t>(-1),
                       static_cast<uint32_t>(-1)};  // 10 ms queued ahead
   int error = 0;
-  pa_simple* sound = pa_simple_new(nullptr, "flashbeep", PA_STREAM_PLAYBACK, nullptr, "beep", &spec, nullptr, &attr, &error);
+  pa_simple* sound = pa_simple_new(nullptr, "flashbeep", PA_STREAM_PLAYBACK, nullptr, "beep", &stereoFloat, nullptr, &attr, &error);
   if (!sound) return 2;
   std::vector<float> silence(480 * 2, 0.0f), beep(9600 * 2);
   for (size_t i = 0; i < beep.size() / 2; ++i) beep[2 * i] = beep[2 * i + 1] = 0.5f * std::sin(2 * M_PI * 1000 * i / 48000.0);

@@ -45,44 +45,43 @@ void copySwapped(const uint8_t* from, uint8_t* to, uint32_t pixels) {
   }
 }
 
-// Pixel by pixel through the column table: for pictures made smaller, where runs are short.
-template <bool Swap>
-void scaleColumns(const uint8_t* src, uint64_t srcWidth, uint64_t srcHeight, uint8_t* dst, uint64_t dstWidth,
-                  uint64_t dstHeight, const std::vector<uint32_t>& columns) {
+// Calls writeRow(rowBase, out) for every destination row: rowBase is the index of the source
+// row's first pixel, out the row's first byte.
+template <class WriteRow>
+void forEachRow(uint64_t srcWidth, uint64_t srcHeight, uint8_t* dst, uint64_t dstWidth, uint64_t dstHeight,
+                WriteRow writeRow) {
   for (uint64_t y = 0; y < dstHeight; ++y) {
     const uint32_t rowBase = sourceIndex(y, srcHeight, dstHeight) * static_cast<uint32_t>(srcWidth);
-    uint8_t* out = dst + static_cast<int32_t>(4u * static_cast<uint32_t>(dstWidth) * static_cast<uint32_t>(y));
-    for (uint64_t x = 0; x < dstWidth; ++x, out += 4) {
-      uint32_t pixel;
-      std::memcpy(&pixel, src + static_cast<int32_t>(4u * (columns[x] + rowBase)), 4);
-      if (Swap) pixel = swapped(pixel);
-      std::memcpy(out, &pixel, 4);
-    }
+    writeRow(rowBase, dst + static_cast<int32_t>(4u * static_cast<uint32_t>(dstWidth) * static_cast<uint32_t>(y)));
   }
 }
 
-// Run by run: for pictures kept at their size or made larger.
+// Pixel by pixel through the column table, for pictures made smaller, where runs are short; run
+// by run for pictures kept at their size or made larger.
 template <bool Swap>
-void scaleRuns(const uint8_t* src, uint64_t srcWidth, uint64_t srcHeight, uint8_t* dst, uint64_t dstWidth,
-               uint64_t dstHeight, const std::vector<Run>& runs) {
-  for (uint64_t y = 0; y < dstHeight; ++y) {
-    const uint32_t rowBase = sourceIndex(y, srcHeight, dstHeight) * static_cast<uint32_t>(srcWidth);
-    uint8_t* out = dst + static_cast<int32_t>(4u * static_cast<uint32_t>(dstWidth) * static_cast<uint32_t>(y));
+void scale(const uint8_t* src, uint64_t srcWidth, uint64_t srcHeight, uint8_t* dst, uint64_t dstWidth,
+           uint64_t dstHeight, const std::vector<uint32_t>& columns, const std::vector<Run>& runs) {
+  if (runs.size() * 4 > dstWidth) {  // fewer than four pixels a run on average
+    forEachRow(srcWidth, srcHeight, dst, dstWidth, dstHeight, [&](uint32_t rowBase, uint8_t* out) {
+      for (uint64_t x = 0; x < dstWidth; ++x, out += 4) {
+        uint32_t pixel;
+        std::memcpy(&pixel, src + static_cast<int32_t>(4u * (columns[x] + rowBase)), 4);
+        if (Swap) pixel = swapped(pixel);
+        std::memcpy(out, &pixel, 4);
+      }
+    });
+    return;
+  }
+  forEachRow(srcWidth, srcHeight, dst, dstWidth, dstHeight, [&](uint32_t rowBase, uint8_t* out) {
     for (const Run& run : runs) {
       const uint8_t* from = src + static_cast<int32_t>(4u * (run.source + rowBase));
       uint8_t* to = out + 4 * static_cast<size_t>(run.first);
-      if (run.length == 1) {
-        uint32_t pixel;
-        std::memcpy(&pixel, from, 4);
-        if (Swap) pixel = swapped(pixel);
-        std::memcpy(to, &pixel, 4);
-      } else if (Swap) {
+      if (Swap)
         copySwapped(from, to, run.length);
-      } else {
+      else
         std::memcpy(to, from, 4 * static_cast<size_t>(run.length));
-      }
     }
-  }
+  });
 }
 
 }  // namespace
@@ -103,15 +102,10 @@ void scaleFrame(const uint8_t* src, uint64_t srcWidth, uint64_t srcHeight, uint8
     else
       runs.push_back({static_cast<uint32_t>(x), 1, columns[x]});
   }
-  const bool longRuns = runs.size() * 4 <= dstWidth;  // four pixels a run or more on average
-  if (swapRedBlue == 1 && longRuns)
-    scaleRuns<true>(src, srcWidth, srcHeight, dst, dstWidth, dstHeight, runs);
-  else if (longRuns)
-    scaleRuns<false>(src, srcWidth, srcHeight, dst, dstWidth, dstHeight, runs);
-  else if (swapRedBlue == 1)
-    scaleColumns<true>(src, srcWidth, srcHeight, dst, dstWidth, dstHeight, columns);
+  if (swapRedBlue == 1)
+    scale<true>(src, srcWidth, srcHeight, dst, dstWidth, dstHeight, columns, runs);
   else
-    scaleColumns<false>(src, srcWidth, srcHeight, dst, dstWidth, dstHeight, columns);
+    scale<false>(src, srcWidth, srcHeight, dst, dstWidth, dstHeight, columns, runs);
 }
 
 }  // namespace capture::video

@@ -187,7 +187,6 @@ void Source::stopPreview() { previewing.exchange(false); }
 bool Source::selected() { return isSelected; }
 void Source::stopCapturing() { capturing.exchange(false); }
 void Source::stopEncode() {
-  encoding.exchange(false);
   if (latest) latest->stop.store(counterNow());
   latest.reset();
 }
@@ -231,7 +230,6 @@ void Source::startEncode(std::string filename) {
     std::lock_guard<std::mutex> hold(clipsLock);
     started.push_back(clip);
   }
-  encoding.exchange(true);
 }
 
 void Source::record(const BYTE* data, UINT32 frames, uint64_t begin, const WAVEFORMATEXTENSIBLE* captureFormat) {

@@ -76,7 +76,6 @@ class Source : public capture::audio::Source, public std::enable_shared_from_thi
   std::vector<double> peaks;
   std::atomic<bool> capturing{false};
   std::atomic<bool> previewing{false};
-  std::atomic<bool> encoding{false};
 };
 
 }  // namespace capture::audio::wasapi

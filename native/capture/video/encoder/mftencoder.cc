@@ -29,6 +29,11 @@ constexpr LONGLONG slotsPerSecond = 30;  // the declared rate
 // coming, each one is taken out of the queue when the next arrives, without a copy.
 constexpr int64_t stillMilliseconds = 34;
 
+// Sample times lie on a grid of the declared rate: players and converters that take the stream
+// for constant-rate then never see two pictures in one frame's time.
+LONGLONG slotOf(LONGLONG time) { return (time * slotsPerSecond + 5000000) / 10000000; }
+LONGLONG timeOfSlot(LONGLONG slot) { return slot * 10000000 / slotsPerSecond; }
+
 std::chrono::system_clock::time_point atMillis(int64_t ms) {
   return std::chrono::system_clock::time_point(std::chrono::milliseconds(ms));
 }
@@ -76,7 +81,6 @@ void MFTEncoder::record() {
       // Behind the clock (a busy machine), the repeats skip ahead instead of piling up.
       const LONGLONG now = (currentTimeMillis() - clip->start) * ticksPerMillisecond;
       const LONGLONG time = timeOfSlot(slotOf(std::max(lastTime + frameInterval, now - 2 * frameInterval)));
-      ++frameCount;
       writeFrame(*last, time);
       lastTime = time;
     } else {
@@ -138,23 +142,17 @@ void MFTEncoder::finish() {
   // It lasts until the stop: the last sample is placed so that it ends there.
   const LONGLONG held = timeOfSlot(slotOf((stop - clip->start) * ticksPerMillisecond) - 1);
   if (last && held > lastTime) {
-    ++frameCount;
     writeFrame(*last, held);
     lastTime = held;
   }
 }
 
-// Sample times lie on a grid of the declared rate: players and converters that
-// take the stream for constant-rate then never see two pictures in one frame's time. A picture
-// that falls into the slot of the one before replaces it in what is repeated, not in the file.
-LONGLONG MFTEncoder::slotOf(LONGLONG time) { return (time * slotsPerSecond + 5000000) / 10000000; }
-LONGLONG MFTEncoder::timeOfSlot(LONGLONG slot) { return slot * 10000000 / slotsPerSecond; }
-
+// A picture that falls into the slot of the one before replaces it in what is repeated, not in
+// the file.
 void MFTEncoder::write(std::unique_ptr<Frame> picture, LONGLONG time) {
   // The clip opens with its first picture, wherever it came from.
   const LONGLONG slot = lastTime < 0 ? 0 : slotOf(time);
   if (lastTime < 0 || slot > slotOf(lastTime)) {
-    ++frameCount;
     writeFrame(*picture, timeOfSlot(slot));
     lastTime = timeOfSlot(slot);
   }
@@ -215,6 +213,7 @@ void MFTEncoder::configure() {
 }
 
 void MFTEncoder::writeFrame(const Frame& frame, LONGLONG time) {
+  ++frameCount;
   const DWORD length = static_cast<DWORD>(queue->width) * static_cast<DWORD>(queue->height) * 4;
   Held<IMFMediaBuffer> buffer;
   checkResult(file, 88, MFCreateMemoryBuffer(length, &buffer.object), "Could not create memory buffer");

@@ -30,8 +30,6 @@ class MFTEncoder : public Encoder {
   // picture is due again.
   std::unique_ptr<Frame> nextPicture(bool& repeat);
   void write(std::unique_ptr<Frame> picture, LONGLONG time);
-  static LONGLONG slotOf(LONGLONG time);
-  static LONGLONG timeOfSlot(LONGLONG slot);
   void writeFrame(const Frame& frame, LONGLONG time);
 
   std::shared_ptr<capture::video::Clip> clip;
