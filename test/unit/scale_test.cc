@@ -88,7 +88,11 @@ TEST(ScaleFrame, MatchesThePerPixelDefinitionOverManySizes) {
   };
   std::vector<Size> sizes = {{1, 1, 1, 1},       {3, 5, 7, 11},      {1920, 1080, 320, 180}, {1920, 1080, 333, 187},
                              {1280, 720, 1920, 1080}, {7, 3, 1, 1},  {640, 480, 641, 479},   {5001, 3, 4999, 2},
-                             {100003, 1, 99991, 1},   {16777217, 1, 4096, 1}, {1, 4097, 1, 4093}, {30000, 2, 29999, 3}};
+                             {100003, 1, 99991, 1},   {16777217, 1, 4096, 1}, {1, 4097, 1, 4093}, {30000, 2, 29999, 3},
+                             // the halving, gathering and run paths with tails that are not whole blocks
+                             {1920, 1080, 960, 540}, {1934, 7, 967, 3}, {1920, 1080, 1920, 1080}, {1927, 3, 1927, 5},
+                             // constant steps whose last loads end at the row's end
+                             {63, 2, 9, 2}, {24, 1, 8, 1}, {51, 5, 17, 4}, {112, 3, 16, 3}};
   for (uint32_t sw = 1; sw < 40; sw += 7)
     for (uint32_t dw = 1; dw < 50; dw += 9) sizes.push_back({sw, sw + 3, dw, dw / 2 + 1});
   int differsFromIntegerDivision = 0;
