@@ -1,0 +1,153 @@
+'use strict';
+// Every kind of source recording at once, as a host's "record all" does, against four ffmpeg
+// processes recording the same sources with the same settings, in the same run:
+//   a 1920x1080 display changing at 60 Hz (x11grab at the clips' 30 fps, libx264 superfast,
+//     zerolatency, Main, 10485760 bit/s);
+//   a 1280x720 30 fps test camera sending YUY2 (the same lavfi picture converted to YUY2, libx264
+//     superfast, zerolatency, Baseline, 9216000 bit/s, a key frame every 2 s);
+//   the speakers with a tone playing (the sink's monitor, AAC);
+//   the microphone (the same PulseAudio source, AAC at the bit rate our clip has).
+// The add-on's process previews as a host's window would meanwhile: both pictures 15 times a
+// second at 640x360, both peak meters 10 times a second. Its CPU is the whole process over the
+// recording (utime + stime of /proc/self/stat); ffmpeg's is the four processes' together (the
+// shell's `times`). Frames and durations come from ffprobe; resident memory is read at 10 s and at
+// the end.
+//   node bench/all.js [seconds=60]
+const { spawn, spawnSync, execFileSync } = require('child_process');
+const fs = require('fs');
+const os = require('os');
+const path = require('path');
+const { startDesktop, playTone } = require('../scripts/desktop');
+const { runAddon, root } = require('../test/js/addon');
+
+const seconds = Number(process.argv[2] || 60);
+const CAMERA = 'testsrc2=size=1280x720:rate=30';
+const DISPLAY_X264 = ['-c:v', 'libx264', '-preset', 'superfast', '-tune', 'zerolatency', '-profile:v', 'main',
+  '-b:v', '10485760', '-pix_fmt', 'yuv420p'];
+const CAMERA_X264 = ['-c:v', 'libx264', '-preset', 'superfast', '-tune', 'zerolatency', '-profile:v', 'baseline',
+  '-b:v', '9216000', '-maxrate', '9216000', '-bufsize', '9216000', '-g', '60', '-bf', '0', '-pix_fmt', 'yuv420p'];
+
+function probe(file) {
+  const r = spawnSync('ffprobe', ['-v', 'error', '-count_packets', '-show_entries',
+    'stream=codec_type,nb_read_packets,bit_rate:format=duration', '-of', 'json', file], { encoding: 'utf8' });
+  if (r.status !== 0) return { packets: 0, duration: 0, bitRate: 0 };
+  const info = JSON.parse(r.stdout);
+  const s = info.streams[0];
+  return { packets: Number(s.nb_read_packets), duration: Number(info.format.duration), bitRate: Number(s.bit_rate) };
+}
+
+async function main() {
+  const dir = fs.mkdtempSync(path.join(os.tmpdir(), 'tavio-bench-all-'));
+  const xpattern = path.join(dir, 'xpattern');
+  execFileSync('g++', ['-O2', '-o', xpattern, path.join(root, 'test/tools/xpattern.cc'), '-lxcb']);
+  const desktop = await startDesktop({ width: 1920, height: 1080 });
+  const env = { ...process.env, ...desktop.env };
+  const animation = spawn(xpattern, ['0', '0', '1920', '1080', '60'], { env, stdio: 'ignore' });
+  const tone = playTone(desktop.env);
+  const ours = {
+    display: path.join(dir, 'display.mp4'), camera: path.join(dir, 'camera.mp4'),
+    speakers: path.join(dir, 'speakers.mp4'), microphone: path.join(dir, 'microphone.mp4'),
+  };
+  try {
+    const run = await runAddon(`
+      const fs = require('fs');
+      const ticks = ${Number(spawnSync('getconf', ['CLK_TCK'], { encoding: 'utf8' }).stdout) || 100};
+      const cpu = () => {
+        const stat = fs.readFileSync('/proc/self/stat', 'utf8');
+        const fields = stat.slice(stat.lastIndexOf(')') + 2).split(' ');
+        return (Number(fields[11]) + Number(fields[12])) / ticks;
+      };
+      // CPU seconds by thread name, summed over the live threads.
+      const byThread = () => {
+        const all = {};
+        for (const tid of fs.readdirSync('/proc/self/task')) {
+          try {
+            const stat = fs.readFileSync('/proc/self/task/' + tid + '/stat', 'utf8');
+            const close = stat.lastIndexOf(')');
+            const fields = stat.slice(close + 2).split(' ');
+            const name = stat.slice(stat.indexOf('(') + 1, close);
+            all[name] = (all[name] || 0) + (Number(fields[11]) + Number(fields[12])) / ticks;
+          } catch (e) { /* the thread ended meanwhile */ }
+        }
+        return all;
+      };
+      const residentMB = () => Number(/VmRSS:\\s+(\\d+)/.exec(fs.readFileSync('/proc/self/status', 'utf8'))[1]) / 1024;
+      addon.initialize();
+      const find = (type, name) => events.find((e) => e.type === 'new source' && e.source.type === type &&
+        (!name || e.source.name === name))?.source;
+      const sources = {
+        display: find('dxgi'), camera: find('mfce_video'), speakers: find('wasapi', 'Tavio Speakers'),
+        microphone: find('mfce_audio'),
+      };
+      for (const [kind, s] of Object.entries(sources)) if (!s) throw new Error('no ' + kind + ' source');
+      const files = ${JSON.stringify(ours)};
+      const pictures = [sources.display, sources.camera];
+      const meters = [sources.speakers, sources.microphone];
+      const video = setInterval(() => { for (const s of pictures) addon.getPreview(s.id, 640, 360); }, 1000 / 15);
+      const audio = setInterval(() => { for (const s of meters) addon.getPreview(s.id); }, 100);
+      await sleep(3000);  // every source has started and previews
+      const before = cpu();
+      const threadsBefore = byThread();
+      const start = Date.now();
+      for (const [kind, s] of Object.entries(sources)) addon.startCapture(s.id, files[kind]);
+      await sleep(10000);
+      const at10 = residentMB();
+      await sleep(${seconds * 1000} - (Date.now() - start));
+      const atEnd = residentMB();
+      // Before the stops: the encoders' threads end with their files.
+      const threads = Object.entries(byThread()).map(([name, c]) => [name, c - (threadsBefore[name] || 0)])
+        .filter(([, c]) => c > 0.05).sort((a, b) => b[1] - a[1]);
+      for (const s of Object.values(sources)) addon.stopCapture(s.id);
+      const used = cpu() - before;
+      const wall = (Date.now() - start) / 1000;
+      clearInterval(video);
+      clearInterval(audio);
+      await sleep(2000);  // the files are finished on the sources' threads
+      report({ cpu: used, wall, at10, atEnd, threads });
+    `, { env: { ...desktop.env, TAVIO_TEST_CAMERAS: `Bench Camera=${CAMERA}` }, timeoutMs: (seconds + 60) * 1000 });
+    if (!run.reports.length) throw new Error(`add-on run failed (${run.code}): ${run.stderr}`);
+    const { cpu, wall, at10, atEnd, threads } = run.reports[0];
+    const ourFiles = Object.fromEntries(Object.entries(ours).map(([k, f]) => [k, probe(f)]));
+
+    const theirs = Object.fromEntries(Object.keys(ours).map((k) => [k, path.join(dir, `ffmpeg-${k}.mp4`)]));
+    const micRate = Math.round(ourFiles.microphone.bitRate / 1000) || 192;
+    const commands = [
+      ['-f', 'x11grab', '-framerate', '30', '-video_size', '1920x1080', '-i', `${desktop.env.DISPLAY}+0,0`,
+        '-t', String(seconds), ...DISPLAY_X264, theirs.display],
+      ['-re', '-f', 'lavfi', '-i', `${CAMERA},format=yuyv422`, '-t', String(seconds), ...CAMERA_X264, theirs.camera],
+      ['-f', 'pulse', '-i', 'tavio_speakers.monitor', '-t', String(seconds), '-c:a', 'aac', '-b:a', '192k', theirs.speakers],
+      ['-f', 'pulse', '-i', 'tavio_mic', '-t', String(seconds), '-c:a', 'aac', '-b:a', `${micRate}k`, theirs.microphone],
+    ];
+    const quote = (a) => `'${a.replace(/'/g, "'\\''")}'`;
+    const script = commands.map((c) => `ffmpeg -nostdin -v error -y ${c.map(quote).join(' ')} &`).join('\n') +
+      '\nwait\ntimes';
+    const ffmpeg = spawnSync('bash', ['-c', script], { env, encoding: 'utf8' });
+    if (ffmpeg.status !== 0) throw new Error(`ffmpeg failed: ${ffmpeg.stderr}`);
+    // `times` prints the shell's and then its children's user and system times.
+    const m = ffmpeg.stdout.trim().split('\n').pop().match(/(\d+)m([\d.]+)s (\d+)m([\d.]+)s/);
+    const theirCpu = Number(m[1]) * 60 + Number(m[2]) + Number(m[3]) * 60 + Number(m[4]);
+    const theirFiles = Object.fromEntries(Object.entries(theirs).map(([k, f]) => [k, probe(f)]));
+
+    console.log(`${seconds} s of every source at once (the add-on's recording took ${wall.toFixed(1)} s of wall time)`);
+    for (const kind of Object.keys(ours)) {
+      const a = ourFiles[kind];
+      const b = theirFiles[kind];
+      const video = kind === 'display' || kind === 'camera';
+      const count = (f) => video ? `${f.packets} frames (${(f.packets / f.duration).toFixed(1)}/s)` : `${f.packets} AAC packets`;
+      console.log(`  ${kind.padEnd(10)} ours ${count(a)}, ${a.duration.toFixed(2)} s; ffmpeg ${count(b)}, ${b.duration.toFixed(2)} s` +
+        (video ? `; frames ours - ffmpeg: ${a.packets - b.packets}` : ''));
+    }
+    console.log(`CPU: ours ${cpu.toFixed(1)} s (${(100 * cpu / wall).toFixed(0)} % of a core, previews included), ` +
+      `ffmpeg's four ${theirCpu.toFixed(1)} s (${(100 * theirCpu / seconds).toFixed(0)} %)`);
+    console.log(`CPU, ours / ffmpeg: ${((cpu / wall) / (theirCpu / seconds)).toFixed(2)} (target <= 0.8)`);
+    console.log(`  ours by thread name: ${threads.map(([n, c]) => `${n} ${c.toFixed(1)} s`).join(', ')}`);
+    console.log(`resident memory: ${at10.toFixed(1)} MB at 10 s, ${atEnd.toFixed(1)} MB at ${seconds} s`);
+  } finally {
+    animation.kill('SIGTERM');
+    tone.kill('SIGTERM');
+    desktop.stop();
+    fs.rmSync(dir, { recursive: true, force: true });
+  }
+}
+
+main().catch((e) => { console.error(e); process.exit(1); });
