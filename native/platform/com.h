@@ -1,4 +1,5 @@
-// COM basics: HRESULT, GUID, IUnknown, apartments, task memory, PROPVARIANT, FormatMessageA.
+// COM basics: HRESULT, GUID, IUnknown, apartments, task memory, PROPVARIANT, FormatMessageA, and
+// ComPtr, the one holder of interface references.
 #pragma once
 
 #ifdef _WIN32
@@ -8,6 +9,8 @@
 #include <windows.h>
 #include <objbase.h>
 #include <propidl.h>
+#include <wrl/client.h>
+using Microsoft::WRL::ComPtr;
 #else
-#include "platform/linux/com.h"
+#include "platform/linux/comptr.h"
 #endif

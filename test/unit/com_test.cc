@@ -63,6 +63,40 @@ TEST(ComObject, AnswersItsInterfacesAndDiesWithTheLastReference) {
   EXPECT_TRUE(gone);
 }
 
+// Each holder owns one reference: copies count, moves and Attach take over, reassignment, &,
+// Reset and the destructor let the old one go, Detach and CopyTo hand one out.
+TEST(ComPtr, HoldsExactlyOneReferenceEach) {
+  bool gone = false;
+  auto* object = new Counted(gone);  // one reference, the creator's
+  {
+    ComPtr<ITest> first;
+    first.Attach(object);
+    ComPtr<ITest> copy = first;
+    ComPtr<IUnknown> wider = copy;  // to a base interface
+    EXPECT_EQ(object->AddRef(), 4u);
+    EXPECT_EQ(object->Release(), 3u);
+    ComPtr<ITest> moved = std::move(copy);
+    EXPECT_FALSE(copy);
+    EXPECT_EQ(moved, first);
+    moved = moved;  // NOLINT: assigning a holder to itself keeps the reference
+    EXPECT_EQ(object->AddRef(), 4u);
+    object->Release();
+    ITest* out = nullptr;
+    EXPECT_EQ(first.CopyTo(&out), S_OK);
+    EXPECT_EQ(out, object);
+    EXPECT_EQ(object->Release(), 3u);  // CopyTo's reference
+    wider.Reset();
+    *&moved = nullptr;  // & releases before a call fills the slot
+    EXPECT_EQ(object->AddRef(), 2u);
+    object->Release();
+    ITest* kept = first.Detach();
+    EXPECT_EQ(first, nullptr);
+    EXPECT_FALSE(gone);
+    first.Attach(kept);
+  }
+  EXPECT_TRUE(gone);
+}
+
 TEST(Hresults, Win32ErrorsMapIntoFacilitySeven) {
   EXPECT_EQ(static_cast<uint32_t>(HRESULT_FROM_WIN32(ERROR_PATH_NOT_FOUND)), 0x80070003u);
   EXPECT_EQ(HRESULT_FROM_WIN32(ERROR_SUCCESS), S_OK);
