@@ -5,6 +5,7 @@
 #include <cstring>
 #include <fstream>
 #include <random>
+#include <ostream>
 #include <string>
 #include <vector>
 
@@ -554,12 +555,14 @@ std::vector<uint8_t> sine(double frequency, UINT32 rate, UINT32 channels, WORD t
 }
 
 struct AudioCase {
+  const char* name;
   UINT32 rate;
   UINT32 channels;
   WORD tag;
   WORD bits;
   DWORD mask;
 };
+void PrintTo(const AudioCase& c, std::ostream* out) { *out << c.name; }
 
 class AacFile : public testing::TestWithParam<AudioCase> {};
 
@@ -607,11 +610,14 @@ TEST_P(AacFile, KeepsRateChannelsDurationAndTheTone) {
 
 INSTANTIATE_TEST_SUITE_P(
     SampleKinds, AacFile,
-    testing::Values(AudioCase{48000, 2, WAVE_FORMAT_IEEE_FLOAT, 32, SPEAKER_FRONT_LEFT | SPEAKER_FRONT_RIGHT},
-                    AudioCase{44100, 1, WAVE_FORMAT_PCM, 16, SPEAKER_FRONT_CENTER},
-                    AudioCase{48000, 2, WAVE_FORMAT_PCM, 24, 0}, AudioCase{48000, 2, WAVE_FORMAT_PCM, 32, 0},
-                    AudioCase{48000, 6, WAVE_FORMAT_IEEE_FLOAT, 32, 0x3F},      // 5.1
-                    AudioCase{48000, 6, WAVE_FORMAT_IEEE_FLOAT, 32, 0x60F}));  // 5.1 with side speakers
+    testing::Values(
+        AudioCase{"Float48kStereo", 48000, 2, WAVE_FORMAT_IEEE_FLOAT, 32, SPEAKER_FRONT_LEFT | SPEAKER_FRONT_RIGHT},
+        AudioCase{"Pcm16At44kMono", 44100, 1, WAVE_FORMAT_PCM, 16, SPEAKER_FRONT_CENTER},
+        AudioCase{"Pcm24Stereo", 48000, 2, WAVE_FORMAT_PCM, 24, 0},
+        AudioCase{"Pcm32Stereo", 48000, 2, WAVE_FORMAT_PCM, 32, 0},
+        AudioCase{"Float5_1", 48000, 6, WAVE_FORMAT_IEEE_FLOAT, 32, 0x3F},
+        AudioCase{"Float5_1WithSideSpeakers", 48000, 6, WAVE_FORMAT_IEEE_FLOAT, 32, 0x60F}),
+    [](const testing::TestParamInfo<AudioCase>& info) { return std::string(info.param.name); });
 
 TEST(SinkWriter, AudioGapsInSampleTimesBecomeSilence) {
   MediaFoundation started;
