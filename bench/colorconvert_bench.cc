@@ -13,7 +13,7 @@ extern "C" {
 #include <libswscale/swscale.h>
 }
 
-#include "platform/linux/colorconvert.h"
+#include "platform/linux/ffmpeg/colorconvert.h"
 
 namespace {
 

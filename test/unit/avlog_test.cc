@@ -1,4 +1,4 @@
-#include "platform/linux/avlog.h"
+#include "platform/linux/ffmpeg/avlog.h"
 
 #include <gtest/gtest.h>
 

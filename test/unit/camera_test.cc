@@ -15,7 +15,7 @@
 #include "capture/video/camera/mfce/mfcesource.h"
 #include "capture/video/camera/mfce/previewcallbacks.h"
 #include "fakes/captureengine.h"
-#include "platform/linux/mfattributes.h"
+#include "platform/linux/mf/mfattributes.h"
 
 namespace mfce = capture::video::camera::mfce;
 

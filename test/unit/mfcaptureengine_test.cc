@@ -14,9 +14,9 @@
 #include "capture/video/camera/mfce/capturemanager.h"
 #include "capture/video/camera/mfce/mfcesource.h"
 #include "media.h"
-#include "platform/linux/evenpicture.h"
+#include "platform/linux/ffmpeg/evenpicture.h"
 #include "platform/linux/mfcapture.h"
-#include "platform/linux/testcameragraph.h"
+#include "platform/linux/camera/testcameragraph.h"
 
 namespace {
 

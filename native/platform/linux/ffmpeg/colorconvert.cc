@@ -1,4 +1,4 @@
-#include "platform/linux/colorconvert.h"
+#include "platform/linux/ffmpeg/colorconvert.h"
 
 #if defined(__SSE2__)
 #include <emmintrin.h>

@@ -4,7 +4,7 @@
 
 #include <cstring>
 
-#include "platform/linux/d3d11objects.h"
+#include "platform/linux/x11/d3d11objects.h"
 
 namespace platform::d3d11 {
 

@@ -11,7 +11,7 @@ extern "C" {
 #include <functional>
 #include <memory>
 
-#include "platform/linux/capturedevice.h"
+#include "platform/linux/camera/capturedevice.h"
 
 namespace platform::capturedevice {
 

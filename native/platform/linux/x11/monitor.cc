@@ -3,7 +3,7 @@
 #include <algorithm>
 #include <cstring>
 
-#include "platform/linux/display.h"
+#include "platform/linux/x11/display.h"
 #include "platform/linux/user32.h"
 
 namespace {

@@ -1,4 +1,4 @@
-#include "platform/linux/duplication.h"
+#include "platform/linux/x11/duplication.h"
 
 #include <poll.h>
 #include <unistd.h>

@@ -31,10 +31,10 @@ extern "C" {
 #include <libswscale/swscale.h>
 }
 
-#include "platform/linux/colorconvert.h"
+#include "platform/linux/ffmpeg/colorconvert.h"
 #include "platform/linux/mf.h"
-#include "platform/linux/mfstartup.h"
-#include "platform/linux/mp4file.h"
+#include "platform/linux/mf/mfstartup.h"
+#include "platform/linux/ffmpeg/mp4file.h"
 
 namespace platform {
 

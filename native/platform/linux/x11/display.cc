@@ -1,4 +1,4 @@
-#include "platform/linux/display.h"
+#include "platform/linux/x11/display.h"
 
 #include <cstdlib>
 #include <cstring>

@@ -14,8 +14,8 @@
 #include <string>
 #include <vector>
 
-#include "platform/linux/d3d11objects.h"
-#include "platform/linux/display.h"
+#include "platform/linux/x11/d3d11objects.h"
+#include "platform/linux/x11/display.h"
 
 namespace platform::dxgi {
 

@@ -28,10 +28,10 @@ extern "C" {
 #include <thread>
 #include <vector>
 
-#include "platform/linux/capturedevice.h"
-#include "platform/linux/devicereader.h"
-#include "platform/linux/evenpicture.h"
-#include "platform/linux/mfattributes.h"
+#include "platform/linux/camera/capturedevice.h"
+#include "platform/linux/camera/devicereader.h"
+#include "platform/linux/ffmpeg/evenpicture.h"
+#include "platform/linux/mf/mfattributes.h"
 #include "platform/linux/mfcapture.h"
 
 namespace platform {

@@ -5,8 +5,8 @@
 #include <string>
 #include <vector>
 
-#include "platform/linux/display.h"
-#include "platform/linux/duplication.h"
+#include "platform/linux/x11/display.h"
+#include "platform/linux/x11/duplication.h"
 #include "platform/linux/dxgi.h"
 
 namespace platform::dxgi {

@@ -1,4 +1,4 @@
-#include "platform/linux/pulse.h"
+#include "platform/linux/pulse/pulse.h"
 
 namespace platform::pulse {
 

@@ -1,4 +1,4 @@
-#include "platform/linux/evenpicture.h"
+#include "platform/linux/ffmpeg/evenpicture.h"
 
 #include <cstring>
 

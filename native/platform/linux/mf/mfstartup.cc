@@ -5,9 +5,9 @@
 // the sink writer refuses to be created while the count is zero.
 #include <atomic>
 
-#include "platform/linux/avlog.h"
+#include "platform/linux/ffmpeg/avlog.h"
 #include "platform/linux/mf.h"
-#include "platform/linux/mfstartup.h"
+#include "platform/linux/mf/mfstartup.h"
 
 namespace {
 

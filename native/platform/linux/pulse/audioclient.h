@@ -5,7 +5,7 @@
 #include <memory>
 #include <string>
 
-#include "platform/linux/pulse.h"
+#include "platform/linux/pulse/pulse.h"
 #include "platform/linux/wasapi.h"
 
 namespace platform::wasapi {

@@ -16,9 +16,9 @@
 
 #include "capture/check.h"
 #include "capture/log.h"
-#include "platform/linux/mfattributes.h"
+#include "platform/linux/mf/mfattributes.h"
 #include "platform/linux/mfcapture.h"
-#include "platform/linux/testcameragraph.h"
+#include "platform/linux/camera/testcameragraph.h"
 
 namespace platform {
 
@@ -88,7 +88,7 @@ std::vector<Device> videoDevices() {
           // The camera is left out and the host is told why.
           const std::string message = "Test camera " + entry.substr(0, equals) + " refused: \"" + refused +
                                       "\" is not a picture generator or a drawing filter";
-          try {
+          try {  // the warning names the file's first path, which hosts may match on
             capture::checkResult("native/platform/linux/mfdevices", 92, E_ACCESSDENIED, message.c_str());
           } catch (const std::runtime_error& error) {
             capture::logWarning(error.what());

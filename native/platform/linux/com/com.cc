@@ -6,7 +6,7 @@
 #include <cstdlib>
 #include <locale>
 
-#include "platform/linux/classes.h"
+#include "platform/linux/com/classes.h"
 
 namespace {
 

@@ -1,4 +1,4 @@
-#include "platform/linux/pulseformat.h"
+#include "platform/linux/pulse/pulseformat.h"
 
 #include <cstring>
 

@@ -1,4 +1,4 @@
-#include "platform/linux/classes.h"
+#include "platform/linux/com/classes.h"
 
 #include "platform/linux/mfcapture.h"
 #include "platform/linux/wasapi.h"

@@ -1,6 +1,6 @@
 // Attribute stores and media types on Linux, answering with Media Foundation's codes: a missing
 // key is MF_E_ATTRIBUTENOTFOUND, a key of another type MF_E_INVALIDTYPE.
-#include "platform/linux/mfattributes.h"
+#include "platform/linux/mf/mfattributes.h"
 
 #include <algorithm>
 #include <cstddef>

@@ -1,4 +1,4 @@
-#include "platform/linux/audioclient.h"
+#include "platform/linux/pulse/audioclient.h"
 
 #include <algorithm>
 #include <atomic>
@@ -6,7 +6,7 @@
 #include <ctime>
 #include <vector>
 
-#include "platform/linux/pulseformat.h"
+#include "platform/linux/pulse/pulseformat.h"
 
 namespace platform::wasapi {
 

@@ -1,4 +1,4 @@
-#include "platform/linux/capturedevice.h"
+#include "platform/linux/camera/capturedevice.h"
 
 #include <fcntl.h>
 #include <linux/videodev2.h>
@@ -13,9 +13,9 @@ extern "C" {
 #include <algorithm>
 #include <optional>
 
-#include "platform/linux/avlog.h"
+#include "platform/linux/ffmpeg/avlog.h"
 #include "platform/linux/com.h"
-#include "platform/linux/mfattributes.h"
+#include "platform/linux/mf/mfattributes.h"
 #include "platform/linux/mfcapture.h"
 
 namespace platform::capturedevice {

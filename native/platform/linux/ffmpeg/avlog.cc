@@ -1,4 +1,4 @@
-#include "platform/linux/avlog.h"
+#include "platform/linux/ffmpeg/avlog.h"
 
 extern "C" {
 #include <libavutil/log.h>
@@ -16,6 +16,7 @@ namespace platform::ffmpeg {
 
 namespace {
 
+// The file's first path: hosts may match warning lines on it, so it stays as it was.
 constexpr const char* kFile = "native/platform/linux/avlog";
 
 // "FFmpeg <component>: " for the context that logs (its address left out).

@@ -7,8 +7,8 @@
 #include <string>
 #include <vector>
 
-#include "platform/linux/audioclient.h"
-#include "platform/linux/pulse.h"
+#include "platform/linux/pulse/audioclient.h"
+#include "platform/linux/pulse/pulse.h"
 
 namespace platform::wasapi {
 

@@ -1,4 +1,4 @@
-#include "platform/linux/testcameragraph.h"
+#include "platform/linux/camera/testcameragraph.h"
 
 #include <algorithm>
 #include <iterator>

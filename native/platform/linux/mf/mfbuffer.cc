@@ -3,7 +3,7 @@
 #include <cstring>
 #include <vector>
 
-#include "platform/linux/mfattributes.h"
+#include "platform/linux/mf/mfattributes.h"
 
 namespace platform {
 

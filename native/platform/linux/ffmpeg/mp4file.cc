@@ -1,4 +1,4 @@
-#include "platform/linux/mp4file.h"
+#include "platform/linux/ffmpeg/mp4file.h"
 
 #include <fcntl.h>
 #include <unistd.h>

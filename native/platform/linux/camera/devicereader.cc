@@ -1,4 +1,4 @@
-#include "platform/linux/devicereader.h"
+#include "platform/linux/camera/devicereader.h"
 
 #include <pthread.h>
 
