@@ -112,7 +112,6 @@ class CaptureClient : public ComObject<IAudioCaptureClient, IID_IAudioCaptureCli
     log_->changed.notify_all();
     return S_OK;
   }
-  HRESULT GetNextPacketSize(UINT32* frames) override { return E_NOTIMPL; }
 
  private:
   std::shared_ptr<AudioLog> log_;
@@ -160,7 +159,6 @@ class AudioClient : public ComObject<IAudioClient, IID_IAudioClient> {
     *frames = log_->silenceBufferFrames;
     return S_OK;
   }
-  HRESULT GetStreamLatency(REFERENCE_TIME*) override { return E_NOTIMPL; }
   HRESULT GetCurrentPadding(UINT32* frames) override {
     std::lock_guard<std::mutex> lock(log_->mutex);
     *frames = log_->silenceBufferFrames;
@@ -187,16 +185,13 @@ class AudioClient : public ComObject<IAudioClient, IID_IAudioClient> {
     *format = &copy->Format;
     return S_OK;
   }
-  HRESULT GetDevicePeriod(REFERENCE_TIME*, REFERENCE_TIME*) override { return E_NOTIMPL; }
   HRESULT Start() override {
     std::lock_guard<std::mutex> lock(log_->mutex);
     ++log_->starts;
     log_->changed.notify_all();
     return S_OK;
   }
-  HRESULT Stop() override { return S_OK; }
   HRESULT Reset() override { return S_OK; }
-  HRESULT SetEventHandle(HANDLE) override { return E_NOTIMPL; }
   HRESULT GetService(REFIID riid, void** object) override {
     if (riid == IID_IAudioCaptureClient && loopback_) {
       *object = static_cast<IAudioCaptureClient*>(new CaptureClient(log_));
@@ -219,7 +214,6 @@ class PropertyStore : public ComObject<IPropertyStore, IID_IPropertyStore> {
  public:
   explicit PropertyStore(std::wstring name) : name_(std::move(name)) {}
   HRESULT GetCount(DWORD*) override { return E_NOTIMPL; }
-  HRESULT GetAt(DWORD, PROPERTYKEY*) override { return E_NOTIMPL; }
   HRESULT GetValue(REFPROPERTYKEY key, PROPVARIANT* value) override {
     PropVariantInit(value);
     if (!(key.fmtid == PKEY_Device_FriendlyName.fmtid) || key.pid != PKEY_Device_FriendlyName.pid) return E_FAIL;
@@ -227,8 +221,6 @@ class PropertyStore : public ComObject<IPropertyStore, IID_IPropertyStore> {
     value->pwszVal = taskString(name_);
     return S_OK;
   }
-  HRESULT SetValue(REFPROPERTYKEY, REFPROPVARIANT) override { return E_NOTIMPL; }
-  HRESULT Commit() override { return E_NOTIMPL; }
 
  private:
   std::wstring name_;
@@ -252,10 +244,6 @@ class Endpoint : public ComObject<IMMDevice, IID_IMMDevice> {
   }
   HRESULT GetId(LPWSTR* id) override {
     *id = taskString(name_);
-    return S_OK;
-  }
-  HRESULT GetState(DWORD* state) override {
-    *state = DEVICE_STATE_ACTIVE;
     return S_OK;
   }
 

@@ -16,14 +16,7 @@ class FakeCaptureSource : public ComObject<IMFCaptureSource, IID_IMFCaptureSourc
   IMFMediaType* videoType = nullptr;  // borrowed; null: no such stream
   IMFMediaType* audioType = nullptr;
 
-  HRESULT GetCaptureDeviceSource(MF_CAPTURE_ENGINE_DEVICE_TYPE, IMFMediaSource**) override { return E_NOTIMPL; }
-  HRESULT GetCaptureDeviceActivate(MF_CAPTURE_ENGINE_DEVICE_TYPE, IMFActivate**) override { return E_NOTIMPL; }
   HRESULT GetService(REFIID, REFIID, IUnknown**) override { return E_NOTIMPL; }
-  HRESULT AddEffect(DWORD, IUnknown*) override { return E_NOTIMPL; }
-  HRESULT RemoveEffect(DWORD, IUnknown*) override { return E_NOTIMPL; }
-  HRESULT RemoveAllEffects(DWORD) override { return E_NOTIMPL; }
-  HRESULT GetAvailableDeviceMediaType(DWORD, DWORD, IMFMediaType**) override { return E_NOTIMPL; }
-  HRESULT SetCurrentDeviceMediaType(DWORD, IMFMediaType*) override { return E_NOTIMPL; }
   HRESULT GetCurrentDeviceMediaType(DWORD stream, IMFMediaType** type) override {
     IMFMediaType* chosen = stream == MF_CAPTURE_ENGINE_PREFERRED_SOURCE_STREAM_FOR_AUDIO ? audioType : videoType;
     if (!chosen) return MF_E_INVALIDSTREAMNUMBER;
@@ -31,11 +24,6 @@ class FakeCaptureSource : public ComObject<IMFCaptureSource, IID_IMFCaptureSourc
     *type = chosen;
     return S_OK;
   }
-  HRESULT GetDeviceStreamCount(DWORD*) override { return E_NOTIMPL; }
-  HRESULT GetDeviceStreamCategory(DWORD, MF_CAPTURE_ENGINE_STREAM_CATEGORY*) override { return E_NOTIMPL; }
-  HRESULT GetMirrorState(DWORD, BOOL*) override { return E_NOTIMPL; }
-  HRESULT SetMirrorState(DWORD, BOOL) override { return E_NOTIMPL; }
-  HRESULT GetStreamIndexFromFriendlyName(UINT32, DWORD*) override { return E_NOTIMPL; }
 };
 
 // One object serves as the record sink and the preview sink.
@@ -50,7 +38,6 @@ class FakeSink : public ComObject<IMFCaptureRecordSink, IID_IMFCaptureSink, IID_
   int removeAllCalls = 0;
   HRESULT audioAnswer = S_OK;  // what AddStream answers for the audio stream
 
-  HRESULT GetOutputMediaType(DWORD, IMFMediaType**) override { return E_NOTIMPL; }
   HRESULT GetService(DWORD, REFGUID, REFIID, IUnknown**) override { return E_NOTIMPL; }
   HRESULT AddStream(DWORD source, IMFMediaType* type, IMFAttributes*, DWORD* index) override {
     if (source == MF_CAPTURE_ENGINE_PREFERRED_SOURCE_STREAM_FOR_AUDIO && FAILED(audioAnswer)) return audioAnswer;
@@ -60,20 +47,15 @@ class FakeSink : public ComObject<IMFCaptureRecordSink, IID_IMFCaptureSink, IID_
     *index = static_cast<DWORD>(added.size() - 1);
     return S_OK;
   }
-  HRESULT Prepare() override { return S_OK; }
   HRESULT RemoveAllStreams() override {
     ++removeAllCalls;
     return S_OK;
   }
-  HRESULT SetOutputByteStream(IMFByteStream*, REFGUID) override { return E_NOTIMPL; }
   HRESULT SetOutputFileName(LPCWSTR name) override {
     fileName = name;
     return S_OK;
   }
   HRESULT SetSampleCallback(DWORD, IMFCaptureEngineOnSampleCallback*) override { return S_OK; }
-  HRESULT SetCustomSink(IMFMediaSink*) override { return E_NOTIMPL; }
-  HRESULT GetRotation(DWORD, DWORD*) override { return E_NOTIMPL; }
-  HRESULT SetRotation(DWORD, DWORD) override { return E_NOTIMPL; }
 };
 
 class FakePreviewSink
@@ -88,7 +70,6 @@ class FakePreviewSink
   std::vector<IMFMediaType*> added;  // one reference each
   std::vector<IMFCaptureEngineOnSampleCallback*> callbacks;  // by sink stream index, one reference each
 
-  HRESULT GetOutputMediaType(DWORD, IMFMediaType**) override { return E_NOTIMPL; }
   HRESULT GetService(DWORD, REFGUID, REFIID, IUnknown**) override { return E_NOTIMPL; }
   HRESULT AddStream(DWORD source, IMFMediaType* type, IMFAttributes*, DWORD* index) override {
     sources.push_back(source);
@@ -98,11 +79,8 @@ class FakePreviewSink
     *index = static_cast<DWORD>(added.size() - 1);
     return S_OK;
   }
-  HRESULT Prepare() override { return S_OK; }
   HRESULT RemoveAllStreams() override { return E_NOTIMPL; }
   HRESULT SetRenderHandle(HANDLE) override { return E_NOTIMPL; }
-  HRESULT SetRenderSurface(IUnknown*) override { return E_NOTIMPL; }
-  HRESULT UpdateVideo(const MFVideoNormalizedRect*, const RECT*, const COLORREF*) override { return E_NOTIMPL; }
   HRESULT SetSampleCallback(DWORD index, IMFCaptureEngineOnSampleCallback* callback) override {
     if (index >= callbacks.size()) return MF_E_INVALIDSTREAMNUMBER;
     if (callbacks[index]) callbacks[index]->Release();
@@ -110,11 +88,6 @@ class FakePreviewSink
     callbacks[index] = callback;
     return S_OK;
   }
-  HRESULT GetMirrorState(BOOL*) override { return E_NOTIMPL; }
-  HRESULT SetMirrorState(BOOL) override { return E_NOTIMPL; }
-  HRESULT GetRotation(DWORD, DWORD*) override { return E_NOTIMPL; }
-  HRESULT SetRotation(DWORD, DWORD) override { return E_NOTIMPL; }
-  HRESULT SetCustomSink(IMFMediaSink*) override { return E_NOTIMPL; }
 };
 
 class FakeCaptureEngine : public ComObject<IMFCaptureEngine, IID_IMFCaptureEngine> {
@@ -147,7 +120,6 @@ class FakeCaptureEngine : public ComObject<IMFCaptureEngine, IID_IMFCaptureEngin
     ++stopRecordCalls;
     return answered(MF_CAPTURE_ENGINE_RECORD_STOPPED, S_OK);
   }
-  HRESULT TakePhoto() override { return E_NOTIMPL; }
   HRESULT GetSink(MF_CAPTURE_ENGINE_SINK_TYPE type, IMFCaptureSink** result) override {
     ++getSinkCalls;
     IMFCaptureSink* chosen = type == MF_CAPTURE_ENGINE_SINK_TYPE_PREVIEW ? static_cast<IMFCaptureSink*>(preview)

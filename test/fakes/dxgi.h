@@ -136,7 +136,6 @@ class Context : public Counted<ID3D11DeviceContext> {
     mapped->DepthPitch = 0;
     return S_OK;
   }
-  void Unmap(ID3D11Resource*, UINT) override {}
   bool answers(REFIID riid) override { return riid == IID_ID3D11DeviceContext; }
   HRESULT mapResult = S_OK;
   int copies = 0, maps = 0;
@@ -157,7 +156,6 @@ class Device : public Counted<ID3D11Device> {
     *out = &context;
   }
   D3D_FEATURE_LEVEL GetFeatureLevel() override { return D3D_FEATURE_LEVEL_11_0; }
-  UINT GetCreationFlags() override { return 0; }
   bool answers(REFIID riid) override { return riid == IID_ID3D11Device; }
 
   Context context;

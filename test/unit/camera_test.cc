@@ -37,10 +37,6 @@ class FakeEvent : public platform::Attributes<IMFMediaEvent, IID_IMFMediaEvent> 
  public:
   FakeEvent(const GUID& type, HRESULT status, bool typeReadable = true)
       : type_(type), status_(status), typeReadable_(typeReadable) {}
-  HRESULT GetType(MediaEventType* type) override {
-    *type = MEExtendedType;
-    return S_OK;
-  }
   HRESULT GetExtendedType(GUID* type) override {
     if (!typeReadable_) return E_FAIL;
     *type = type_;

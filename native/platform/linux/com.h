@@ -136,7 +136,6 @@ struct IUnknown {
 
 struct IClassFactory : IUnknown {
   virtual HRESULT CreateInstance(IUnknown* outer, REFIID riid, void** object) = 0;
-  virtual HRESULT LockServer(BOOL lock) = 0;
 };
 
 namespace platform {

@@ -55,22 +55,6 @@ struct DXGI_OUTPUT_DESC {
   HMONITOR Monitor;
 };
 
-struct DXGI_ADAPTER_DESC1 {
-  WCHAR Description[128];
-  UINT VendorId;
-  UINT DeviceId;
-  UINT SubSysId;
-  UINT Revision;
-  SIZE_T DedicatedVideoMemory;
-  SIZE_T DedicatedSystemMemory;
-  SIZE_T SharedSystemMemory;
-  struct {
-    DWORD LowPart;
-    LONG HighPart;
-  } AdapterLuid;
-  UINT Flags;
-};
-
 enum DXGI_OUTDUPL_POINTER_SHAPE_TYPE : UINT {
   DXGI_OUTDUPL_POINTER_SHAPE_TYPE_MONOCHROME = 1,
   DXGI_OUTDUPL_POINTER_SHAPE_TYPE_COLOR = 2,
@@ -203,7 +187,6 @@ struct IDXGIAdapter : IDXGIObject {
 };
 
 struct IDXGIAdapter1 : IDXGIAdapter {
-  virtual HRESULT GetDesc1(DXGI_ADAPTER_DESC1* desc) = 0;
 };
 
 struct IDXGIFactory : IDXGIObject {};
@@ -232,21 +215,16 @@ struct ID3D11Device : IUnknown {
                                   ID3D11Texture2D** texture) = 0;
   virtual void GetImmediateContext(ID3D11DeviceContext** context) = 0;
   virtual D3D_FEATURE_LEVEL GetFeatureLevel() = 0;
-  virtual UINT GetCreationFlags() = 0;
 };
 
 struct ID3D11DeviceContext : IUnknown {
   virtual void CopyResource(ID3D11Resource* destination, ID3D11Resource* source) = 0;
   virtual HRESULT Map(ID3D11Resource* resource, UINT subresource, D3D11_MAP mapType, UINT mapFlags,
                       D3D11_MAPPED_SUBRESOURCE* mapped) = 0;
-  virtual void Unmap(ID3D11Resource* resource, UINT subresource) = 0;
 };
 
 struct ID3D10Multithread : IUnknown {
-  virtual void Enter() = 0;
-  virtual void Leave() = 0;
   virtual BOOL SetMultithreadProtected(BOOL protect) = 0;
-  virtual BOOL GetMultithreadProtected() = 0;
 };
 
 HRESULT CreateDXGIFactory1(REFIID riid, void** factory);

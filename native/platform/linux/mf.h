@@ -26,7 +26,6 @@ constexpr HRESULT MF_E_INVALIDSTREAMNUMBER = hresult(0xC00D36B3);
 constexpr HRESULT MF_E_INVALIDMEDIATYPE = hresult(0xC00D36B4);
 constexpr HRESULT MF_E_NOTACCEPTING = hresult(0xC00D36B5);
 constexpr HRESULT MF_E_NOT_INITIALIZED = hresult(0xC00D36B6);
-constexpr HRESULT MF_E_UNSUPPORTED_REPRESENTATION = hresult(0xC00D36B7);
 constexpr HRESULT MF_E_NO_MORE_TYPES = hresult(0xC00D36B9);
 constexpr HRESULT MF_E_UNSUPPORTED_SERVICE = hresult(0xC00D36BA);
 constexpr HRESULT MF_E_UNEXPECTED = hresult(0xC00D36BB);
@@ -74,7 +73,6 @@ enum MF_ATTRIBUTES_MATCH_TYPE : DWORD {
 using REFPROPVARIANT = const PROPVARIANT&;
 using QWORD = uint64_t;
 using UINT8 = uint8_t;
-using MediaEventType = DWORD;
 
 enum MFVideoInterlaceMode : DWORD {
   MFVideoInterlace_Unknown = 0,
@@ -141,7 +139,6 @@ struct IMFAttributes : IUnknown {
   virtual HRESULT Compare(IMFAttributes* theirs, MF_ATTRIBUTES_MATCH_TYPE matchType, BOOL* result) = 0;
   virtual HRESULT GetUINT32(REFGUID key, UINT32* value) = 0;
   virtual HRESULT GetUINT64(REFGUID key, UINT64* value) = 0;
-  virtual HRESULT GetDouble(REFGUID key, double* value) = 0;
   virtual HRESULT GetGUID(REFGUID key, GUID* value) = 0;
   virtual HRESULT GetStringLength(REFGUID key, UINT32* length) = 0;
   virtual HRESULT GetString(REFGUID key, LPWSTR value, UINT32 bufferSize, UINT32* length) = 0;
@@ -160,8 +157,6 @@ struct IMFAttributes : IUnknown {
   virtual HRESULT SetString(REFGUID key, LPCWSTR value) = 0;
   virtual HRESULT SetBlob(REFGUID key, const UINT8* buffer, UINT32 size) = 0;
   virtual HRESULT SetUnknown(REFGUID key, IUnknown* value) = 0;
-  virtual HRESULT LockStore() = 0;
-  virtual HRESULT UnlockStore() = 0;
   virtual HRESULT GetCount(UINT32* count) = 0;
   virtual HRESULT GetItemByIndex(UINT32 index, GUID* key, PROPVARIANT* value) = 0;
   virtual HRESULT CopyAllItems(IMFAttributes* destination) = 0;
@@ -171,8 +166,6 @@ struct IMFMediaType : IMFAttributes {
   virtual HRESULT GetMajorType(GUID* majorType) = 0;
   virtual HRESULT IsCompressedFormat(BOOL* compressed) = 0;
   virtual HRESULT IsEqual(IMFMediaType* other, DWORD* flags) = 0;
-  virtual HRESULT GetRepresentation(GUID representation, LPVOID* value) = 0;
-  virtual HRESULT FreeRepresentation(GUID representation, LPVOID value) = 0;
 };
 
 struct IMFMediaBuffer : IUnknown {
@@ -184,8 +177,6 @@ struct IMFMediaBuffer : IUnknown {
 };
 
 struct IMFSample : IMFAttributes {
-  virtual HRESULT GetSampleFlags(DWORD* flags) = 0;
-  virtual HRESULT SetSampleFlags(DWORD flags) = 0;
   virtual HRESULT GetSampleTime(LONGLONG* time) = 0;
   virtual HRESULT SetSampleTime(LONGLONG time) = 0;
   virtual HRESULT GetSampleDuration(LONGLONG* duration) = 0;
@@ -194,8 +185,6 @@ struct IMFSample : IMFAttributes {
   virtual HRESULT GetBufferByIndex(DWORD index, IMFMediaBuffer** buffer) = 0;
   virtual HRESULT ConvertToContiguousBuffer(IMFMediaBuffer** buffer) = 0;
   virtual HRESULT AddBuffer(IMFMediaBuffer* buffer) = 0;
-  virtual HRESULT RemoveBufferByIndex(DWORD index) = 0;
-  virtual HRESULT RemoveAllBuffers() = 0;
   virtual HRESULT GetTotalLength(DWORD* length) = 0;
   virtual HRESULT CopyToBuffer(IMFMediaBuffer* buffer) = 0;
 };
@@ -206,18 +195,13 @@ struct IMFCollection : IUnknown {
   virtual HRESULT AddElement(IUnknown* element) = 0;
   virtual HRESULT RemoveElement(DWORD index, IUnknown** element) = 0;
   virtual HRESULT InsertElementAt(DWORD index, IUnknown* element) = 0;
-  virtual HRESULT RemoveAllElements() = 0;
 };
 
 // Declared here as the SDK's mfobjects.h does; the capture family makes the objects.
 struct IMFActivate : IMFAttributes {
-  virtual HRESULT ActivateObject(REFIID riid, void** object) = 0;
-  virtual HRESULT ShutdownObject() = 0;
-  virtual HRESULT DetachObject() = 0;
 };
 
 struct IMFMediaEvent : IMFAttributes {
-  virtual HRESULT GetType(MediaEventType* type) = 0;
   virtual HRESULT GetExtendedType(GUID* extendedType) = 0;
   virtual HRESULT GetStatus(HRESULT* status) = 0;
   virtual HRESULT GetValue(PROPVARIANT* value) = 0;
@@ -233,10 +217,7 @@ struct IMFSinkWriter : IUnknown {
   virtual HRESULT WriteSample(DWORD streamIndex, IMFSample* sample) = 0;
   virtual HRESULT SendStreamTick(DWORD streamIndex, LONGLONG timestamp) = 0;
   virtual HRESULT PlaceMarker(DWORD streamIndex, LPVOID context) = 0;
-  virtual HRESULT NotifyEndOfSegment(DWORD streamIndex) = 0;
-  virtual HRESULT Flush(DWORD streamIndex) = 0;
   virtual HRESULT Finalize() = 0;
-  virtual HRESULT GetServiceForStream(DWORD streamIndex, REFGUID service, REFIID riid, LPVOID* object) = 0;
   virtual HRESULT GetStatistics(DWORD streamIndex, MF_SINK_WRITER_STATISTICS* stats) = 0;
 };
 

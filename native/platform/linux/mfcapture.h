@@ -26,8 +26,6 @@ enum _MFT_ENUM_FLAG : UINT32 {
   MFT_ENUM_FLAG_ALL = 0x3F,
 };
 
-constexpr MediaEventType MEError = 1;
-constexpr MediaEventType MEExtendedType = 2;
 
 // Engine events (extended types of the events handed to IMFCaptureEngineOnEventCallback).
 inline constexpr GUID MF_CAPTURE_ENGINE_INITIALIZED = {0x219992bc, 0xcf92, 0x4531, {0xa1, 0xae, 0x96, 0xe1, 0xe8, 0x86, 0xc8, 0xf1}};
@@ -64,10 +62,6 @@ inline constexpr GUID IID_IMFDXGIDeviceManager = {0xeb533d5d, 0x2db6, 0x40f8, {0
 inline constexpr GUID CLSID_MFCaptureEngine = {0xefce38d3, 0x8914, 0x4674, {0xa7, 0xdf, 0xae, 0x1b, 0x3d, 0x65, 0x4b, 0x8a}};
 inline constexpr GUID CLSID_MFCaptureEngineClassFactory = {0xefce38d3, 0x8914, 0x4674, {0xa7, 0xdf, 0xae, 0x1b, 0x3d, 0x65, 0x4b, 0x8a}};
 
-enum MF_CAPTURE_ENGINE_DEVICE_TYPE : DWORD {
-  MF_CAPTURE_ENGINE_DEVICE_TYPE_AUDIO = 0,
-  MF_CAPTURE_ENGINE_DEVICE_TYPE_VIDEO = 1,
-};
 enum MF_CAPTURE_ENGINE_SINK_TYPE : DWORD {
   MF_CAPTURE_ENGINE_SINK_TYPE_RECORD = 0,
   MF_CAPTURE_ENGINE_SINK_TYPE_PREVIEW = 1,
@@ -81,24 +75,6 @@ enum : DWORD {
   MF_CAPTURE_ENGINE_PREFERRED_SOURCE_STREAM_FOR_METADATA = 0xFFFFFFF6,
   MF_CAPTURE_ENGINE_MEDIASOURCE = 0xFFFFFFFF,
 };
-enum MF_CAPTURE_ENGINE_STREAM_CATEGORY : DWORD {
-  MF_CAPTURE_ENGINE_STREAM_CATEGORY_VIDEO_PREVIEW = 0,
-  MF_CAPTURE_ENGINE_STREAM_CATEGORY_VIDEO_CAPTURE = 1,
-  MF_CAPTURE_ENGINE_STREAM_CATEGORY_PHOTO_INDEPENDENT = 2,
-  MF_CAPTURE_ENGINE_STREAM_CATEGORY_PHOTO_DEPENDENT = 3,
-  MF_CAPTURE_ENGINE_STREAM_CATEGORY_AUDIO = 4,
-  MF_CAPTURE_ENGINE_STREAM_CATEGORY_UNSUPPORTED = 5,
-};
-
-using COLORREF = DWORD;
-struct MFVideoNormalizedRect {
-  float left;
-  float top;
-  float right;
-  float bottom;
-};
-struct IMFMediaSource;  // not provided: devices are reached through their activation objects
-struct IMFMediaSink;    // not provided: the sinks write themselves
 
 struct IMFCaptureEngineOnEventCallback : IUnknown {
   virtual HRESULT OnEvent(IMFMediaEvent* event) = 0;
@@ -109,51 +85,25 @@ struct IMFCaptureEngineOnSampleCallback : IUnknown {
 };
 
 struct IMFCaptureSink : IUnknown {
-  virtual HRESULT GetOutputMediaType(DWORD sinkStreamIndex, IMFMediaType** mediaType) = 0;
   virtual HRESULT GetService(DWORD sinkStreamIndex, REFGUID service, REFIID riid, IUnknown** object) = 0;
   virtual HRESULT AddStream(DWORD sourceStreamIndex, IMFMediaType* mediaType, IMFAttributes* attributes,
                             DWORD* sinkStreamIndex) = 0;
-  virtual HRESULT Prepare() = 0;
   virtual HRESULT RemoveAllStreams() = 0;
 };
 
 struct IMFCaptureRecordSink : IMFCaptureSink {
-  virtual HRESULT SetOutputByteStream(IMFByteStream* byteStream, REFGUID containerType) = 0;
   virtual HRESULT SetOutputFileName(LPCWSTR fileName) = 0;
   virtual HRESULT SetSampleCallback(DWORD sinkStreamIndex, IMFCaptureEngineOnSampleCallback* callback) = 0;
-  virtual HRESULT SetCustomSink(IMFMediaSink* mediaSink) = 0;
-  virtual HRESULT GetRotation(DWORD streamIndex, DWORD* rotation) = 0;
-  virtual HRESULT SetRotation(DWORD streamIndex, DWORD rotation) = 0;
 };
 
 struct IMFCapturePreviewSink : IMFCaptureSink {
   virtual HRESULT SetRenderHandle(HANDLE handle) = 0;
-  virtual HRESULT SetRenderSurface(IUnknown* surface) = 0;
-  virtual HRESULT UpdateVideo(const MFVideoNormalizedRect* source, const RECT* destination, const COLORREF* border) = 0;
   virtual HRESULT SetSampleCallback(DWORD sinkStreamIndex, IMFCaptureEngineOnSampleCallback* callback) = 0;
-  virtual HRESULT GetMirrorState(BOOL* mirrored) = 0;
-  virtual HRESULT SetMirrorState(BOOL mirrored) = 0;
-  virtual HRESULT GetRotation(DWORD streamIndex, DWORD* rotation) = 0;
-  virtual HRESULT SetRotation(DWORD streamIndex, DWORD rotation) = 0;
-  virtual HRESULT SetCustomSink(IMFMediaSink* mediaSink) = 0;
 };
 
 struct IMFCaptureSource : IUnknown {
-  virtual HRESULT GetCaptureDeviceSource(MF_CAPTURE_ENGINE_DEVICE_TYPE type, IMFMediaSource** source) = 0;
-  virtual HRESULT GetCaptureDeviceActivate(MF_CAPTURE_ENGINE_DEVICE_TYPE type, IMFActivate** activate) = 0;
   virtual HRESULT GetService(REFIID service, REFIID riid, IUnknown** object) = 0;
-  virtual HRESULT AddEffect(DWORD sourceStreamIndex, IUnknown* effect) = 0;
-  virtual HRESULT RemoveEffect(DWORD sourceStreamIndex, IUnknown* effect) = 0;
-  virtual HRESULT RemoveAllEffects(DWORD sourceStreamIndex) = 0;
-  virtual HRESULT GetAvailableDeviceMediaType(DWORD sourceStreamIndex, DWORD mediaTypeIndex,
-                                              IMFMediaType** mediaType) = 0;
-  virtual HRESULT SetCurrentDeviceMediaType(DWORD sourceStreamIndex, IMFMediaType* mediaType) = 0;
   virtual HRESULT GetCurrentDeviceMediaType(DWORD sourceStreamIndex, IMFMediaType** mediaType) = 0;
-  virtual HRESULT GetDeviceStreamCount(DWORD* count) = 0;
-  virtual HRESULT GetDeviceStreamCategory(DWORD sourceStreamIndex, MF_CAPTURE_ENGINE_STREAM_CATEGORY* category) = 0;
-  virtual HRESULT GetMirrorState(DWORD streamIndex, BOOL* mirrored) = 0;
-  virtual HRESULT SetMirrorState(DWORD streamIndex, BOOL mirrored) = 0;
-  virtual HRESULT GetStreamIndexFromFriendlyName(UINT32 friendlyName, DWORD* streamIndex) = 0;
 };
 
 struct IMFCaptureEngine : IUnknown {
@@ -163,7 +113,6 @@ struct IMFCaptureEngine : IUnknown {
   virtual HRESULT StopPreview() = 0;
   virtual HRESULT StartRecord() = 0;
   virtual HRESULT StopRecord(BOOL finalize, BOOL flushUnprocessedSamples) = 0;
-  virtual HRESULT TakePhoto() = 0;
   virtual HRESULT GetSink(MF_CAPTURE_ENGINE_SINK_TYPE type, IMFCaptureSink** sink) = 0;
   virtual HRESULT GetSource(IMFCaptureSource** source) = 0;
 };
@@ -173,13 +122,7 @@ struct IMFCaptureEngineClassFactory : IUnknown {
 };
 
 struct IMFDXGIDeviceManager : IUnknown {
-  virtual HRESULT CloseDeviceHandle(HANDLE device) = 0;
-  virtual HRESULT GetVideoService(HANDLE device, REFIID riid, void** service) = 0;
-  virtual HRESULT LockDevice(HANDLE device, REFIID riid, void** object, BOOL block) = 0;
-  virtual HRESULT OpenDeviceHandle(HANDLE* device) = 0;
   virtual HRESULT ResetDevice(IUnknown* device, UINT resetToken) = 0;
-  virtual HRESULT TestDevice(HANDLE device) = 0;
-  virtual HRESULT UnlockDevice(HANDLE device, BOOL saveState) = 0;
 };
 
 HRESULT MFEnumDeviceSources(IMFAttributes* attributes, IMFActivate*** devices, UINT32* count);

@@ -52,7 +52,6 @@ constexpr HRESULT AUDCLNT_E_BUFFER_OPERATION_PENDING = audclntError(0xB);
 constexpr HRESULT AUDCLNT_E_EXCLUSIVE_MODE_NOT_ALLOWED = audclntError(0xE);
 constexpr HRESULT AUDCLNT_E_ENDPOINT_CREATE_FAILED = audclntError(0xF);
 constexpr HRESULT AUDCLNT_E_SERVICE_NOT_RUNNING = audclntError(0x10);
-constexpr HRESULT AUDCLNT_E_EVENTHANDLE_NOT_EXPECTED = audclntError(0x11);
 constexpr HRESULT AUDCLNT_S_BUFFER_EMPTY = audclntSuccess(0x1);
 
 inline constexpr GUID CLSID_MMDeviceEnumerator = {
@@ -76,17 +75,13 @@ inline constexpr PROPERTYKEY PKEY_Device_FriendlyName = {
 
 struct IPropertyStore : IUnknown {
   virtual HRESULT GetCount(DWORD* count) = 0;
-  virtual HRESULT GetAt(DWORD index, PROPERTYKEY* key) = 0;
   virtual HRESULT GetValue(REFPROPERTYKEY key, PROPVARIANT* value) = 0;
-  virtual HRESULT SetValue(REFPROPERTYKEY key, REFPROPVARIANT value) = 0;
-  virtual HRESULT Commit() = 0;
 };
 
 struct IMMDevice : IUnknown {
   virtual HRESULT Activate(REFIID iid, DWORD context, PROPVARIANT* activationParams, void** object) = 0;
   virtual HRESULT OpenPropertyStore(DWORD access, IPropertyStore** properties) = 0;
   virtual HRESULT GetId(LPWSTR* id) = 0;
-  virtual HRESULT GetState(DWORD* state) = 0;
 };
 
 struct IMMDeviceCollection : IUnknown {
@@ -94,30 +89,21 @@ struct IMMDeviceCollection : IUnknown {
   virtual HRESULT Item(UINT index, IMMDevice** device) = 0;
 };
 
-struct IMMNotificationClient;
-
 struct IMMDeviceEnumerator : IUnknown {
   virtual HRESULT EnumAudioEndpoints(EDataFlow dataFlow, DWORD stateMask, IMMDeviceCollection** devices) = 0;
   virtual HRESULT GetDefaultAudioEndpoint(EDataFlow dataFlow, ERole role, IMMDevice** endpoint) = 0;
-  virtual HRESULT GetDevice(LPCWSTR id, IMMDevice** device) = 0;
-  virtual HRESULT RegisterEndpointNotificationCallback(IMMNotificationClient* client) = 0;
-  virtual HRESULT UnregisterEndpointNotificationCallback(IMMNotificationClient* client) = 0;
 };
 
 struct IAudioClient : IUnknown {
   virtual HRESULT Initialize(AUDCLNT_SHAREMODE shareMode, DWORD streamFlags, REFERENCE_TIME bufferDuration,
                              REFERENCE_TIME periodicity, const WAVEFORMATEX* format, LPCGUID sessionGuid) = 0;
   virtual HRESULT GetBufferSize(UINT32* bufferFrames) = 0;
-  virtual HRESULT GetStreamLatency(REFERENCE_TIME* latency) = 0;
   virtual HRESULT GetCurrentPadding(UINT32* paddingFrames) = 0;
   virtual HRESULT IsFormatSupported(AUDCLNT_SHAREMODE shareMode, const WAVEFORMATEX* format,
                                     WAVEFORMATEX** closestMatch) = 0;
   virtual HRESULT GetMixFormat(WAVEFORMATEX** deviceFormat) = 0;
-  virtual HRESULT GetDevicePeriod(REFERENCE_TIME* defaultPeriod, REFERENCE_TIME* minimumPeriod) = 0;
   virtual HRESULT Start() = 0;
-  virtual HRESULT Stop() = 0;
   virtual HRESULT Reset() = 0;
-  virtual HRESULT SetEventHandle(HANDLE event) = 0;
   virtual HRESULT GetService(REFIID riid, void** object) = 0;
 };
 
@@ -125,7 +111,6 @@ struct IAudioCaptureClient : IUnknown {
   virtual HRESULT GetBuffer(BYTE** data, UINT32* framesToRead, DWORD* flags, UINT64* devicePosition,
                             UINT64* qpcPosition) = 0;
   virtual HRESULT ReleaseBuffer(UINT32 framesRead) = 0;
-  virtual HRESULT GetNextPacketSize(UINT32* framesInNextPacket) = 0;
 };
 
 struct IAudioRenderClient : IUnknown {

@@ -51,11 +51,6 @@ constexpr LONGLONG ticksPerSecond = 10000000;  // media times are in 100 ns unit
 class MediaEvent : public Attributes<IMFMediaEvent, IID_IMFMediaEvent> {
  public:
   MediaEvent(const GUID& type, HRESULT status) : type_(type), status_(status) {}
-  HRESULT GetType(MediaEventType* type) override {
-    if (!type) return E_POINTER;
-    *type = MEExtendedType;
-    return S_OK;
-  }
   HRESULT GetExtendedType(GUID* type) override {
     if (!type) return E_POINTER;
     *type = type_;
@@ -978,26 +973,10 @@ void EngineThread::run() {
 class CaptureSource : public ComObject<IMFCaptureSource, IID_IMFCaptureSource> {
  public:
   explicit CaptureSource(std::shared_ptr<EngineState> state) : state_(std::move(state)) {}
-  HRESULT GetCaptureDeviceSource(MF_CAPTURE_ENGINE_DEVICE_TYPE, IMFMediaSource** source) override {
-    if (source) *source = nullptr;
-    return E_NOTIMPL;
-  }
-  HRESULT GetCaptureDeviceActivate(MF_CAPTURE_ENGINE_DEVICE_TYPE, IMFActivate** activate) override {
-    if (activate) *activate = nullptr;
-    return E_NOTIMPL;
-  }
   HRESULT GetService(REFIID, REFIID, IUnknown** object) override {
     if (object) *object = nullptr;
     return MF_E_UNSUPPORTED_SERVICE;
   }
-  HRESULT AddEffect(DWORD, IUnknown*) override { return E_NOTIMPL; }
-  HRESULT RemoveEffect(DWORD, IUnknown*) override { return E_NOTIMPL; }
-  HRESULT RemoveAllEffects(DWORD) override { return S_OK; }
-  HRESULT GetAvailableDeviceMediaType(DWORD stream, DWORD index, IMFMediaType** type) override {
-    if (index != 0) return MF_E_NO_MORE_TYPES;  // the device is used as it is set up
-    return GetCurrentDeviceMediaType(stream, type);
-  }
-  HRESULT SetCurrentDeviceMediaType(DWORD, IMFMediaType*) override { return E_NOTIMPL; }
   HRESULT GetCurrentDeviceMediaType(DWORD stream, IMFMediaType** type) override {
     if (!type) return E_POINTER;
     *type = nullptr;
@@ -1007,29 +986,6 @@ class CaptureSource : public ComObject<IMFCaptureSource, IID_IMFCaptureSource> {
     Device* device = state_->deviceFor(stream);
     if (!device) return MF_E_INVALIDSTREAMNUMBER;
     return makeDeviceType(*device, type);
-  }
-  HRESULT GetDeviceStreamCount(DWORD* count) override {
-    if (!count) return E_POINTER;
-    *count = (state_->video ? 1 : 0) + (state_->audio ? 1 : 0);
-    return S_OK;
-  }
-  HRESULT GetDeviceStreamCategory(DWORD stream, MF_CAPTURE_ENGINE_STREAM_CATEGORY* category) override {
-    if (!category) return E_POINTER;
-    Device* device = state_->deviceFor(stream);
-    if (!device) return MF_E_INVALIDSTREAMNUMBER;
-    *category = device->video ? MF_CAPTURE_ENGINE_STREAM_CATEGORY_VIDEO_CAPTURE : MF_CAPTURE_ENGINE_STREAM_CATEGORY_AUDIO;
-    return S_OK;
-  }
-  HRESULT GetMirrorState(DWORD, BOOL* mirrored) override {
-    if (!mirrored) return E_POINTER;
-    *mirrored = FALSE;
-    return S_OK;
-  }
-  HRESULT SetMirrorState(DWORD, BOOL) override { return E_NOTIMPL; }
-  HRESULT GetStreamIndexFromFriendlyName(UINT32 name, DWORD* stream) override {
-    if (!stream) return E_POINTER;
-    *stream = name;
-    return state_->deviceFor(name) ? S_OK : MF_E_INVALIDSTREAMNUMBER;
   }
 
  private:
@@ -1061,26 +1017,10 @@ template <class I, const GUID& Iid, std::vector<SinkStream> EngineState::*List>
 class Sink : public ComObject<I, IID_IMFCaptureSink, Iid> {
  public:
   explicit Sink(std::shared_ptr<EngineState> state) : state_(std::move(state)) {}
-  HRESULT GetOutputMediaType(DWORD index, IMFMediaType** type) override {
-    if (!type) return E_POINTER;
-    std::lock_guard<std::mutex> lock(state_->mutex);
-    if (index >= streams().size()) return MF_E_INVALIDSTREAMNUMBER;
-    *type = streams()[index].type.p;
-    (*type)->AddRef();
-    return S_OK;
-  }
   HRESULT GetService(DWORD, REFGUID, REFIID, IUnknown** object) override {
     if (object) *object = nullptr;
     return MF_E_UNSUPPORTED_SERVICE;
   }
-  HRESULT Prepare() override { return S_OK; }
-  HRESULT SetCustomSink(IMFMediaSink*) override { return E_NOTIMPL; }
-  HRESULT GetRotation(DWORD, DWORD* rotation) override {
-    if (!rotation) return E_POINTER;
-    *rotation = 0;
-    return S_OK;
-  }
-  HRESULT SetRotation(DWORD, DWORD) override { return E_NOTIMPL; }
 
  protected:
   std::vector<SinkStream>& streams() { return (*state_).*List; }
@@ -1110,20 +1050,12 @@ class PreviewSink : public Sink<IMFCapturePreviewSink, IID_IMFCapturePreviewSink
     return S_OK;
   }
   HRESULT SetRenderHandle(HANDLE) override { return E_NOTIMPL; }
-  HRESULT SetRenderSurface(IUnknown*) override { return E_NOTIMPL; }
-  HRESULT UpdateVideo(const MFVideoNormalizedRect*, const RECT*, const COLORREF*) override { return E_NOTIMPL; }
   HRESULT SetSampleCallback(DWORD index, IMFCaptureEngineOnSampleCallback* callback) override {
     std::lock_guard<std::mutex> lock(state_->mutex);
     if (index >= streams().size()) return MF_E_INVALIDSTREAMNUMBER;
     streams()[index].callback = ComPtr<IMFCaptureEngineOnSampleCallback>(callback, true);
     return S_OK;
   }
-  HRESULT GetMirrorState(BOOL* mirrored) override {
-    if (!mirrored) return E_POINTER;
-    *mirrored = FALSE;
-    return S_OK;
-  }
-  HRESULT SetMirrorState(BOOL) override { return E_NOTIMPL; }
 };
 
 class RecordSink : public Sink<IMFCaptureRecordSink, IID_IMFCaptureRecordSink, &EngineState::recordStreams> {
@@ -1138,7 +1070,6 @@ class RecordSink : public Sink<IMFCaptureRecordSink, IID_IMFCaptureRecordSink, &
     streams().clear();
     return S_OK;
   }
-  HRESULT SetOutputByteStream(IMFByteStream*, REFGUID) override { return E_NOTIMPL; }
   HRESULT SetOutputFileName(LPCWSTR name) override {
     if (!name) return E_POINTER;
     std::lock_guard<std::mutex> lock(state_->mutex);
@@ -1194,7 +1125,6 @@ class CaptureEngine : public ComObject<IMFCaptureEngine, IID_IMFCaptureEngine> {
   HRESULT StopPreview() override { return queue(Command::StopPreview); }
   HRESULT StartRecord() override { return queue(Command::StartRecord); }
   HRESULT StopRecord(BOOL, BOOL) override { return queue(Command::StopRecord); }
-  HRESULT TakePhoto() override { return E_NOTIMPL; }
   HRESULT GetSink(MF_CAPTURE_ENGINE_SINK_TYPE type, IMFCaptureSink** sink) override {
     if (!sink) return E_POINTER;
     *sink = nullptr;

@@ -26,13 +26,6 @@ namespace {
 
 class DeviceActivate : public Attributes<IMFActivate, IID_IMFActivate> {
  public:
-  // The engine opens the device itself from the link attribute; there is no media source object.
-  HRESULT ActivateObject(REFIID, void** object) override {
-    if (object) *object = nullptr;
-    return E_NOTIMPL;
-  }
-  HRESULT ShutdownObject() override { return S_OK; }
-  HRESULT DetachObject() override { return S_OK; }
 };
 
 struct Device {

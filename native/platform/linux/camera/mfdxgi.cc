@@ -12,22 +12,6 @@ class DXGIDeviceManager : public ComObject<IMFDXGIDeviceManager, IID_IMFDXGIDevi
   UINT token() const { return token_; }
   ~DXGIDeviceManager() override { release(device_); }
 
-  HRESULT CloseDeviceHandle(HANDLE) override { return S_OK; }
-  HRESULT GetVideoService(HANDLE, REFIID, void** service) override {
-    if (service) *service = nullptr;
-    return E_NOINTERFACE;
-  }
-  HRESULT LockDevice(HANDLE, REFIID riid, void** object, BOOL) override {
-    if (!object) return E_POINTER;
-    *object = nullptr;
-    if (!device_) return MF_E_NOT_INITIALIZED;
-    return device_->QueryInterface(riid, object);
-  }
-  HRESULT OpenDeviceHandle(HANDLE* handle) override {
-    if (!handle) return E_POINTER;
-    *handle = device_;
-    return device_ ? S_OK : MF_E_NOT_INITIALIZED;
-  }
   HRESULT ResetDevice(IUnknown* device, UINT token) override {
     if (!device) return E_INVALIDARG;
     if (token != token_) return E_INVALIDARG;
@@ -36,8 +20,6 @@ class DXGIDeviceManager : public ComObject<IMFDXGIDeviceManager, IID_IMFDXGIDevi
     device_ = device;
     return S_OK;
   }
-  HRESULT TestDevice(HANDLE) override { return device_ ? S_OK : MF_E_NOT_INITIALIZED; }
-  HRESULT UnlockDevice(HANDLE, BOOL) override { return S_OK; }
 
  private:
   UINT token_;

@@ -974,20 +974,7 @@ class SinkWriter : public ComObject<IMFSinkWriter, IID_IMFSinkWriter> {
     return MF_E_INVALIDREQUEST;
   }
 
-  HRESULT NotifyEndOfSegment(DWORD streamIndex) override {
-    std::lock_guard<std::mutex> lock(mutex_);
-    if (streamIndex != MF_SINK_WRITER_ALL_STREAMS && streamIndex >= streams_.size()) return MF_E_INVALIDSTREAMNUMBER;
-    return state_ == State::writing ? S_OK : MF_E_INVALIDREQUEST;
-  }
 
-  HRESULT Flush(DWORD streamIndex) override {
-    std::lock_guard<std::mutex> lock(mutex_);
-    if (streamIndex != MF_SINK_WRITER_ALL_STREAMS && streamIndex >= streams_.size()) return MF_E_INVALIDSTREAMNUMBER;
-    if (state_ != State::writing) return MF_E_INVALIDREQUEST;
-    for (size_t i = 0; i < streams_.size(); ++i)
-      if (streamIndex == MF_SINK_WRITER_ALL_STREAMS || i == streamIndex) streams_[i].encoder->flush();
-    return S_OK;
-  }
 
   HRESULT Finalize() override {
     std::lock_guard<std::mutex> lock(mutex_);
@@ -1015,10 +1002,6 @@ class SinkWriter : public ComObject<IMFSinkWriter, IID_IMFSinkWriter> {
     return hr;
   }
 
-  HRESULT GetServiceForStream(DWORD, REFGUID, REFIID, LPVOID* object) override {
-    if (object) *object = nullptr;
-    return MF_E_UNSUPPORTED_SERVICE;
-  }
 
   HRESULT GetStatistics(DWORD streamIndex, MF_SINK_WRITER_STATISTICS* stats) override {
     if (!stats) return E_INVALIDARG;

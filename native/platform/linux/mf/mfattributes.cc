@@ -414,12 +414,6 @@ class MediaType : public Attributes<IMFMediaType, IID_IMFMediaType> {
     return *flags == 0xF ? S_OK : S_FALSE;
   }
 
-  // No other representations (AM_MEDIA_TYPE, wave formats) are offered here.
-  HRESULT GetRepresentation(GUID, LPVOID* value) override {
-    if (value) *value = nullptr;
-    return MF_E_UNSUPPORTED_REPRESENTATION;
-  }
-  HRESULT FreeRepresentation(GUID, LPVOID) override { return MF_E_UNSUPPORTED_REPRESENTATION; }
 };
 
 }  // namespace

@@ -90,7 +90,6 @@ class Attributes : public ComObject<I, IID_IMFAttributes, Iids...> {
   }
   HRESULT GetUINT32(REFGUID key, UINT32* value) override { return attributes_.getUINT32(key, value); }
   HRESULT GetUINT64(REFGUID key, UINT64* value) override { return attributes_.getUINT64(key, value); }
-  HRESULT GetDouble(REFGUID key, double* value) override { return attributes_.getDouble(key, value); }
   HRESULT GetGUID(REFGUID key, GUID* value) override { return attributes_.getGUID(key, value); }
   HRESULT GetStringLength(REFGUID key, UINT32* length) override { return attributes_.getStringLength(key, length); }
   HRESULT GetString(REFGUID key, LPWSTR value, UINT32 bufferSize, UINT32* length) override {
@@ -121,8 +120,6 @@ class Attributes : public ComObject<I, IID_IMFAttributes, Iids...> {
     return attributes_.setBlob(key, buffer, size);
   }
   HRESULT SetUnknown(REFGUID key, IUnknown* value) override { return attributes_.setUnknown(key, value); }
-  HRESULT LockStore() override { return attributes_.lockStore(); }
-  HRESULT UnlockStore() override { return attributes_.unlockStore(); }
   HRESULT GetCount(UINT32* count) override { return attributes_.getCount(count); }
   HRESULT GetItemByIndex(UINT32 index, GUID* key, PROPVARIANT* value) override {
     return attributes_.getItemByIndex(index, key, value);

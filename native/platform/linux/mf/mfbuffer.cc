@@ -52,17 +52,8 @@ class MemoryBuffer : public ComObject<IMFMediaBuffer, IID_IMFMediaBuffer> {
 
 class Sample : public Attributes<IMFSample, IID_IMFSample> {
  public:
-  ~Sample() override { RemoveAllBuffers(); }
+  ~Sample() override { releaseBuffers(); }
 
-  HRESULT GetSampleFlags(DWORD* flags) override {
-    if (!flags) return E_POINTER;
-    *flags = flags_;
-    return S_OK;
-  }
-  HRESULT SetSampleFlags(DWORD flags) override {
-    flags_ = flags;
-    return S_OK;
-  }
   HRESULT GetSampleTime(LONGLONG* time) override {
     if (!time) return E_POINTER;
     if (!hasTime_) return MF_E_NO_SAMPLE_TIMESTAMP;
@@ -117,7 +108,7 @@ class Sample : public Attributes<IMFSample, IID_IMFSample> {
       joined->Release();
       return hr;
     }
-    RemoveAllBuffers();
+    releaseBuffers();
     buffers_.push_back(joined);
     joined->AddRef();
     *buffer = joined;
@@ -127,17 +118,6 @@ class Sample : public Attributes<IMFSample, IID_IMFSample> {
     if (!buffer) return E_INVALIDARG;
     buffer->AddRef();
     buffers_.push_back(buffer);
-    return S_OK;
-  }
-  HRESULT RemoveBufferByIndex(DWORD index) override {
-    if (index >= buffers_.size()) return E_INVALIDARG;
-    buffers_[index]->Release();
-    buffers_.erase(buffers_.begin() + index);
-    return S_OK;
-  }
-  HRESULT RemoveAllBuffers() override {
-    for (IMFMediaBuffer* buffer : buffers_) buffer->Release();
-    buffers_.clear();
     return S_OK;
   }
   HRESULT GetTotalLength(DWORD* length) override {
@@ -177,8 +157,12 @@ class Sample : public Attributes<IMFSample, IID_IMFSample> {
   }
 
  private:
+  void releaseBuffers() {
+    for (IMFMediaBuffer* buffer : buffers_) buffer->Release();
+    buffers_.clear();
+  }
+
   std::vector<IMFMediaBuffer*> buffers_;
-  DWORD flags_ = 0;
   LONGLONG time_ = 0;
   LONGLONG duration_ = 0;
   bool hasTime_ = false;
@@ -187,7 +171,10 @@ class Sample : public Attributes<IMFSample, IID_IMFSample> {
 
 class Collection : public ComObject<IMFCollection, IID_IMFCollection> {
  public:
-  ~Collection() override { RemoveAllElements(); }
+  ~Collection() override {
+    for (IUnknown* element : elements_)
+      if (element) element->Release();
+  }
 
   HRESULT GetElementCount(DWORD* count) override {
     if (!count) return E_POINTER;
@@ -213,12 +200,6 @@ class Collection : public ComObject<IMFCollection, IID_IMFCollection> {
     if (index > elements_.size()) return E_INVALIDARG;
     if (element) element->AddRef();
     elements_.insert(elements_.begin() + index, element);
-    return S_OK;
-  }
-  HRESULT RemoveAllElements() override {
-    for (IUnknown* element : elements_)
-      if (element) element->Release();
-    elements_.clear();
     return S_OK;
   }
 

@@ -198,16 +198,6 @@ class CaptureClient : public ComObject<IAudioCaptureClient, IID_IAudioCaptureCli
     return S_OK;
   }
 
-  HRESULT GetNextPacketSize(UINT32* frames) override {
-    if (!frames) return E_POINTER;
-    Lock lock(*s_->connection);
-    if (s_->invalid()) return AUDCLNT_E_DEVICE_INVALIDATED;
-    const void* bytes = nullptr;
-    size_t size = 0;
-    if (pa_stream_peek(s_->stream, &bytes, &size) < 0) return AUDCLNT_E_DEVICE_INVALIDATED;
-    *frames = static_cast<UINT32>(size / s_->frameBytes);
-    return S_OK;
-  }
 
  private:
   std::shared_ptr<Stream> s_;
@@ -321,12 +311,6 @@ class AudioClient : public ComObject<IAudioClient, IID_IAudioClient> {
     return S_OK;
   }
 
-  HRESULT GetStreamLatency(REFERENCE_TIME* latency) override {
-    if (!latency) return E_POINTER;
-    if (!s_->stream) return AUDCLNT_E_NOT_INITIALIZED;
-    *latency = s_->loopback ? kRecordFragment : kPlaybackTarget;
-    return S_OK;
-  }
 
   // Playback: what is queued beyond what the server asks for now. Capture: the next packet.
   HRESULT GetCurrentPadding(UINT32* frames) override {
@@ -363,15 +347,8 @@ class AudioClient : public ComObject<IAudioClient, IID_IAudioClient> {
     return S_OK;
   }
 
-  HRESULT GetDevicePeriod(REFERENCE_TIME* defaultPeriod, REFERENCE_TIME* minimumPeriod) override {
-    if (!defaultPeriod && !minimumPeriod) return E_POINTER;
-    if (defaultPeriod) *defaultPeriod = kRecordFragment;
-    if (minimumPeriod) *minimumPeriod = kRecordFragment / 2;
-    return S_OK;
-  }
 
   HRESULT Start() override { return cork(false); }
-  HRESULT Stop() override { return cork(true); }
 
   HRESULT Reset() override {
     if (!s_->stream) return AUDCLNT_E_NOT_INITIALIZED;
@@ -387,9 +364,6 @@ class AudioClient : public ComObject<IAudioClient, IID_IAudioClient> {
     return S_OK;
   }
 
-  HRESULT SetEventHandle(HANDLE) override {
-    return s_->stream ? AUDCLNT_E_EVENTHANDLE_NOT_EXPECTED : AUDCLNT_E_NOT_INITIALIZED;
-  }
 
   HRESULT GetService(REFIID riid, void** object) override {
     if (!object) return E_POINTER;

@@ -26,12 +26,6 @@ class PropertyStore : public ComObject<IPropertyStore, IID_IPropertyStore> {
     *count = 1;
     return S_OK;
   }
-  HRESULT GetAt(DWORD index, PROPERTYKEY* key) override {
-    if (!key) return E_POINTER;
-    if (index != 0) return E_INVALIDARG;
-    *key = PKEY_Device_FriendlyName;
-    return S_OK;
-  }
   HRESULT GetValue(REFPROPERTYKEY key, PROPVARIANT* value) override {
     if (!value) return E_POINTER;
     PropVariantInit(value);
@@ -42,11 +36,8 @@ class PropertyStore : public ComObject<IPropertyStore, IID_IPropertyStore> {
     }
     return S_OK;
   }
-  HRESULT SetValue(REFPROPERTYKEY, REFPROPVARIANT) override { return STG_E_ACCESSDENIED; }
-  HRESULT Commit() override { return STG_E_ACCESSDENIED; }
 
  private:
-  static constexpr HRESULT STG_E_ACCESSDENIED = hresult(0x80030005);
   std::wstring friendlyName_;
 };
 
@@ -69,12 +60,6 @@ class Device : public ComObject<IMMDevice, IID_IMMDevice> {
   HRESULT GetId(LPWSTR* id) override {
     if (!id) return E_POINTER;
     *id = taskString(widen(name_));
-    return S_OK;
-  }
-  HRESULT GetState(DWORD* state) override {
-    if (!state) return E_POINTER;
-    Sink sink;
-    *state = liveConnection()->findSink(name_, sink) ? DEVICE_STATE_ACTIVE : DEVICE_STATE_NOTPRESENT;
     return S_OK;
   }
 
@@ -150,16 +135,6 @@ class Enumerator : public ComObject<IMMDeviceEnumerator, IID_IMMDeviceEnumerator
     *endpoint = new Device(connection_, sink);
     return S_OK;
   }
-  HRESULT GetDevice(LPCWSTR id, IMMDevice** device) override {
-    if (!id || !device) return E_POINTER;
-    *device = nullptr;
-    Sink sink;
-    if (!connection_->findSink(narrow(id), sink)) return HRESULT_FROM_WIN32(ERROR_NOT_FOUND);
-    *device = new Device(connection_, sink);
-    return S_OK;
-  }
-  HRESULT RegisterEndpointNotificationCallback(IMMNotificationClient*) override { return E_NOTIMPL; }
-  HRESULT UnregisterEndpointNotificationCallback(IMMNotificationClient*) override { return E_NOTIMPL; }
 
  private:
   std::shared_ptr<Connection> connection_;

@@ -62,10 +62,7 @@ HRESULT Context::Map(ID3D11Resource* resource, UINT subresource, D3D11_MAP mapTy
   return S_OK;
 }
 
-// CPU memory stays mapped for the texture's life, so there is nothing to undo.
-void Context::Unmap(ID3D11Resource*, UINT) {}
-
-Device::Device(UINT flags, D3D_FEATURE_LEVEL level) : flags_(flags), level_(level), context_(new Context()) {}
+Device::Device(D3D_FEATURE_LEVEL level) : level_(level), context_(new Context()) {}
 
 Device::~Device() { context_->Release(); }
 
@@ -135,7 +132,7 @@ HRESULT D3D11CreateDevice(IDXGIAdapter* adapter, D3D_DRIVER_TYPE driverType, HMO
     if (i == featureLevelCount) return E_INVALIDARG;
     level = featureLevels[i];
   }
-  auto* created = new platform::d3d11::Device(flags, level);
+  auto* created = new platform::d3d11::Device(level);
   if (featureLevel) *featureLevel = level;
   if (immediateContext) created->GetImmediateContext(immediateContext);
   if (device) {

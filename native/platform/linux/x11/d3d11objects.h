@@ -52,13 +52,12 @@ class Context : public platform::ComObject<ID3D11DeviceContext, IID_ID3D11Device
   void CopyResource(ID3D11Resource* destination, ID3D11Resource* source) override;
   HRESULT Map(ID3D11Resource* resource, UINT subresource, D3D11_MAP mapType, UINT mapFlags,
               D3D11_MAPPED_SUBRESOURCE* mapped) override;
-  void Unmap(ID3D11Resource* resource, UINT subresource) override;
 };
 
 // A device answers for ID3D11Device and ID3D10Multithread.
 class Device : public ID3D11Device, public ID3D10Multithread {
  public:
-  Device(UINT flags, D3D_FEATURE_LEVEL level);
+  explicit Device(D3D_FEATURE_LEVEL level);
   HRESULT QueryInterface(REFIID riid, void** object) override;
   ULONG AddRef() override { return ++references_; }
   ULONG Release() override;
@@ -67,20 +66,14 @@ class Device : public ID3D11Device, public ID3D10Multithread {
                           ID3D11Texture2D** texture) override;
   void GetImmediateContext(ID3D11DeviceContext** context) override;
   D3D_FEATURE_LEVEL GetFeatureLevel() override { return level_; }
-  UINT GetCreationFlags() override { return flags_; }
 
-  void Enter() override { lock_.lock(); }
-  void Leave() override { lock_.unlock(); }
   BOOL SetMultithreadProtected(BOOL protect) override { return protected_.exchange(protect != FALSE) ? TRUE : FALSE; }
-  BOOL GetMultithreadProtected() override { return protected_ ? TRUE : FALSE; }
 
  private:
   ~Device() override;
   std::atomic<ULONG> references_{1};
-  UINT flags_;
   D3D_FEATURE_LEVEL level_;
   Context* context_;
-  std::recursive_mutex lock_;
   std::atomic<bool> protected_{false};
 };
 

@@ -71,14 +71,6 @@ class Adapter : public platform::ComObject<IDXGIAdapter1, IID_IDXGIObject, IID_I
     return S_OK;
   }
 
-  HRESULT GetDesc1(DXGI_ADAPTER_DESC1* desc) override {
-    if (!desc) return E_INVALIDARG;
-    *desc = {};
-    std::string text = "X11 screen " + std::to_string(screen_) + " of " + display_;
-    std::copy_n(text.begin(), std::min<size_t>(text.size(), 127), desc->Description);
-    desc->AdapterLuid.LowPart = static_cast<DWORD>(screen_ + 1);
-    return S_OK;
-  }
 
  private:
   std::string display_;
