@@ -2,8 +2,9 @@
 // textures, and ID3D10Multithread.
 #pragma once
 
-#ifdef _WIN32
 #include "platform/com.h"
+
+#ifdef _WIN32
 #include <d3d10.h>
 #include <d3d11.h>
 #include <dxgi1_2.h>

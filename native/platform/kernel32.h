@@ -1,8 +1,9 @@
 // Kernel32 events, waits and power requests, debugger output; PathFindExtensionW (shlwapi).
 #pragma once
 
-#ifdef _WIN32
 #include "platform/com.h"
+
+#ifdef _WIN32
 #include <shlwapi.h>
 #else
 #include "platform/linux/kernel32.h"

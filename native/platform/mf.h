@@ -2,8 +2,9 @@
 // objects, events, the sink writer, and the GUIDs and codes the capture code uses.
 #pragma once
 
-#ifdef _WIN32
 #include "platform/com.h"
+
+#ifdef _WIN32
 // The Media Foundation headers come before anything that pulls in ksmedia.h (see wave.h).
 #include <mfapi.h>
 #include <mfidl.h>

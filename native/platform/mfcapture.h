@@ -2,6 +2,8 @@
 // enumeration and activation objects, the DXGI device manager, the transcode type query.
 #pragma once
 
+#include "platform/com.h"
+
 #ifdef _WIN32
 #include "platform/mf.h"
 #include <mfcaptureengine.h>

@@ -2,6 +2,8 @@
 // and render clients.
 #pragma once
 
+#include "platform/com.h"
+
 #ifdef _WIN32
 // The Media Foundation headers must come before the audio ones, or ksmedia and strmif clash.
 #include "platform/mf.h"

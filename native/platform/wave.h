@@ -2,8 +2,9 @@
 // speaker masks.
 #pragma once
 
-#ifdef _WIN32
 #include "platform/com.h"
+
+#ifdef _WIN32
 // mmreg.h alone carries the structures, the subtypes and the speaker masks; ksmedia.h here would
 // clash with the Media Foundation headers that some sources include after this one.
 #include <mmreg.h>

@@ -7,10 +7,10 @@
 
 namespace capture::video::screen::dxgi {
 
-IDXGIFactory1* createFactory();
+ComPtr<IDXGIFactory1> createFactory();
 // Adapters until the first index the factory does not answer with S_OK.
-std::vector<IDXGIAdapter1*> enumerateAdapters(IDXGIFactory1* factory);
+std::vector<ComPtr<IDXGIAdapter1>> enumerateAdapters(IDXGIFactory1* factory);
 // The IDXGIOutput1 of each output until EnumOutputs fails.
-std::vector<IDXGIOutput1*> enumerateOutputs(IDXGIAdapter1* adapter);
+std::vector<ComPtr<IDXGIOutput1>> enumerateOutputs(IDXGIAdapter1* adapter);
 
 }  // namespace capture::video::screen::dxgi

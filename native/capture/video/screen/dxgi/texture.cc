@@ -7,7 +7,8 @@ namespace capture::video::screen::dxgi {
 Device createDevice(IDXGIAdapter* adapter) {
   Device result;
   HRESULT hr = D3D11CreateDevice(adapter, D3D_DRIVER_TYPE_UNKNOWN, nullptr, D3D11_CREATE_DEVICE_BGRA_SUPPORT, nullptr,
-                                 0, D3D11_SDK_VERSION, &result.device, &result.featureLevel, &result.context);
+                                 0, D3D11_SDK_VERSION, result.device.GetAddressOf(), &result.featureLevel,
+                                 result.context.GetAddressOf());
   capture::checkResult("native/capture/video/screen/dxgi/texture", 30, hr, "Could not create DirectX 11 device.");
   return result;
 }

@@ -6,9 +6,9 @@
 namespace capture::video::screen::dxgi {
 
 struct Device {
-  ID3D11Device* device = nullptr;
+  ComPtr<ID3D11Device> device;
   D3D_FEATURE_LEVEL featureLevel{};
-  ID3D11DeviceContext* context = nullptr;
+  ComPtr<ID3D11DeviceContext> context;
 };
 
 Device createDevice(IDXGIAdapter* adapter);
