@@ -262,3 +262,6 @@ HLOCAL LocalFree(HLOCAL memory);
 // Last-error value of the calling thread, as the Kernel32 calls of the layer set it.
 DWORD GetLastError();
 void SetLastError(DWORD error);
+
+// The holder of references, for the layer as for the capture code.
+#include "platform/linux/comptr.h"

@@ -139,7 +139,9 @@ std::vector<Device> audioDevices() {
 HRESULT createDeviceActivate(REFGUID category, const std::wstring& friendlyName, const std::wstring& link,
                              IMFActivate** activate) {
   if (!activate) return E_POINTER;
-  auto* device = new DeviceActivate;
+  *activate = nullptr;
+  ComPtr<DeviceActivate> device;
+  device.Attach(new DeviceActivate);
   HRESULT hr = device->SetGUID(MF_DEVSOURCE_ATTRIBUTE_SOURCE_TYPE, category);
   if (SUCCEEDED(hr)) hr = device->SetString(MF_DEVSOURCE_ATTRIBUTE_FRIENDLY_NAME, friendlyName.c_str());
   if (SUCCEEDED(hr))
@@ -147,12 +149,8 @@ HRESULT createDeviceActivate(REFGUID category, const std::wstring& friendlyName,
                                ? MF_DEVSOURCE_ATTRIBUTE_SOURCE_TYPE_AUDCAP_ENDPOINT_ID
                                : MF_DEVSOURCE_ATTRIBUTE_SOURCE_TYPE_VIDCAP_SYMBOLIC_LINK,
                            link.c_str());
-  if (FAILED(hr)) {
-    device->Release();
-    *activate = nullptr;
-    return hr;
-  }
-  *activate = device;
+  if (FAILED(hr)) return hr;
+  *activate = device.Detach();
   return S_OK;
 }
 
@@ -172,23 +170,19 @@ HRESULT MFEnumDeviceSources(IMFAttributes* attributes, IMFActivate*** devices, U
   else
     return E_INVALIDARG;
 
-  auto** array = static_cast<IMFActivate**>(CoTaskMemAlloc(sizeof(IMFActivate*) * (found.empty() ? 1 : found.size())));
-  if (!array) return E_OUTOFMEMORY;
-  UINT32 made = 0;
+  std::vector<ComPtr<IMFActivate>> made;
   for (const platform::Device& device : found) {
-    IMFActivate* activate = nullptr;
-    HRESULT hr = platform::createDeviceActivate(category, device.name, device.link, &activate);
+    ComPtr<IMFActivate> activate;
+    HRESULT hr = platform::createDeviceActivate(category, device.name, device.link, activate.GetAddressOf());
     if (SUCCEEDED(hr) && device.rate) hr = activate->SetUINT32(platform::deviceAudioRate, device.rate);
     if (SUCCEEDED(hr) && device.channels) hr = activate->SetUINT32(platform::deviceAudioChannels, device.channels);
-    if (FAILED(hr)) {
-      if (activate) activate->Release();
-      for (UINT32 i = 0; i < made; ++i) array[i]->Release();
-      CoTaskMemFree(array);
-      return hr;
-    }
-    array[made++] = activate;
+    if (FAILED(hr)) return hr;
+    made.push_back(std::move(activate));
   }
+  auto** array = static_cast<IMFActivate**>(CoTaskMemAlloc(sizeof(IMFActivate*) * (made.empty() ? 1 : made.size())));
+  if (!array) return E_OUTOFMEMORY;
+  for (size_t i = 0; i < made.size(); ++i) array[i] = made[i].Detach();
   *devices = array;
-  *count = made;
+  *count = static_cast<UINT32>(made.size());
   return S_OK;
 }

@@ -5,8 +5,8 @@ HRESULT MFTranscodeGetAudioOutputAvailableTypes(REFGUID subtype, DWORD, IMFAttri
   if (!types) return E_POINTER;
   *types = nullptr;
   if (subtype != MFAudioFormat_AAC) return MF_E_TOPO_CODEC_NOT_FOUND;
-  IMFCollection* collection = nullptr;
-  HRESULT hr = MFCreateCollection(&collection);
+  ComPtr<IMFCollection> collection;
+  HRESULT hr = MFCreateCollection(collection.GetAddressOf());
   if (FAILED(hr)) return hr;
   static const UINT32 rates[] = {48000, 44100};
   static const UINT32 channelCounts[] = {2, 1};
@@ -14,8 +14,8 @@ HRESULT MFTranscodeGetAudioOutputAvailableTypes(REFGUID subtype, DWORD, IMFAttri
   for (UINT32 rate : rates) {
     for (UINT32 channels : channelCounts) {
       for (UINT32 bytes : bytesPerSecond) {
-        IMFMediaType* type = nullptr;
-        hr = MFCreateMediaType(&type);
+        ComPtr<IMFMediaType> type;
+        hr = MFCreateMediaType(type.GetAddressOf());
         if (SUCCEEDED(hr)) hr = type->SetGUID(MF_MT_MAJOR_TYPE, MFMediaType_Audio);
         if (SUCCEEDED(hr)) hr = type->SetGUID(MF_MT_SUBTYPE, MFAudioFormat_AAC);
         if (SUCCEEDED(hr)) hr = type->SetUINT32(MF_MT_AUDIO_BITS_PER_SAMPLE, 16);
@@ -25,15 +25,11 @@ HRESULT MFTranscodeGetAudioOutputAvailableTypes(REFGUID subtype, DWORD, IMFAttri
         if (SUCCEEDED(hr)) hr = type->SetUINT32(MF_MT_AUDIO_BLOCK_ALIGNMENT, 1);
         if (SUCCEEDED(hr)) hr = type->SetUINT32(MF_MT_AAC_PAYLOAD_TYPE, 0);
         if (SUCCEEDED(hr)) hr = type->SetUINT32(MF_MT_AAC_AUDIO_PROFILE_LEVEL_INDICATION, 0x29);
-        if (SUCCEEDED(hr)) hr = collection->AddElement(type);
-        if (type) type->Release();
-        if (FAILED(hr)) {
-          collection->Release();
-          return hr;
-        }
+        if (SUCCEEDED(hr)) hr = collection->AddElement(type.Get());
+        if (FAILED(hr)) return hr;
       }
     }
   }
-  *types = collection;
+  *types = collection.Detach();
   return S_OK;
 }

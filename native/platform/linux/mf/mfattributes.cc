@@ -391,18 +391,16 @@ class MediaType : public Attributes<IMFMediaType, IID_IMFMediaType> {
     other->GetGUID(MF_MT_SUBTYPE, &theirSubtype);
     if (ourSubtype == theirSubtype) *flags |= MF_MEDIATYPE_EQUAL_FORMAT_TYPES;
     // Format data: every item but the user data is the same in both.
-    IMFAttributes *a = nullptr, *b = nullptr;
-    MFCreateAttributes(&a, 0);
-    MFCreateAttributes(&b, 0);
-    CopyAllItems(a);
-    other->CopyAllItems(b);
+    ComPtr<IMFAttributes> a, b;
+    MFCreateAttributes(a.GetAddressOf(), 0);
+    MFCreateAttributes(b.GetAddressOf(), 0);
+    CopyAllItems(a.Get());
+    other->CopyAllItems(b.Get());
     a->DeleteItem(MF_MT_USER_DATA);
     b->DeleteItem(MF_MT_USER_DATA);
     BOOL same = FALSE;
-    a->Compare(b, MF_ATTRIBUTES_MATCH_ALL_ITEMS, &same);
+    a->Compare(b.Get(), MF_ATTRIBUTES_MATCH_ALL_ITEMS, &same);
     if (same) *flags |= MF_MEDIATYPE_EQUAL_FORMAT_DATA;
-    a->Release();
-    b->Release();
     PROPVARIANT ourData, theirData;
     PropVariantInit(&ourData);
     PropVariantInit(&theirData);

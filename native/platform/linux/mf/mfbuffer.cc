@@ -52,8 +52,6 @@ class MemoryBuffer : public ComObject<IMFMediaBuffer, IID_IMFMediaBuffer> {
 
 class Sample : public Attributes<IMFSample, IID_IMFSample> {
  public:
-  ~Sample() override { releaseBuffers(); }
-
   HRESULT GetSampleTime(LONGLONG* time) override {
     if (!time) return E_POINTER;
     if (!hasTime_) return MF_E_NO_SAMPLE_TIMESTAMP;
@@ -84,46 +82,33 @@ class Sample : public Attributes<IMFSample, IID_IMFSample> {
   HRESULT GetBufferByIndex(DWORD index, IMFMediaBuffer** buffer) override {
     if (!buffer) return E_POINTER;
     if (index >= buffers_.size()) return E_INVALIDARG;
-    *buffer = buffers_[index];
-    (*buffer)->AddRef();
-    return S_OK;
+    return buffers_[index].CopyTo(buffer);
   }
   // One buffer is handed out as it is; several are joined into a new buffer that then replaces
   // them in the sample, as Media Foundation does.
   HRESULT ConvertToContiguousBuffer(IMFMediaBuffer** buffer) override {
     if (!buffer) return E_POINTER;
     if (buffers_.empty()) return E_UNEXPECTED;
-    if (buffers_.size() == 1) {
-      *buffer = buffers_[0];
-      (*buffer)->AddRef();
-      return S_OK;
-    }
+    if (buffers_.size() == 1) return buffers_[0].CopyTo(buffer);
     DWORD total = 0;
     GetTotalLength(&total);
-    IMFMediaBuffer* joined = nullptr;
-    HRESULT hr = MFCreateMemoryBuffer(total, &joined);
+    ComPtr<IMFMediaBuffer> joined;
+    HRESULT hr = MFCreateMemoryBuffer(total, joined.GetAddressOf());
     if (FAILED(hr)) return hr;
-    hr = CopyToBuffer(joined);
-    if (FAILED(hr)) {
-      joined->Release();
-      return hr;
-    }
-    releaseBuffers();
-    buffers_.push_back(joined);
-    joined->AddRef();
-    *buffer = joined;
-    return S_OK;
+    hr = CopyToBuffer(joined.Get());
+    if (FAILED(hr)) return hr;
+    buffers_.assign(1, joined);
+    return joined.CopyTo(buffer);
   }
   HRESULT AddBuffer(IMFMediaBuffer* buffer) override {
     if (!buffer) return E_INVALIDARG;
-    buffer->AddRef();
-    buffers_.push_back(buffer);
+    buffers_.emplace_back(buffer);
     return S_OK;
   }
   HRESULT GetTotalLength(DWORD* length) override {
     if (!length) return E_POINTER;
     DWORD total = 0;
-    for (IMFMediaBuffer* buffer : buffers_) {
+    for (const ComPtr<IMFMediaBuffer>& buffer : buffers_) {
       DWORD current = 0;
       buffer->GetCurrentLength(&current);
       total += current;
@@ -143,7 +128,7 @@ class Sample : public Attributes<IMFSample, IID_IMFSample> {
       return MF_E_BUFFERTOOSMALL;
     }
     DWORD offset = 0;
-    for (IMFMediaBuffer* buffer : buffers_) {
+    for (const ComPtr<IMFMediaBuffer>& buffer : buffers_) {
       BYTE* in = nullptr;
       DWORD current = 0;
       if (SUCCEEDED(buffer->Lock(&in, nullptr, &current))) {
@@ -157,12 +142,7 @@ class Sample : public Attributes<IMFSample, IID_IMFSample> {
   }
 
  private:
-  void releaseBuffers() {
-    for (IMFMediaBuffer* buffer : buffers_) buffer->Release();
-    buffers_.clear();
-  }
-
-  std::vector<IMFMediaBuffer*> buffers_;
+  std::vector<ComPtr<IMFMediaBuffer>> buffers_;
   LONGLONG time_ = 0;
   LONGLONG duration_ = 0;
   bool hasTime_ = false;
@@ -171,11 +151,6 @@ class Sample : public Attributes<IMFSample, IID_IMFSample> {
 
 class Collection : public ComObject<IMFCollection, IID_IMFCollection> {
  public:
-  ~Collection() override {
-    for (IUnknown* element : elements_)
-      if (element) element->Release();
-  }
-
   HRESULT GetElementCount(DWORD* count) override {
     if (!count) return E_POINTER;
     *count = static_cast<DWORD>(elements_.size());
@@ -184,27 +159,25 @@ class Collection : public ComObject<IMFCollection, IID_IMFCollection> {
   HRESULT GetElement(DWORD index, IUnknown** element) override {
     if (!element) return E_POINTER;
     if (index >= elements_.size()) return E_INVALIDARG;
-    *element = elements_[index];
-    if (*element) (*element)->AddRef();
-    return S_OK;
+    *element = nullptr;
+    return elements_[index] ? elements_[index].CopyTo(element) : S_OK;
   }
   HRESULT AddElement(IUnknown* element) override { return InsertElementAt(static_cast<DWORD>(elements_.size()), element); }
   HRESULT RemoveElement(DWORD index, IUnknown** element) override {
     if (!element) return E_POINTER;
     if (index >= elements_.size()) return E_INVALIDARG;
-    *element = elements_[index];  // the collection's reference passes to the caller
+    *element = elements_[index].Detach();  // the collection's reference passes to the caller
     elements_.erase(elements_.begin() + index);
     return S_OK;
   }
   HRESULT InsertElementAt(DWORD index, IUnknown* element) override {
     if (index > elements_.size()) return E_INVALIDARG;
-    if (element) element->AddRef();
-    elements_.insert(elements_.begin() + index, element);
+    elements_.insert(elements_.begin() + index, ComPtr<IUnknown>(element));
     return S_OK;
   }
 
  private:
-  std::vector<IUnknown*> elements_;
+  std::vector<ComPtr<IUnknown>> elements_;
 };
 
 }  // namespace
@@ -214,12 +187,10 @@ class Collection : public ComObject<IMFCollection, IID_IMFCollection> {
 HRESULT MFCreateMemoryBuffer(DWORD maxLength, IMFMediaBuffer** buffer) {
   if (!buffer) return E_POINTER;
   *buffer = nullptr;
-  auto* created = new platform::MemoryBuffer(maxLength);
-  if (!created->valid()) {
-    created->Release();
-    return E_OUTOFMEMORY;
-  }
-  *buffer = created;
+  ComPtr<platform::MemoryBuffer> created;
+  created.Attach(new platform::MemoryBuffer(maxLength));
+  if (!created->valid()) return E_OUTOFMEMORY;
+  *buffer = created.Detach();
   return S_OK;
 }
 

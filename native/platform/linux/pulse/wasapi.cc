@@ -84,10 +84,7 @@ class Device : public ComObject<IMMDevice, IID_IMMDevice> {
 
 class Collection : public ComObject<IMMDeviceCollection, IID_IMMDeviceCollection> {
  public:
-  explicit Collection(std::vector<IMMDevice*> devices) : devices_(std::move(devices)) {}
-  ~Collection() override {
-    for (IMMDevice* device : devices_) device->Release();
-  }
+  explicit Collection(std::vector<ComPtr<IMMDevice>> devices) : devices_(std::move(devices)) {}
 
   HRESULT GetCount(UINT* count) override {
     if (!count) return E_POINTER;
@@ -98,13 +95,11 @@ class Collection : public ComObject<IMMDeviceCollection, IID_IMMDeviceCollection
     if (!device) return E_POINTER;
     *device = nullptr;
     if (index >= devices_.size()) return E_INVALIDARG;
-    devices_[index]->AddRef();
-    *device = devices_[index];
-    return S_OK;
+    return devices_[index].CopyTo(device);
   }
 
  private:
-  std::vector<IMMDevice*> devices_;
+  std::vector<ComPtr<IMMDevice>> devices_;
 };
 
 // Endpoints of the capture direction (microphones) are not offered: the add-on reaches those
@@ -118,9 +113,9 @@ class Enumerator : public ComObject<IMMDeviceEnumerator, IID_IMMDeviceEnumerator
     *devices = nullptr;
     if (dataFlow != eRender) return dataFlow == eCapture || dataFlow == eAll ? E_NOTIMPL : E_INVALIDARG;
     if (stateMask == 0 || (stateMask & ~DEVICE_STATEMASK_ALL)) return E_INVALIDARG;
-    std::vector<IMMDevice*> found;
+    std::vector<ComPtr<IMMDevice>> found;
     if (stateMask & DEVICE_STATE_ACTIVE)
-      for (const Sink& sink : connection_->sinks()) found.push_back(new Device(connection_, sink));
+      for (const Sink& sink : connection_->sinks()) found.emplace_back().Attach(new Device(connection_, sink));
     *devices = new Collection(std::move(found));
     return S_OK;
   }
@@ -143,10 +138,9 @@ class Enumerator : public ComObject<IMMDeviceEnumerator, IID_IMMDeviceEnumerator
 }  // namespace
 
 HRESULT createDeviceEnumerator(REFIID riid, void** object) {
-  auto* enumerator = new Enumerator();
-  HRESULT hr = enumerator->QueryInterface(riid, object);
-  enumerator->Release();
-  return hr;
+  ComPtr<Enumerator> enumerator;
+  enumerator.Attach(new Enumerator());
+  return enumerator->QueryInterface(riid, object);
 }
 
 }  // namespace platform::wasapi

@@ -26,9 +26,9 @@ class Output : public platform::ComObject<IDXGIOutput1, IID_IDXGIObject, IID_IDX
 
   HRESULT DuplicateOutput(IUnknown* device, IDXGIOutputDuplication** duplication) override {
     if (!device || !duplication) return E_INVALIDARG;
-    ID3D11Device* d3d = nullptr;
-    if (FAILED(device->QueryInterface(IID_ID3D11Device, reinterpret_cast<void**>(&d3d)))) return E_INVALIDARG;
-    d3d->Release();
+    ComPtr<ID3D11Device> d3d;  // only a Direct3D 11 device can duplicate
+    if (FAILED(device->QueryInterface(IID_ID3D11Device, reinterpret_cast<void**>(d3d.GetAddressOf()))))
+      return E_INVALIDARG;
     return Duplication::open(display_, screen_, name_, nameText_, duplication);
   }
 
@@ -103,8 +103,7 @@ class Factory : public platform::ComObject<IDXGIFactory1, IID_IDXGIObject, IID_I
 HRESULT CreateDXGIFactory1(REFIID riid, void** factory) {
   if (!factory) return E_INVALIDARG;
   *factory = nullptr;
-  auto* created = new platform::dxgi::Factory();
-  HRESULT hr = created->QueryInterface(riid, factory);
-  created->Release();
-  return hr;
+  ComPtr<platform::dxgi::Factory> created;
+  created.Attach(new platform::dxgi::Factory());
+  return created->QueryInterface(riid, factory);
 }

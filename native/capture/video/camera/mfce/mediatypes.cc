@@ -28,19 +28,16 @@ UINT32 uint32Or(IMFMediaType* type, REFGUID key, UINT32 fallback) {
 HRESULT MakeVideoType(IMFMediaType* sourceType, REFGUID subtype, IMFMediaType** type) {
   if (!sourceType || !type) return E_POINTER;
   *type = nullptr;
-  IMFMediaType* made = nullptr;
-  HRESULT hr = MFCreateMediaType(&made);
+  ComPtr<IMFMediaType> made;
+  HRESULT hr = MFCreateMediaType(made.GetAddressOf());
   if (SUCCEEDED(hr)) hr = made->SetGUID(MF_MT_MAJOR_TYPE, MFMediaType_Video);
   if (SUCCEEDED(hr)) hr = made->SetGUID(MF_MT_SUBTYPE, subtype);
-  if (SUCCEEDED(hr)) hr = copyUint64(sourceType, made, MF_MT_FRAME_SIZE);
-  if (SUCCEEDED(hr)) hr = copyUint64(sourceType, made, MF_MT_FRAME_RATE);
-  if (SUCCEEDED(hr)) hr = copyUint64(sourceType, made, MF_MT_PIXEL_ASPECT_RATIO);
-  if (SUCCEEDED(hr)) hr = copyUint32(sourceType, made, MF_MT_INTERLACE_MODE);
-  if (FAILED(hr)) {
-    if (made) made->Release();
-    return hr;
-  }
-  *type = made;
+  if (SUCCEEDED(hr)) hr = copyUint64(sourceType, made.Get(), MF_MT_FRAME_SIZE);
+  if (SUCCEEDED(hr)) hr = copyUint64(sourceType, made.Get(), MF_MT_FRAME_RATE);
+  if (SUCCEEDED(hr)) hr = copyUint64(sourceType, made.Get(), MF_MT_PIXEL_ASPECT_RATIO);
+  if (SUCCEEDED(hr)) hr = copyUint32(sourceType, made.Get(), MF_MT_INTERLACE_MODE);
+  if (FAILED(hr)) return hr;
+  *type = made.Detach();
   return hr;
 }
 
@@ -65,8 +62,8 @@ HRESULT MakePcmType(IMFMediaType* audioType, IMFMediaType** type) {
   if (channels == 0 || rate == 0) return MF_E_INVALIDTYPE;
   const UINT32 blockAlign = (bits / 8) * channels;
 
-  IMFMediaType* made = nullptr;
-  hr = MFCreateMediaType(&made);
+  ComPtr<IMFMediaType> made;
+  hr = MFCreateMediaType(made.GetAddressOf());
   if (SUCCEEDED(hr)) hr = made->SetGUID(MF_MT_MAJOR_TYPE, MFMediaType_Audio);
   if (SUCCEEDED(hr)) hr = made->SetGUID(MF_MT_SUBTYPE, MFAudioFormat_PCM);
   if (SUCCEEDED(hr)) hr = made->SetUINT32(MF_MT_AUDIO_NUM_CHANNELS, channels);
@@ -75,11 +72,8 @@ HRESULT MakePcmType(IMFMediaType* audioType, IMFMediaType** type) {
   if (SUCCEEDED(hr)) hr = made->SetUINT32(MF_MT_AUDIO_AVG_BYTES_PER_SECOND, blockAlign * rate);
   if (SUCCEEDED(hr)) hr = made->SetUINT32(MF_MT_AUDIO_BITS_PER_SAMPLE, bits);
   if (SUCCEEDED(hr)) hr = made->SetUINT32(MF_MT_ALL_SAMPLES_INDEPENDENT, TRUE);
-  if (FAILED(hr)) {
-    if (made) made->Release();
-    return hr;
-  }
-  *type = made;
+  if (FAILED(hr)) return hr;
+  *type = made.Detach();
   return hr;
 }
 

@@ -48,30 +48,25 @@ template <class Element>
 std::vector<std::shared_ptr<Element>> enumerate(const Category& category, bool audioDevices) {
   std::vector<std::shared_ptr<Element>> result;
   try {
-    IMFAttributes* attributes = nullptr;
-    checkResult(file, category.createLine, MFCreateAttributes(&attributes, 1), category.createMessage);
-    HRESULT hr = attributes->SetGUID(MF_DEVSOURCE_ATTRIBUTE_SOURCE_TYPE, category.guid);
-    if (FAILED(hr)) attributes->Release();
-    checkResult(file, category.setLine, hr, category.setMessage);
+    ComPtr<IMFAttributes> attributes;
+    checkResult(file, category.createLine, MFCreateAttributes(attributes.GetAddressOf(), 1), category.createMessage);
+    checkResult(file, category.setLine, attributes->SetGUID(MF_DEVSOURCE_ATTRIBUTE_SOURCE_TYPE, category.guid),
+                category.setMessage);
 
     IMFActivate** devices = nullptr;
     UINT32 count = 0;
-    hr = MFEnumDeviceSources(attributes, &devices, &count);
-    attributes->Release();
-    checkResult(file, category.enumerateLine, hr, category.enumerateMessage);
+    checkResult(file, category.enumerateLine, MFEnumDeviceSources(attributes.Get(), &devices, &count),
+                category.enumerateMessage);
+    // The list's references, let go whatever happens; each source takes one of its own.
+    std::vector<ComPtr<IMFActivate>> listed(count);
+    for (UINT32 i = 0; i < count; ++i) listed[i].Attach(devices[i]);
+    CoTaskMemFree(devices);
 
     for (UINT32 i = 0; i < count; ++i) {
-      auto* source = audioDevices ? new MFCESource(devices[i], nullptr, i == 0)
-                                  : new MFCESource(nullptr, devices[i], i == 0);
+      auto* source = audioDevices ? new MFCESource(listed[i].Get(), nullptr, i == 0)
+                                  : new MFCESource(nullptr, listed[i].Get(), i == 0);
       result.push_back(std::shared_ptr<Element>(source));
     }
-    for (UINT32 i = 0; i < count; ++i) {
-      if (devices[i]) {
-        devices[i]->Release();
-        devices[i] = nullptr;
-      }
-    }
-    CoTaskMemFree(devices);
   } catch (const std::runtime_error& error) {
     const char* text = error.what();
     std::cout << "Failed to initialize: " << (text && *text ? text : "unknown exception") << std::endl
