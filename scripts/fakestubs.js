@@ -1,13 +1,14 @@
 #!/usr/bin/env node
-// Writes test/fakes/windows/stubs.h: for each SDK interface a fake implements on Windows, a class
-// that answers every method below IUnknown with E_NOTIMPL (or nothing, or a zero value), so a fake
-// overrides only what the capture code calls. Read from the mingw-w64 SDK headers:
-//   node scripts/fakestubs.js [include folder]
+// Writes fakes/windows/stubs.h for the Windows test build: for each SDK interface a fake implements
+// on Windows, a class that answers every method below IUnknown with E_NOTIMPL (or nothing, or a zero
+// value), so a fake overrides only what the capture code calls. Read from the mingw-w64 SDK headers
+// when the build is configured (test/windows/CMakeLists.txt):
+//   node scripts/fakestubs.js <output file> [include folder]
 'use strict';
 const fs = require('fs');
 const path = require('path');
 
-const include = process.argv[2] || '/usr/share/mingw-w64/include';
+const [output, include = '/usr/share/mingw-w64/include'] = process.argv.slice(2);
 const headers = ['d3d11.h', 'dxgi.h', 'dxgi1_2.h', 'audioclient.h', 'mmdeviceapi.h', 'propsys.h',
   'mfobjects.h', 'mfcaptureengine.h'];
 const wanted = ['ID3D11Texture2D', 'ID3D11DeviceContext', 'ID3D11Device', 'IDXGIResource',
@@ -70,4 +71,5 @@ for (const name of wanted) {
   lines.push('};');
 }
 lines.push('', '}  // namespace fakes', '');
-fs.writeFileSync(path.join(__dirname, '..', 'test', 'fakes', 'windows', 'stubs.h'), lines.join('\n'));
+fs.mkdirSync(path.dirname(output), { recursive: true });
+fs.writeFileSync(output, lines.join('\n'));
