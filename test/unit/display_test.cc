@@ -257,7 +257,7 @@ TEST_F(DisplayGrab, OpensTheOutputAtItsDesktopSize) {
   EXPECT_EQ(device.lastDesc.Format, DXGI_FORMAT_B8G8R8A8_UNORM);
   EXPECT_EQ(source.queue->width, 8u);
   EXPECT_TRUE(source.queue->stopped);
-  EXPECT_EQ(source.duplication, &first);
+  EXPECT_EQ(source.duplication.Get(), &first);
 }
 
 TEST_F(DisplayGrab, FailedDuplicationFailsTheSourceAndReleasesWhatItTook) {
@@ -348,14 +348,14 @@ TEST_F(DisplayGrab, OtherAcquisitionResultsAreTakenAsFrames) {
 TEST_F(DisplayGrab, LostAccessReduplicatesUntilItWorks) {
   first.steps.push_back({DXGI_ERROR_ACCESS_LOST, {}});
   Source source(&output, &device, false);
-  ID3D11Texture2D* staging = source.stagingTexture;
+  ID3D11Texture2D* staging = source.stagingTexture.Get();
   output.failures = {E_ACCESSDENIED, DXGI_ERROR_UNSUPPORTED};
   output.next.push_back(&second);
   source.capture();
-  EXPECT_EQ(source.duplication, &second);
+  EXPECT_EQ(source.duplication.Get(), &second);
   EXPECT_EQ(first.references, 0u);
   EXPECT_EQ(output.duplications, 4);  // opening, two failures, success
-  EXPECT_EQ(source.stagingTexture, staging);
+  EXPECT_EQ(source.stagingTexture.Get(), staging);
   EXPECT_TRUE(source.queue->frames.empty());
 
   second.steps.push_back({S_OK, {}});

@@ -5,7 +5,6 @@
 #include <stdexcept>
 
 #include "capture/check.h"
-#include "capture/held.h"
 #include "capture/log.h"
 #include "capture/text.h"
 
@@ -23,39 +22,39 @@ MFEncoder::MFEncoder(std::string path, const WAVEFORMATEXTENSIBLE* format) : for
   try {
     checkResult(file, 22, MFStartup(MF_VERSION, MFSTARTUP_FULL), "Unable to start media foundation.");
 
-    Held<IMFAttributes> attributes;
-    checkResult(file, 26, MFCreateAttributes(&attributes.object, 0), "Unable to create attributes for writer.");
-    checkResult(file, 27, attributes.object->SetUINT32(MF_LOW_LATENCY, 1), "Unable to set MF_LOW_LATENCY attribute.");
-    checkResult(file, 28, attributes.object->SetUINT32(MF_READWRITE_ENABLE_HARDWARE_TRANSFORMS, 1),
+    ComPtr<IMFAttributes> attributes;
+    checkResult(file, 26, MFCreateAttributes(attributes.GetAddressOf(), 0), "Unable to create attributes for writer.");
+    checkResult(file, 27, attributes->SetUINT32(MF_LOW_LATENCY, 1), "Unable to set MF_LOW_LATENCY attribute.");
+    checkResult(file, 28, attributes->SetUINT32(MF_READWRITE_ENABLE_HARDWARE_TRANSFORMS, 1),
                 "Unable to set MF_READWRITE_ENABLE_HARDWARE_TRANSFORMS attribute.");
-    checkResult(file, 29, attributes.object->SetUINT32(MF_SINK_WRITER_DISABLE_THROTTLING, 1),
+    checkResult(file, 29, attributes->SetUINT32(MF_SINK_WRITER_DISABLE_THROTTLING, 1),
                 "Unable to set MF_SINK_WRITER_DISABLE_THROTTLING attribute.");
-    checkResult(file, 30, attributes.object->SetGUID(MF_TRANSCODE_CONTAINERTYPE, MFTranscodeContainerType_MPEG4),
+    checkResult(file, 30, attributes->SetGUID(MF_TRANSCODE_CONTAINERTYPE, MFTranscodeContainerType_MPEG4),
                 "Unable to set MF_TRANSCODE_CONTAINERTYPE attribute.");
 
     const std::wstring widePath = toWide(path);
     std::cout << "File: " << path << std::endl;
-    checkResult(file, 35, MFCreateSinkWriterFromURL(widePath.c_str(), nullptr, attributes.object, &sinkWriter),
+    checkResult(file, 35, MFCreateSinkWriterFromURL(widePath.c_str(), nullptr, attributes.Get(), sinkWriter.GetAddressOf()),
                 "Could not create sink.");
-    attributes.release();
+    attributes.Reset();
 
-    Held<IMFMediaType> output;
-    checkResult(file, 41, MFCreateMediaType(&output.object), "Could not create output media type.");
-    checkResult(file, 42, output.object->SetGUID(MF_MT_MAJOR_TYPE, MFMediaType_Audio),
+    ComPtr<IMFMediaType> output;
+    checkResult(file, 41, MFCreateMediaType(output.GetAddressOf()), "Could not create output media type.");
+    checkResult(file, 42, output->SetGUID(MF_MT_MAJOR_TYPE, MFMediaType_Audio),
                 "Unable to set major type of output.");
-    checkResult(file, 43, output.object->SetGUID(MF_MT_SUBTYPE, MFAudioFormat_AAC), "Unable to set subtype of output.");
-    checkResult(file, 44, output.object->SetUINT32(MF_MT_AUDIO_BITS_PER_SAMPLE, 16),
+    checkResult(file, 43, output->SetGUID(MF_MT_SUBTYPE, MFAudioFormat_AAC), "Unable to set subtype of output.");
+    checkResult(file, 44, output->SetUINT32(MF_MT_AUDIO_BITS_PER_SAMPLE, 16),
                 "Unable to set bits per sample of output.");
-    checkResult(file, 45, output.object->SetUINT32(MF_MT_AUDIO_SAMPLES_PER_SECOND, format->Format.nSamplesPerSec),
+    checkResult(file, 45, output->SetUINT32(MF_MT_AUDIO_SAMPLES_PER_SECOND, format->Format.nSamplesPerSec),
                 "Unable to set samples per second of output.");
-    checkResult(file, 46, output.object->SetUINT32(MF_MT_AUDIO_NUM_CHANNELS, format->Format.nChannels),
+    checkResult(file, 46, output->SetUINT32(MF_MT_AUDIO_NUM_CHANNELS, format->Format.nChannels),
                 "Unable to set audio channel count of output.");
-    checkResult(file, 47, output.object->SetUINT32(MF_MT_AUDIO_AVG_BYTES_PER_SECOND, 24000),
+    checkResult(file, 47, output->SetUINT32(MF_MT_AUDIO_AVG_BYTES_PER_SECOND, 24000),
                 "Unable to set bitrate of output.");
     DWORD index = 0;
-    checkResult(file, 48, sinkWriter->AddStream(output.object, &index), "Could not add stream to writer.");
+    checkResult(file, 48, sinkWriter->AddStream(output.Get(), &index), "Could not add stream to writer.");
     streamIndex = index;
-    output.release();
+    output.Reset();
 
     // The plain 18-byte wave format of the input, its tag taken from the extensible subtype.
     WAVEFORMATEX plain;
@@ -69,20 +68,19 @@ MFEncoder::MFEncoder(std::string path, const WAVEFORMATEXTENSIBLE* format) : for
       throw std::runtime_error(std::string(file) + "(144): " + "Unable to set format tag.");
     plain.cbSize = 0;
 
-    Held<IMFMediaType> input;
-    checkResult(file, 60, MFCreateMediaType(&input.object), "Could not create media type.");
-    checkResult(file, 61, MFInitMediaTypeFromWaveFormatEx(input.object, &plain, sizeof plain),
+    ComPtr<IMFMediaType> input;
+    checkResult(file, 60, MFCreateMediaType(input.GetAddressOf()), "Could not create media type.");
+    checkResult(file, 61, MFInitMediaTypeFromWaveFormatEx(input.Get(), &plain, sizeof plain),
                 "Could not initialize media type from wave format.");
-    checkResult(file, 64, input.object->SetUINT32(MF_MT_AUDIO_CHANNEL_MASK, format->dwChannelMask),
+    checkResult(file, 64, input->SetUINT32(MF_MT_AUDIO_CHANNEL_MASK, format->dwChannelMask),
                 "Unable to set surround sound bit mask for input media type.");
-    checkResult(file, 65, sinkWriter->SetInputMediaType(streamIndex, input.object, nullptr),
+    checkResult(file, 65, sinkWriter->SetInputMediaType(streamIndex, input.Get(), nullptr),
                 "Could not set input media type.");
-    input.release();
+    input.Reset();
 
     checkResult(file, 70, sinkWriter->BeginWriting(), "Unable to start the sink writer.");
   } catch (...) {
-    if (sinkWriter) sinkWriter->Release();
-    sinkWriter = nullptr;
+    sinkWriter.Reset();
     throw;
   }
 }
@@ -90,8 +88,7 @@ MFEncoder::MFEncoder(std::string path, const WAVEFORMATEXTENSIBLE* format) : for
 // A destructor cannot pass the shut-down failure on (the interface's destructor does not
 // throw), so its text becomes a warning line.
 MFEncoder::~MFEncoder() {
-  if (sinkWriter) sinkWriter->Release();
-  sinkWriter = nullptr;
+  sinkWriter.Reset();  // before Media Foundation shuts down
   try {
     checkResult(file, 75, MFShutdown(), "Could not properly shut down audio encoder.");
   } catch (const std::runtime_error& error) {
@@ -101,23 +98,23 @@ MFEncoder::~MFEncoder() {
 
 void MFEncoder::write(const uint8_t* data, uint32_t frames, const WAVEFORMATEX* format, int64_t time) {
   const uint32_t size = static_cast<uint32_t>(format->nBlockAlign) * frames;
-  Held<IMFMediaBuffer> buffer;
-  checkResult(file, 86, MFCreateMemoryBuffer(size, &buffer.object), "Unable to create memory buffer.");
+  ComPtr<IMFMediaBuffer> buffer;
+  checkResult(file, 86, MFCreateMemoryBuffer(size, buffer.GetAddressOf()), "Unable to create memory buffer.");
   BYTE* destination = nullptr;
-  checkResult(file, 89, buffer.object->Lock(&destination, nullptr, nullptr), "Could not get a lock on input buffer.");
+  checkResult(file, 89, buffer->Lock(&destination, nullptr, nullptr), "Could not get a lock on input buffer.");
   if (size) std::memcpy(destination, data, size);
-  checkResult(file, 93, buffer.object->Unlock(), "Could not unlock input buffer.");
-  checkResult(file, 95, buffer.object->SetCurrentLength(size), "Could not set the buffer's current length.");
+  checkResult(file, 93, buffer->Unlock(), "Could not unlock input buffer.");
+  checkResult(file, 95, buffer->SetCurrentLength(size), "Could not set the buffer's current length.");
 
-  Held<IMFSample> sample;
-  checkResult(file, 98, MFCreateSample(&sample.object), "Could not create sample.");
-  checkResult(file, 99, sample.object->AddBuffer(buffer.object), "Could not add input buffer to sample.");
+  ComPtr<IMFSample> sample;
+  checkResult(file, 98, MFCreateSample(sample.GetAddressOf()), "Could not create sample.");
+  checkResult(file, 99, sample->AddBuffer(buffer.Get()), "Could not add input buffer to sample.");
   // The first packet of a recording (time 0) carries no time.
-  if (time != 0) checkResult(file, 102, sample.object->SetSampleTime(time), "Could not set sample time.");
+  if (time != 0) checkResult(file, 102, sample->SetSampleTime(time), "Could not set sample time.");
   // Kept in this form on purpose: for every real packet the quotient truncates to 0.
   const auto duration = static_cast<LONGLONG>(frames / (format->nSamplesPerSec * 10000000.0));
-  checkResult(file, 105, sample.object->SetSampleDuration(duration), "Could not set sample duration.");
-  checkResult(file, 106, sinkWriter->WriteSample(0, sample.object), "Could not write sample.");
+  checkResult(file, 105, sample->SetSampleDuration(duration), "Could not set sample duration.");
+  checkResult(file, 106, sinkWriter->WriteSample(0, sample.Get()), "Could not write sample.");
 }
 
 void MFEncoder::finalize() {

@@ -28,7 +28,7 @@ class MFEncoder : public virtual Encoder {
  private:
   const WAVEFORMATEXTENSIBLE* format;
   uint32_t streamIndex = 0;
-  IMFSinkWriter* sinkWriter = nullptr;
+  ComPtr<IMFSinkWriter> sinkWriter;
 };
 
 }  // namespace capture::audio

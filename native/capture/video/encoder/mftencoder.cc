@@ -10,7 +10,6 @@
 
 #include "capture/check.h"
 #include "capture/clock.h"
-#include "capture/held.h"
 
 namespace capture::video::encoder {
 
@@ -42,11 +41,9 @@ std::chrono::system_clock::time_point atMillis(int64_t ms) {
 
 MFTEncoder::MFTEncoder(std::shared_ptr<capture::video::Clip> clip) : clip(std::move(clip)) {}
 
-// The writer is released here although the recording never needs it again after Finalize:
+// The writer goes with the encoder although the recording never needs it again after Finalize:
 // holding on to it would keep its encoder's memory for the life of the process.
-MFTEncoder::~MFTEncoder() {
-  if (writer) writer->Release();
-}
+MFTEncoder::~MFTEncoder() = default;
 
 void MFTEncoder::encode(capture::video::FrameQueue* queue) {
   this->queue = queue;
@@ -161,53 +158,53 @@ void MFTEncoder::write(std::unique_ptr<Frame> picture, LONGLONG time) {
 }
 
 void MFTEncoder::configure() {
-  Held<IMFAttributes> attrs;
-  checkResult(file, 48, MFCreateAttributes(&attrs.object, 0), "Unable to create sink writer config.");
-  checkResult(file, 49, attrs.object->SetUINT32(MF_LOW_LATENCY, TRUE), "Unable to set low latency mode.");
-  checkResult(file, 50, attrs.object->SetUINT32(MF_READWRITE_ENABLE_HARDWARE_TRANSFORMS, TRUE),
+  ComPtr<IMFAttributes> attrs;
+  checkResult(file, 48, MFCreateAttributes(attrs.GetAddressOf(), 0), "Unable to create sink writer config.");
+  checkResult(file, 49, attrs->SetUINT32(MF_LOW_LATENCY, TRUE), "Unable to set low latency mode.");
+  checkResult(file, 50, attrs->SetUINT32(MF_READWRITE_ENABLE_HARDWARE_TRANSFORMS, TRUE),
               "Unable to enable hardware transforms.");
-  checkResult(file, 51, attrs.object->SetUINT32(MF_SINK_WRITER_DISABLE_THROTTLING, TRUE),
+  checkResult(file, 51, attrs->SetUINT32(MF_SINK_WRITER_DISABLE_THROTTLING, TRUE),
               "Unable to disable throttling.");
-  checkResult(file, 52, attrs.object->SetGUID(MF_TRANSCODE_CONTAINERTYPE, MFTranscodeContainerType_MPEG4),
+  checkResult(file, 52, attrs->SetGUID(MF_TRANSCODE_CONTAINERTYPE, MFTranscodeContainerType_MPEG4),
               "Unable to set container type.");
-  checkResult(file, 54, MFCreateSinkWriterFromURL(clip->path.c_str(), nullptr, attrs.object, &writer),
+  checkResult(file, 54, MFCreateSinkWriterFromURL(clip->path.c_str(), nullptr, attrs.Get(), writer.GetAddressOf()),
               "Could not create sink.");
-  attrs.release();
+  attrs.Reset();
 
   const UINT64 frameSize = (static_cast<UINT64>(queue->width) << 32) | static_cast<UINT32>(queue->height);
   const UINT64 frameRate = (static_cast<UINT64>(30) << 32) | 1;
   const UINT64 aspectRatio = (static_cast<UINT64>(1) << 32) | 1;
 
-  Held<IMFMediaType> out;
-  checkResult(file, 58, MFCreateMediaType(&out.object), "Could not create output media type.");
-  checkResult(file, 59, out.object->SetGUID(MF_MT_MAJOR_TYPE, MFMediaType_Video), "Unable to set major type of output.");
-  checkResult(file, 60, out.object->SetGUID(MF_MT_SUBTYPE, MFVideoFormat_H264), "Unable to set subtype of output.");
-  checkResult(file, 61, out.object->SetUINT32(MF_MT_AVG_BITRATE, bitRate), "Unable to set output bitrate.");
-  checkResult(file, 62, out.object->SetUINT32(MF_MT_INTERLACE_MODE, MFVideoInterlace_Progressive),
+  ComPtr<IMFMediaType> out;
+  checkResult(file, 58, MFCreateMediaType(out.GetAddressOf()), "Could not create output media type.");
+  checkResult(file, 59, out->SetGUID(MF_MT_MAJOR_TYPE, MFMediaType_Video), "Unable to set major type of output.");
+  checkResult(file, 60, out->SetGUID(MF_MT_SUBTYPE, MFVideoFormat_H264), "Unable to set subtype of output.");
+  checkResult(file, 61, out->SetUINT32(MF_MT_AVG_BITRATE, bitRate), "Unable to set output bitrate.");
+  checkResult(file, 62, out->SetUINT32(MF_MT_INTERLACE_MODE, MFVideoInterlace_Progressive),
               "Unable to set output interlace mode.");
-  checkResult(file, 63, out.object->SetUINT64(MF_MT_FRAME_SIZE, frameSize), "Unable to set output resolution.");
-  checkResult(file, 64, out.object->SetUINT64(MF_MT_FRAME_RATE, frameRate), "Unable to set output framerate.");
-  checkResult(file, 65, out.object->SetUINT64(MF_MT_PIXEL_ASPECT_RATIO, aspectRatio),
+  checkResult(file, 63, out->SetUINT64(MF_MT_FRAME_SIZE, frameSize), "Unable to set output resolution.");
+  checkResult(file, 64, out->SetUINT64(MF_MT_FRAME_RATE, frameRate), "Unable to set output framerate.");
+  checkResult(file, 65, out->SetUINT64(MF_MT_PIXEL_ASPECT_RATIO, aspectRatio),
               "Unable to set output pixel aspect ratio.");
-  checkResult(file, 66, out.object->SetUINT32(MF_MT_MPEG2_PROFILE, eAVEncH264VProfile_Main),
+  checkResult(file, 66, out->SetUINT32(MF_MT_MPEG2_PROFILE, eAVEncH264VProfile_Main),
               "Unable to set output profile.");
-  checkResult(file, 67, writer->AddStream(out.object, &streamIndex), "Could not add stream to writer.");
-  out.release();
+  checkResult(file, 67, writer->AddStream(out.Get(), &streamIndex), "Could not add stream to writer.");
+  out.Reset();
 
   // No default stride: the input is bottom-up RGB32, which writeFrame() provides.
-  Held<IMFMediaType> in;
-  checkResult(file, 71, MFCreateMediaType(&in.object), "Could not create input media type.");
-  checkResult(file, 72, in.object->SetGUID(MF_MT_MAJOR_TYPE, MFMediaType_Video), "Unable to set major type of input.");
-  checkResult(file, 73, in.object->SetGUID(MF_MT_SUBTYPE, MFVideoFormat_RGB32), "Unable to set subtype of input.");
-  checkResult(file, 74, in.object->SetUINT32(MF_MT_AVG_BITRATE, bitRate), "Unable to set input bitrate.");
-  checkResult(file, 75, in.object->SetUINT32(MF_MT_INTERLACE_MODE, MFVideoInterlace_Progressive),
+  ComPtr<IMFMediaType> in;
+  checkResult(file, 71, MFCreateMediaType(in.GetAddressOf()), "Could not create input media type.");
+  checkResult(file, 72, in->SetGUID(MF_MT_MAJOR_TYPE, MFMediaType_Video), "Unable to set major type of input.");
+  checkResult(file, 73, in->SetGUID(MF_MT_SUBTYPE, MFVideoFormat_RGB32), "Unable to set subtype of input.");
+  checkResult(file, 74, in->SetUINT32(MF_MT_AVG_BITRATE, bitRate), "Unable to set input bitrate.");
+  checkResult(file, 75, in->SetUINT32(MF_MT_INTERLACE_MODE, MFVideoInterlace_Progressive),
               "Unable to set input interlace mode.");
-  checkResult(file, 76, in.object->SetUINT64(MF_MT_FRAME_SIZE, frameSize), "Unable to set input resolution.");
-  checkResult(file, 77, in.object->SetUINT64(MF_MT_FRAME_RATE, frameRate), "Unable to set input framerate.");
-  checkResult(file, 78, in.object->SetUINT64(MF_MT_PIXEL_ASPECT_RATIO, aspectRatio),
+  checkResult(file, 76, in->SetUINT64(MF_MT_FRAME_SIZE, frameSize), "Unable to set input resolution.");
+  checkResult(file, 77, in->SetUINT64(MF_MT_FRAME_RATE, frameRate), "Unable to set input framerate.");
+  checkResult(file, 78, in->SetUINT64(MF_MT_PIXEL_ASPECT_RATIO, aspectRatio),
               "Unable to set input pixel aspect ratio.");
-  checkResult(file, 80, writer->SetInputMediaType(streamIndex, in.object, nullptr), "Could not set input media type.");
-  in.release();
+  checkResult(file, 80, writer->SetInputMediaType(streamIndex, in.Get(), nullptr), "Could not set input media type.");
+  in.Reset();
 
   checkResult(file, 83, writer->BeginWriting(), "Could not being writing.");
 }
@@ -215,25 +212,25 @@ void MFTEncoder::configure() {
 void MFTEncoder::writeFrame(const Frame& frame, LONGLONG time) {
   ++frameCount;
   const DWORD length = static_cast<DWORD>(queue->width) * static_cast<DWORD>(queue->height) * 4;
-  Held<IMFMediaBuffer> buffer;
-  checkResult(file, 88, MFCreateMemoryBuffer(length, &buffer.object), "Could not create memory buffer");
+  ComPtr<IMFMediaBuffer> buffer;
+  checkResult(file, 88, MFCreateMemoryBuffer(length, buffer.GetAddressOf()), "Could not create memory buffer");
 
   BYTE* dst = nullptr;
-  checkResult(file, 105, buffer.object->Lock(&dst, nullptr, nullptr), "Could not get a lock on input buffer.");
+  checkResult(file, 105, buffer->Lock(&dst, nullptr, nullptr), "Could not get a lock on input buffer.");
   // Rows go in upside down: the input type is bottom-up RGB32.
   const uint32_t rowBytes = static_cast<uint32_t>(frame.width) * 4;
   const uint8_t* src = frame.data.get();
   for (uint64_t i = 0; i < frame.height; ++i)
     std::memcpy(dst + (frame.height - 1 - i) * rowBytes, src + i * rowBytes, rowBytes);
-  checkResult(file, 124, buffer.object->Unlock(), "Could not unlock input buffer.");
-  checkResult(file, 126, buffer.object->SetCurrentLength(length), "Could not set current length.");
+  checkResult(file, 124, buffer->Unlock(), "Could not unlock input buffer.");
+  checkResult(file, 126, buffer->SetCurrentLength(length), "Could not set current length.");
 
-  Held<IMFSample> sample;
-  checkResult(file, 129, MFCreateSample(&sample.object), "Could not create sample.");
-  checkResult(file, 130, sample.object->AddBuffer(buffer.object), "Coudl not add input buffer to sample.");
-  checkResult(file, 134, sample.object->SetSampleTime(time), "Could not set sample time.");
-  checkResult(file, 135, sample.object->SetSampleDuration(sampleDuration), "Could not set sample duration.");
-  checkResult(file, 137, writer->WriteSample(streamIndex, sample.object), "Could not write sample.");
+  ComPtr<IMFSample> sample;
+  checkResult(file, 129, MFCreateSample(sample.GetAddressOf()), "Could not create sample.");
+  checkResult(file, 130, sample->AddBuffer(buffer.Get()), "Coudl not add input buffer to sample.");
+  checkResult(file, 134, sample->SetSampleTime(time), "Could not set sample time.");
+  checkResult(file, 135, sample->SetSampleDuration(sampleDuration), "Could not set sample duration.");
+  checkResult(file, 137, writer->WriteSample(streamIndex, sample.Get()), "Could not write sample.");
 }
 
 }  // namespace capture::video::encoder

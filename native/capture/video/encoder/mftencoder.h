@@ -33,7 +33,7 @@ class MFTEncoder : public Encoder {
   void writeFrame(const Frame& frame, LONGLONG time);
 
   std::shared_ptr<capture::video::Clip> clip;
-  IMFSinkWriter* writer = nullptr;
+  ComPtr<IMFSinkWriter> writer;
   DWORD streamIndex = 0;
   capture::video::FrameQueue* queue = nullptr;
   std::unique_ptr<Frame> last;  // the picture written last, for repeats

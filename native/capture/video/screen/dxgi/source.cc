@@ -11,7 +11,6 @@
 #include "capture/video/copy.h"
 #include "capture/video/scale.h"
 #include "capture/video/screen/dxgi/duplicate.h"
-#include "capture/held.h"
 #include "capture/video/screen/dxgi/recording.h"
 #include "capture/video/screen/dxgi/texture.h"
 #include "platform/user32.h"
@@ -19,37 +18,21 @@
 namespace capture::video::screen::dxgi {
 
 Source::Source(IDXGIOutput1* output, ID3D11Device* device, bool selected) : output(output), device(device) {
-  output->AddRef();
-  device->AddRef();
   acquireTimeout = 5;
   captureMouse = true;
   isSelected = selected;
-  try {
-    device->GetImmediateContext(&context);
-    featureLevel = device->GetFeatureLevel();
-    DXGI_OUTPUT_DESC desc{};
-    output->GetDesc(&desc);
-    outputWidth = desc.DesktopCoordinates.right - desc.DesktopCoordinates.left;
-    outputHeight = desc.DesktopCoordinates.bottom - desc.DesktopCoordinates.top;
-    stagingTexture = createStagingTexture(device, outputWidth, outputHeight);
-    duplication = duplicateOutput(output, device);
-    queue = std::make_shared<capture::video::FrameQueue>(capture::toWide(name()), outputWidth, outputHeight, 0);
-  } catch (...) {
-    releaseAll();
-    throw;
-  }
+  device->GetImmediateContext(context.GetAddressOf());
+  featureLevel = device->GetFeatureLevel();
+  DXGI_OUTPUT_DESC desc{};
+  output->GetDesc(&desc);
+  outputWidth = desc.DesktopCoordinates.right - desc.DesktopCoordinates.left;
+  outputHeight = desc.DesktopCoordinates.bottom - desc.DesktopCoordinates.top;
+  stagingTexture.Attach(createStagingTexture(device, outputWidth, outputHeight));
+  duplication.Attach(duplicateOutput(output, device));
+  queue = std::make_shared<capture::video::FrameQueue>(capture::toWide(name()), outputWidth, outputHeight, 0);
 }
 
-Source::~Source() { releaseAll(); }
-
-void Source::releaseAll() {
-  release(output);
-  release(device);
-  release(context);
-  release(stagingTexture);
-  release(duplication);
-  pointer.shapeBuffer.reset();
-}
+Source::~Source() = default;
 
 std::string Source::name() {
   DXGI_OUTPUT_DESC desc{};
@@ -72,14 +55,14 @@ std::string Source::name() {
 
 void Source::capture() {
   DXGI_OUTDUPL_FRAME_INFO frameInfo{};
-  IDXGIResource* acquired = nullptr;
-  HRESULT hr = duplication->AcquireNextFrame(acquireTimeout, &frameInfo, &acquired);
+  ComPtr<IDXGIResource> resource;
+  HRESULT hr = duplication->AcquireNextFrame(acquireTimeout, &frameInfo, resource.GetAddressOf());
   if (hr == DXGI_ERROR_ACCESS_LOST) {
-    release(duplication);
+    duplication.Reset();
     bool reported = false;
     while (!duplication) {
       try {
-        duplication = duplicateOutput(output, device);
+        duplication.Attach(duplicateOutput(output.Get(), device.Get()));
       } catch (const std::exception& e) {
         // Access comes back after the mode change or desktop switch is over, or once the display
         // server runs again; until then the pump waits here without spinning. Said once.
@@ -95,24 +78,24 @@ void Source::capture() {
     return;
   }
   if (hr == DXGI_ERROR_WAIT_TIMEOUT) return;
-  Held<IDXGIResource> resource(acquired);
 
   updatePointer(pointer, frameInfo, [this](UINT size, void* buffer, UINT* required, DXGI_OUTDUPL_POINTER_SHAPE_INFO* info) {
     return duplication->GetFramePointerShape(size, buffer, required, info);
   });
 
-  ID3D11Texture2D* texture = nullptr;
-  hr = resource ? resource->QueryInterface(IID_ID3D11Texture2D, reinterpret_cast<void**>(&texture)) : E_POINTER;
-  resource.release();
+  ComPtr<ID3D11Texture2D> texture;
+  hr = resource ? resource->QueryInterface(IID_ID3D11Texture2D, reinterpret_cast<void**>(texture.GetAddressOf()))
+                : E_POINTER;
+  resource.Reset();
   capture::checkResult("native/capture/video/screen/dxgi/source", 85, hr, "Could not create temporary texture.");
-  context->CopyResource(stagingTexture, texture);
-  texture->Release();
+  context->CopyResource(stagingTexture.Get(), texture.Get());
+  texture.Reset();
 
   hr = duplication->ReleaseFrame();
   capture::checkResult("native/capture/video/screen/dxgi/source", 91, hr, "Could not release image frame.");
 
   D3D11_MAPPED_SUBRESOURCE mapped{};
-  hr = context->Map(stagingTexture, 0, D3D11_MAP_READ, 0, &mapped);
+  hr = context->Map(stagingTexture.Get(), 0, D3D11_MAP_READ, 0, &mapped);
   capture::checkResult("native/capture/video/screen/dxgi/source", 94, hr, "Could not map device context for image.");
 
   auto frame = capture::video::Frame::make(outputWidth, outputHeight, 0, capture::currentTimeMillis());

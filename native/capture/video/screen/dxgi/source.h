@@ -39,21 +39,18 @@ class Source : public capture::video::Source {
   // Shared with the recording thread, which may outlive the source.
   std::shared_ptr<capture::video::FrameQueue> queue;
   std::shared_ptr<capture::video::Clip> clip;  // the latest clip, guarded by queue->mutex
-  IDXGIOutput1* output = nullptr;
-  ID3D11Device* device = nullptr;
-  ID3D11DeviceContext* context = nullptr;
-  ID3D11Texture2D* stagingTexture = nullptr;
+  ComPtr<IDXGIOutput1> output;
+  ComPtr<ID3D11Device> device;
+  ComPtr<ID3D11DeviceContext> context;
+  ComPtr<ID3D11Texture2D> stagingTexture;
   D3D_FEATURE_LEVEL featureLevel{};
-  IDXGIOutputDuplication* duplication = nullptr;
+  ComPtr<IDXGIOutputDuplication> duplication;
   int32_t outputWidth = 0;
   int32_t outputHeight = 0;
   uint32_t acquireTimeout = 5;
   std::atomic<bool> captureMouse{true};  // written by the JavaScript thread
   PointerInfo pointer;
   bool isSelected = false;
-
- private:
-  void releaseAll();
 };
 
 }  // namespace capture::video::screen::dxgi
