@@ -107,27 +107,27 @@ struct Source::Clip {
 
 // The silence thread's share of the source: it never ends, so it must not depend on the source.
 struct Source::Silence {
-  IMMDevice* endpoint;
-  IAudioClient* silenceClient = nullptr;
-  IAudioRenderClient* renderClient = nullptr;
+  ComPtr<IMMDevice> endpoint;
+  ComPtr<IAudioClient> silenceClient;
+  ComPtr<IAudioRenderClient> renderClient;
 
   void run() {
     // A try after a failure starts with clients of its own.
-    if (renderClient) renderClient->Release();
-    if (silenceClient) silenceClient->Release();
-    renderClient = nullptr;
-    silenceClient = nullptr;
-    capture::checkResult(kFile, 173,
-                         endpoint->Activate(IID_IAudioClient, CLSCTX_ALL, nullptr, reinterpret_cast<void**>(&silenceClient)),
-                         "Could not create audio client.");
-    WAVEFORMATEXTENSIBLE* mix = readMixFormat(silenceClient);
+    renderClient.Reset();
+    silenceClient.Reset();
+    capture::checkResult(
+        kFile, 173,
+        endpoint->Activate(IID_IAudioClient, CLSCTX_ALL, nullptr, reinterpret_cast<void**>(silenceClient.GetAddressOf())),
+        "Could not create audio client.");
+    WAVEFORMATEXTENSIBLE* mix = readMixFormat(silenceClient.Get());
     HRESULT hr = silenceClient->Initialize(AUDCLNT_SHAREMODE_SHARED, 0, kBufferDuration, 0, &mix->Format, nullptr);
     delete mix;
     capture::checkResult(kFile, 178, hr, "Could not initialize the audio client.");
     UINT32 bufferFrames = 0;
     capture::checkResult(kFile, 183, silenceClient->GetBufferSize(&bufferFrames), "Could not get the buffer size.");
     capture::checkResult(kFile, 186,
-                         silenceClient->GetService(IID_IAudioRenderClient, reinterpret_cast<void**>(&renderClient)),
+                         silenceClient->GetService(IID_IAudioRenderClient,
+                                                   reinterpret_cast<void**>(renderClient.GetAddressOf())),
                          "Could not get the audio capture client service from the audio client.");
     capture::checkResult(kFile, 189, silenceClient->Start(), "Could not start the audio client.");
     for (;;) {
@@ -151,7 +151,6 @@ Source::Source(IMMDevice* endpoint, bool isSelected) : Source(endpoint, isSelect
 Source::Source(IMMDevice* endpoint, bool isSelected, EncoderFactory makeEncoder)
     : endpoint(endpoint), makeEncoder(std::move(makeEncoder)), isSelected(isSelected) {
   silence = std::make_shared<Silence>();
-  endpoint->AddRef();
   silence->endpoint = endpoint;
   std::thread([state = silence] {
     capture::nameThread("tavio-silence");
@@ -160,7 +159,6 @@ Source::Source(IMMDevice* endpoint, bool isSelected, EncoderFactory makeEncoder)
 }
 
 Source::~Source() {
-  if (endpoint) endpoint->Release();
   if (IAudioClient* client = audioClient.load()) client->Release();
   if (IAudioCaptureClient* client = captureClient.load()) client->Release();
   delete format.load();
@@ -169,16 +167,15 @@ Source::~Source() {
 int32_t Source::type() { return capture::AudioEndpoint; }
 
 std::string Source::name() {
-  IPropertyStore* store = nullptr;
-  capture::checkResult(kFile, 404, endpoint->OpenPropertyStore(STGM_READ, &store), "Could not open property store");
+  ComPtr<IPropertyStore> store;
+  capture::checkResult(kFile, 404, endpoint->OpenPropertyStore(STGM_READ, store.GetAddressOf()),
+                       "Could not open property store");
   PROPVARIANT value;
   PropVariantInit(&value);
-  HRESULT hr = store->GetValue(PKEY_Device_FriendlyName, &value);
-  if (FAILED(hr)) store->Release();
-  capture::checkResult(kFile, 416, hr, "Could not get key from property store.");
+  capture::checkResult(kFile, 416, store->GetValue(PKEY_Device_FriendlyName, &value),
+                       "Could not get key from property store.");
   std::string text = value.vt == VT_LPWSTR && value.pwszVal ? capture::toUtf8(value.pwszVal) : std::string();
   PropVariantClear(&value);
-  store->Release();
   return text;
 }
 

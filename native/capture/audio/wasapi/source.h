@@ -55,7 +55,7 @@ class Source : public capture::audio::Source, public std::enable_shared_from_thi
   void finishOverdue(uint64_t now);
   void finishAll();
 
-  IMMDevice* endpoint;
+  ComPtr<IMMDevice> endpoint;
   // The newest capture thread's clients; each thread works with its own, and a later thread's
   // replace an earlier one's here without releasing them.
   std::atomic<IAudioClient*> audioClient{nullptr};
