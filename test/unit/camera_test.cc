@@ -193,7 +193,7 @@ TEST(CameraPreviewCallbacks, VideoSampleReplacesTheQueue) {
 TEST(CameraCaptureManager, RecordsOnlyToDotMp4SpeltExactly) {
   mfce::CaptureManager manager;
   auto* engine = new fakes::FakeCaptureEngine;
-  manager.engine = engine;
+  manager.engine.Attach(engine);
   manager.hasVideo = 1;
   engine->AddRef();
   for (const wchar_t* path : {L"/tmp/clip.MP4", L"/tmp/clip.mp4x", L"/tmp/clip", L"/tmp/a.mp4/clip"})
@@ -204,7 +204,6 @@ TEST(CameraCaptureManager, RecordsOnlyToDotMp4SpeltExactly) {
   EXPECT_EQ(MF_E_INVALIDREQUEST, manager.StartRecord(L"x.mp4"));
   manager.recording = false;
   manager.engine = nullptr;
-  engine->Release();
   engine->Release();
 }
 
@@ -217,7 +216,7 @@ TEST(CameraCaptureManager, VideoRecordStreamAsksForH264) {
   mfce::CaptureManager manager;
   manager.engineEvent = CreateEventA(nullptr, FALSE, FALSE, nullptr);
   auto* engine = new fakes::FakeCaptureEngine;
-  manager.engine = engine;
+  manager.engine.Attach(engine);
   answerThrough(manager, engine);
   manager.hasVideo = 1;
   IMFMediaType* mjpg = videoType(MFVideoFormat_MJPG, 640, 480, 30, 1);
@@ -254,7 +253,7 @@ TEST(CameraCaptureManager, AudioRecordStreamIsTheFirstAacType) {
   mfce::CaptureManager manager;
   manager.engineEvent = CreateEventA(nullptr, FALSE, FALSE, nullptr);
   auto* engine = new fakes::FakeCaptureEngine;
-  manager.engine = engine;
+  manager.engine.Attach(engine);
   answerThrough(manager, engine);
   manager.hasAudio = 1;
   ASSERT_EQ(S_OK, manager.StartRecord(L"/tmp/clip.mp4"));
@@ -315,10 +314,10 @@ TEST(CameraCaptureManager, EngineEventsSetFlagsAndSignalEveryTime) {
 
   // The error event tears the engine down; later operations find none.
   auto* engine = new fakes::FakeCaptureEngine;
-  manager.engine = engine;
+  manager.engine.Attach(engine);
   manager.recording = true;
   handle(MF_CAPTURE_ENGINE_ERROR, E_FAIL);
-  EXPECT_EQ(nullptr, manager.engine);
+  EXPECT_FALSE(manager.engine);
   EXPECT_EQ(nullptr, manager.engineEvent);
   EXPECT_FALSE(manager.previewing);
   EXPECT_FALSE(manager.recording);
@@ -333,7 +332,7 @@ TEST(CameraCaptureManager, EngineEventsSetFlagsAndSignalEveryTime) {
 TEST(CameraCaptureManager, PreviewIsConfiguredOnceAndLaterCallsKeepTheCallersSize) {
   mfce::CaptureManager manager;
   auto* engine = new fakes::FakeCaptureEngine;
-  manager.engine = engine;
+  manager.engine.Attach(engine);
   manager.hasVideo = 1;
   IMFMediaType* yuy2 = videoType(MFVideoFormat_YUY2, 1280, 720, 30, 1);
   engine->source->videoType = yuy2;
@@ -342,7 +341,7 @@ TEST(CameraCaptureManager, PreviewIsConfiguredOnceAndLaterCallsKeepTheCallersSiz
   ASSERT_EQ(S_OK, manager.ConfigurePreview(width, height));
   EXPECT_EQ(1280u, width);
   EXPECT_EQ(720u, height);
-  ASSERT_NE(nullptr, manager.previewSink);
+  ASSERT_TRUE(manager.previewSink);
   ASSERT_EQ(1u, engine->preview->added.size());
   EXPECT_EQ(DWORD{MF_CAPTURE_ENGINE_PREFERRED_SOURCE_STREAM_FOR_VIDEO_PREVIEW}, engine->preview->sources[0]);
   GUID subtype{};
@@ -351,7 +350,7 @@ TEST(CameraCaptureManager, PreviewIsConfiguredOnceAndLaterCallsKeepTheCallersSiz
   EXPECT_EQ(MFVideoFormat_ARGB32, subtype);
   EXPECT_EQ(S_OK, engine->preview->added[0]->GetUINT32(MF_MT_ALL_SAMPLES_INDEPENDENT, &independent));
   EXPECT_EQ(1u, independent);
-  EXPECT_EQ(static_cast<IMFCaptureEngineOnSampleCallback*>(manager.videoSampleCallback), engine->preview->callbacks[0]);
+  EXPECT_EQ(static_cast<IMFCaptureEngineOnSampleCallback*>(manager.videoSampleCallback.Get()), engine->preview->callbacks[0]);
   const int sinkCalls = engine->getSinkCalls;
 
   // Configured: the answer is S_OK and the caller's values come back as they went in.
@@ -371,7 +370,7 @@ TEST(CameraCaptureManager, PreviewIsConfiguredOnceAndLaterCallsKeepTheCallersSiz
 TEST(CameraCaptureManager, APreviewThatFailedAfterGettingItsSinkIsNotConfiguredAgain) {
   mfce::CaptureManager manager;
   auto* engine = new fakes::FakeCaptureEngine;
-  manager.engine = engine;
+  manager.engine.Attach(engine);
   manager.hasVideo = 1;
   manager.hasAudio = 1;  // the fake source has no audio stream: the audio part fails
   IMFMediaType* yuy2 = videoType(MFVideoFormat_YUY2, 1280, 720, 30, 1);
@@ -379,7 +378,7 @@ TEST(CameraCaptureManager, APreviewThatFailedAfterGettingItsSinkIsNotConfiguredA
 
   UINT32 width = 640, height = 480;
   EXPECT_EQ(MF_E_INVALIDSTREAMNUMBER, manager.ConfigurePreview(width, height));
-  EXPECT_NE(nullptr, manager.previewSink);
+  EXPECT_TRUE(manager.previewSink);
   width = 640;
   height = 480;
   EXPECT_EQ(S_OK, manager.ConfigurePreview(width, height));
@@ -390,7 +389,7 @@ TEST(CameraCaptureManager, APreviewThatFailedAfterGettingItsSinkIsNotConfiguredA
   // While previewing nothing is configured either.
   mfce::CaptureManager previewing;
   auto* other = new fakes::FakeCaptureEngine;
-  previewing.engine = other;
+  previewing.engine.Attach(other);
   previewing.hasVideo = 1;
   other->source->videoType = yuy2;
   previewing.previewing = true;
@@ -411,7 +410,7 @@ TEST(CameraCaptureManager, WaitsForTheEventOfItsOwnCommand) {
   mfce::CaptureManager manager;
   manager.engineEvent = CreateEventA(nullptr, FALSE, TRUE, nullptr);  // the initialised event's signal
   auto* engine = new fakes::FakeCaptureEngine;
-  manager.engine = engine;
+  manager.engine.Attach(engine);
   manager.hasAudio = 1;
   std::vector<std::thread> answers;
   engine->answer = [&](const GUID& type, HRESULT status) {
@@ -441,7 +440,7 @@ TEST(CameraCaptureManager, AStartTheEngineRefusesOrAnEngineErrorEndsTheWait) {
   mfce::CaptureManager manager;
   manager.engineEvent = CreateEventA(nullptr, FALSE, FALSE, nullptr);
   auto* engine = new fakes::FakeCaptureEngine;
-  manager.engine = engine;
+  manager.engine.Attach(engine);
   manager.hasVideo = 1;
   IMFMediaType* yuy2 = videoType(MFVideoFormat_YUY2, 64, 48, 30, 1);
   engine->source->videoType = yuy2;
@@ -463,7 +462,7 @@ TEST(CameraCaptureManager, AStartTheEngineRefusesOrAnEngineErrorEndsTheWait) {
   };
   EXPECT_EQ(S_OK, manager.StartPreview(nullptr));
   lost.join();
-  EXPECT_EQ(nullptr, manager.engine);
+  EXPECT_FALSE(manager.engine);
 }
 
 TEST(CameraCaptureManager, ARecordingThatCouldNotBeWrittenIsAWarningLine) {

@@ -77,7 +77,7 @@ TEST(ComPtr, HoldsExactlyOneReferenceEach) {
     EXPECT_EQ(object->Release(), 3u);
     ComPtr<ITest> moved = std::move(copy);
     EXPECT_FALSE(copy);
-    EXPECT_EQ(moved, first);
+    EXPECT_EQ(moved.Get(), first.Get());
     moved = moved;  // NOLINT: assigning a holder to itself keeps the reference
     EXPECT_EQ(object->AddRef(), 4u);
     object->Release();
@@ -90,7 +90,7 @@ TEST(ComPtr, HoldsExactlyOneReferenceEach) {
     EXPECT_EQ(object->AddRef(), 2u);
     object->Release();
     ITest* kept = first.Detach();
-    EXPECT_EQ(first, nullptr);
+    EXPECT_EQ(first.Get(), nullptr);
     EXPECT_FALSE(gone);
     first.Attach(kept);
   }

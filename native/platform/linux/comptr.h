@@ -89,16 +89,3 @@ class ComPtr {
 
   T* pointer_ = nullptr;
 };
-
-template <class T, class U>
-bool operator==(const ComPtr<T>& a, const ComPtr<U>& b) noexcept {
-  return a.Get() == b.Get();
-}
-template <class T>
-bool operator==(const ComPtr<T>& a, std::nullptr_t) noexcept {
-  return a.Get() == nullptr;
-}
-template <class T>
-bool operator!=(const ComPtr<T>& a, std::nullptr_t) noexcept {
-  return a.Get() != nullptr;
-}

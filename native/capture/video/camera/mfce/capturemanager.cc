@@ -17,14 +17,6 @@ constexpr UINT engineEventMessage = WM_APP + 1;
 
 wchar_t powerReason[] = L"CaptureEngine is recording!";
 
-template <class T>
-void releaseAndClear(T*& object) {
-  if (object) {
-    object->Release();
-    object = nullptr;
-  }
-}
-
 const char* const file = "native/capture/video/camera/mfce/capturemanager";
 
 // A failure the engine reports on its own thread, where nobody catches: a warning line.
@@ -55,10 +47,7 @@ CaptureManager::CaptureManager() {
   rightPeak.store(0.0);
 }
 
-// DestroyEngine keeps the audio callback for a later engine; it goes with the manager.
-CaptureManager::~CaptureManager() {
-  if (audioSampleCallback) audioSampleCallback->Release();
-}
+CaptureManager::~CaptureManager() = default;
 
 HRESULT CaptureManager::Initialize(IUnknown* audioDevice, IUnknown* videoDevice) {
   DestroyEngine();
@@ -66,39 +55,37 @@ HRESULT CaptureManager::Initialize(IUnknown* audioDevice, IUnknown* videoDevice)
   engineEvent = CreateEventA(nullptr, FALSE, FALSE, nullptr);
   if (!engineEvent) return HRESULT_FROM_WIN32(GetLastError());
 
-  eventCallback = new (std::nothrow) CaptureEngineCB(eventWindow);
+  eventCallback.Attach(new (std::nothrow) CaptureEngineCB(eventWindow));
   if (!eventCallback) return E_OUTOFMEMORY;
   eventCallback->manager = this;
   previewWindow = nullptr;
 
-  IMFAttributes* attributes = nullptr;
-  IMFCaptureEngineClassFactory* factory = nullptr;
+  ComPtr<IMFAttributes> attributes;
+  ComPtr<IMFCaptureEngineClassFactory> factory;
   static const D3D_FEATURE_LEVEL levels[] = {D3D_FEATURE_LEVEL_11_1, D3D_FEATURE_LEVEL_11_0, D3D_FEATURE_LEVEL_10_1,
                                              D3D_FEATURE_LEVEL_10_0, D3D_FEATURE_LEVEL_9_3,  D3D_FEATURE_LEVEL_9_2,
                                              D3D_FEATURE_LEVEL_9_1};
-  ID3D11DeviceContext* context = nullptr;
+  ComPtr<ID3D11DeviceContext> context;
   D3D_FEATURE_LEVEL level{};
   HRESULT hr = D3D11CreateDevice(nullptr, D3D_DRIVER_TYPE_HARDWARE, nullptr, D3D11_CREATE_DEVICE_VIDEO_SUPPORT, levels,
-                                 sizeof(levels) / sizeof(levels[0]), D3D11_SDK_VERSION, &d3dDevice, &level, &context);
+                                 sizeof(levels) / sizeof(levels[0]), D3D11_SDK_VERSION, d3dDevice.GetAddressOf(), &level,
+                                 context.GetAddressOf());
   if (SUCCEEDED(hr)) {
-    ID3D10Multithread* multithread = nullptr;
-    hr = d3dDevice->QueryInterface(IID_ID3D10Multithread, reinterpret_cast<void**>(&multithread));
-    if (SUCCEEDED(hr)) {
-      multithread->SetMultithreadProtected(TRUE);
-      multithread->Release();
-    }
+    ComPtr<ID3D10Multithread> multithread;
+    hr = d3dDevice->QueryInterface(IID_ID3D10Multithread, reinterpret_cast<void**>(multithread.GetAddressOf()));
+    if (SUCCEEDED(hr)) multithread->SetMultithreadProtected(TRUE);
   }
-  releaseAndClear(context);
 
-  if (SUCCEEDED(hr)) hr = MFCreateDXGIDeviceManager(&resetToken, &dxgiManager);
-  if (SUCCEEDED(hr)) hr = dxgiManager->ResetDevice(d3dDevice, resetToken);
-  if (SUCCEEDED(hr)) hr = MFCreateAttributes(&attributes, 1);
-  if (SUCCEEDED(hr)) hr = attributes->SetUnknown(MF_CAPTURE_ENGINE_D3D_MANAGER, dxgiManager);
+  if (SUCCEEDED(hr)) hr = MFCreateDXGIDeviceManager(&resetToken, dxgiManager.GetAddressOf());
+  if (SUCCEEDED(hr)) hr = dxgiManager->ResetDevice(d3dDevice.Get(), resetToken);
+  if (SUCCEEDED(hr)) hr = MFCreateAttributes(attributes.GetAddressOf(), 1);
+  if (SUCCEEDED(hr)) hr = attributes->SetUnknown(MF_CAPTURE_ENGINE_D3D_MANAGER, dxgiManager.Get());
   if (SUCCEEDED(hr))
     hr = CoCreateInstance(CLSID_MFCaptureEngineClassFactory, nullptr, CLSCTX_INPROC_SERVER,
-                          IID_IMFCaptureEngineClassFactory, reinterpret_cast<void**>(&factory));
+                          IID_IMFCaptureEngineClassFactory, reinterpret_cast<void**>(factory.GetAddressOf()));
   if (SUCCEEDED(hr))
-    hr = factory->CreateInstance(CLSID_MFCaptureEngine, IID_IMFCaptureEngine, reinterpret_cast<void**>(&engine));
+    hr = factory->CreateInstance(CLSID_MFCaptureEngine, IID_IMFCaptureEngine,
+                                 reinterpret_cast<void**>(engine.GetAddressOf()));
 
   if (SUCCEEDED(hr)) {
     if (!audioDevice)
@@ -112,30 +99,27 @@ HRESULT CaptureManager::Initialize(IUnknown* audioDevice, IUnknown* videoDevice)
         hasVideo = 1;
     }
     if (SUCCEEDED(hr))
-      hr = engine->Initialize(eventCallback, attributes, audioDevice, videoDevice);
+      hr = engine->Initialize(eventCallback.Get(), attributes.Get(), audioDevice, videoDevice);
     else
-      releaseAndClear(engine);
+      engine.Reset();
   }
-
-  releaseAndClear(attributes);
-  releaseAndClear(factory);
   return hr;
 }
 
 void CaptureManager::DestroyEngine() {
   // The engine goes first: once it is released no event handler is left signalling the event
   // or filling the frame queue while the rest is torn down.
-  releaseAndClear(engine);
+  engine.Reset();
   if (engineEvent) {
     CloseHandle(engineEvent);
     engineEvent = nullptr;
   }
-  releaseAndClear(videoSampleCallback);
-  releaseAndClear(previewSink);
-  releaseAndClear(eventCallback);
-  if (dxgiManager) dxgiManager->ResetDevice(d3dDevice, resetToken);
-  releaseAndClear(d3dDevice);
-  releaseAndClear(dxgiManager);
+  videoSampleCallback.Reset();
+  previewSink.Reset();
+  eventCallback.Reset();
+  if (dxgiManager) dxgiManager->ResetDevice(d3dDevice.Get(), resetToken);
+  d3dDevice.Reset();
+  dxgiManager.Reset();
   previewing = false;
   recording = false;
   photoPending = false;
@@ -147,20 +131,22 @@ HRESULT CaptureManager::ConfigurePreview(UINT32& width, UINT32& height) {
   if (previewing) return S_OK;
   if (previewSink) return S_OK;
 
-  IMFCaptureSink* sink = nullptr;
-  IMFCaptureSource* source = nullptr;
-  IMFMediaType* deviceType = nullptr;
-  IMFMediaType* previewType = nullptr;
-  IMFMediaType* audioType = nullptr;
-  IMFMediaType* pcmType = nullptr;
+  ComPtr<IMFCaptureSink> sink;
+  ComPtr<IMFCaptureSource> source;
+  ComPtr<IMFMediaType> deviceType;
+  ComPtr<IMFMediaType> previewType;
+  ComPtr<IMFMediaType> audioType;
+  ComPtr<IMFMediaType> pcmType;
 
-  HRESULT hr = engine->GetSink(MF_CAPTURE_ENGINE_SINK_TYPE_PREVIEW, &sink);
-  if (SUCCEEDED(hr)) hr = sink->QueryInterface(IID_IMFCapturePreviewSink, reinterpret_cast<void**>(&previewSink));
+  HRESULT hr = engine->GetSink(MF_CAPTURE_ENGINE_SINK_TYPE_PREVIEW, sink.GetAddressOf());
+  if (SUCCEEDED(hr))
+    hr = sink->QueryInterface(IID_IMFCapturePreviewSink, reinterpret_cast<void**>(previewSink.GetAddressOf()));
   if (SUCCEEDED(hr) && previewWindow) hr = previewSink->SetRenderHandle(previewWindow);
-  if (SUCCEEDED(hr)) hr = engine->GetSource(&source);
+  if (SUCCEEDED(hr)) hr = engine->GetSource(source.GetAddressOf());
 
   if (SUCCEEDED(hr) && hasVideo) {
-    hr = source->GetCurrentDeviceMediaType(MF_CAPTURE_ENGINE_PREFERRED_SOURCE_STREAM_FOR_VIDEO_PREVIEW, &deviceType);
+    hr = source->GetCurrentDeviceMediaType(MF_CAPTURE_ENGINE_PREFERRED_SOURCE_STREAM_FOR_VIDEO_PREVIEW,
+                                           deviceType.GetAddressOf());
     if (SUCCEEDED(hr)) {
       UINT64 size = 0;
       hr = deviceType->GetUINT64(MF_MT_FRAME_SIZE, &size);
@@ -169,26 +155,27 @@ HRESULT CaptureManager::ConfigurePreview(UINT32& width, UINT32& height) {
         height = static_cast<UINT32>(size);
       }
     }
-    if (SUCCEEDED(hr)) hr = MakeVideoType(deviceType, MFVideoFormat_ARGB32, &previewType);
+    if (SUCCEEDED(hr)) hr = MakeVideoType(deviceType.Get(), MFVideoFormat_ARGB32, previewType.GetAddressOf());
     if (SUCCEEDED(hr)) hr = previewType->SetUINT32(MF_MT_ALL_SAMPLES_INDEPENDENT, TRUE);
     DWORD streamIndex = 0;
     if (SUCCEEDED(hr))
-      hr = previewSink->AddStream(MF_CAPTURE_ENGINE_PREFERRED_SOURCE_STREAM_FOR_VIDEO_PREVIEW, previewType, nullptr,
-                                  &streamIndex);
+      hr = previewSink->AddStream(MF_CAPTURE_ENGINE_PREFERRED_SOURCE_STREAM_FOR_VIDEO_PREVIEW, previewType.Get(),
+                                  nullptr, &streamIndex);
     if (SUCCEEDED(hr) && !previewWindow) {
-      videoSampleCallback = new (std::nothrow) CaptureEngineVideoPreviewCB;
+      videoSampleCallback.Attach(new (std::nothrow) CaptureEngineVideoPreviewCB);
       if (!videoSampleCallback) {
         hr = E_OUTOFMEMORY;
       } else {
         videoSampleCallback->manager = this;
-        hr = previewSink->SetSampleCallback(streamIndex, videoSampleCallback);
+        hr = previewSink->SetSampleCallback(streamIndex, videoSampleCallback.Get());
       }
     }
   }
 
   if (SUCCEEDED(hr) && hasAudio) {
-    hr = source->GetCurrentDeviceMediaType(MF_CAPTURE_ENGINE_PREFERRED_SOURCE_STREAM_FOR_AUDIO, &audioType);
-    if (SUCCEEDED(hr)) hr = MakePcmType(audioType, &pcmType);
+    hr = source->GetCurrentDeviceMediaType(MF_CAPTURE_ENGINE_PREFERRED_SOURCE_STREAM_FOR_AUDIO,
+                                           audioType.GetAddressOf());
+    if (SUCCEEDED(hr)) hr = MakePcmType(audioType.Get(), pcmType.GetAddressOf());
     if (SUCCEEDED(hr)) {
       UINT32 value = 0;
       audioChannels = SUCCEEDED(pcmType->GetUINT32(MF_MT_AUDIO_NUM_CHANNELS, &value)) ? value : 1;
@@ -196,24 +183,18 @@ HRESULT CaptureManager::ConfigurePreview(UINT32& width, UINT32& height) {
     }
     DWORD streamIndex = 0;
     if (SUCCEEDED(hr))
-      hr = previewSink->AddStream(MF_CAPTURE_ENGINE_PREFERRED_SOURCE_STREAM_FOR_AUDIO, pcmType, nullptr, &streamIndex);
+      hr = previewSink->AddStream(MF_CAPTURE_ENGINE_PREFERRED_SOURCE_STREAM_FOR_AUDIO, pcmType.Get(), nullptr,
+                                  &streamIndex);
     if (SUCCEEDED(hr)) {
-      audioSampleCallback = new (std::nothrow) CaptureEngineAudioPreviewCB;
+      audioSampleCallback.Attach(new (std::nothrow) CaptureEngineAudioPreviewCB);
       if (!audioSampleCallback) {
         hr = E_OUTOFMEMORY;
       } else {
         audioSampleCallback->manager = this;
-        hr = previewSink->SetSampleCallback(streamIndex, audioSampleCallback);
+        hr = previewSink->SetSampleCallback(streamIndex, audioSampleCallback.Get());
       }
     }
   }
-
-  releaseAndClear(sink);
-  releaseAndClear(source);
-  releaseAndClear(deviceType);
-  releaseAndClear(previewType);
-  releaseAndClear(audioType);
-  releaseAndClear(pcmType);
   return hr;
 }
 
@@ -268,47 +249,43 @@ HRESULT CaptureManager::StopPreview() {
 }
 
 HRESULT CaptureManager::AddVideoRecordStream(IMFCaptureSource* source, IMFCaptureRecordSink* sink) {
-  IMFMediaType* deviceType = nullptr;
-  IMFMediaType* recordType = nullptr;
-  HRESULT hr = source->GetCurrentDeviceMediaType(MF_CAPTURE_ENGINE_PREFERRED_SOURCE_STREAM_FOR_VIDEO_RECORD, &deviceType);
-  if (SUCCEEDED(hr)) hr = MakeVideoType(deviceType, MFVideoFormat_H264, &recordType);
+  ComPtr<IMFMediaType> deviceType;
+  ComPtr<IMFMediaType> recordType;
+  HRESULT hr = source->GetCurrentDeviceMediaType(MF_CAPTURE_ENGINE_PREFERRED_SOURCE_STREAM_FOR_VIDEO_RECORD,
+                                                 deviceType.GetAddressOf());
+  if (SUCCEEDED(hr)) hr = MakeVideoType(deviceType.Get(), MFVideoFormat_H264, recordType.GetAddressOf());
   if (SUCCEEDED(hr)) {
     GUID deviceSubtype = GUID_NULL;
     deviceType->GetGUID(MF_MT_SUBTYPE, &deviceSubtype);
     if (deviceSubtype == MFVideoFormat_H264 || deviceSubtype == MFVideoFormat_H264_ES)
       hr = recordType->SetGUID(MF_MT_SUBTYPE, MFVideoFormat_H264);  // the camera's stream passes through
     else
-      hr = recordType->SetUINT32(MF_MT_AVG_BITRATE, EstimateBitrate(recordType));
+      hr = recordType->SetUINT32(MF_MT_AVG_BITRATE, EstimateBitrate(recordType.Get()));
   }
   DWORD streamIndex = 0;
   if (SUCCEEDED(hr))
-    hr = sink->AddStream(MF_CAPTURE_ENGINE_PREFERRED_SOURCE_STREAM_FOR_VIDEO_RECORD, recordType, nullptr, &streamIndex);
-  releaseAndClear(deviceType);
-  releaseAndClear(recordType);
+    hr = sink->AddStream(MF_CAPTURE_ENGINE_PREFERRED_SOURCE_STREAM_FOR_VIDEO_RECORD, recordType.Get(), nullptr,
+                         &streamIndex);
   return hr;
 }
 
 HRESULT CaptureManager::AddAudioRecordStream(IMFCaptureRecordSink* sink) {
-  IMFAttributes* config = nullptr;
-  IMFCollection* types = nullptr;
-  IUnknown* first = nullptr;
-  IMFMediaType* aacType = nullptr;
-  HRESULT hr = MFCreateAttributes(&config, 1);
+  ComPtr<IMFAttributes> config;
+  ComPtr<IMFCollection> types;
+  ComPtr<IUnknown> first;
+  ComPtr<IMFMediaType> aacType;
+  HRESULT hr = MFCreateAttributes(config.GetAddressOf(), 1);
   if (SUCCEEDED(hr)) hr = config->SetUINT32(MF_LOW_LATENCY, TRUE);
   if (SUCCEEDED(hr))
     hr = MFTranscodeGetAudioOutputAvailableTypes(MFAudioFormat_AAC, MFT_ENUM_FLAG_ALL | MFT_ENUM_FLAG_SORTANDFILTER,
-                                                 config, &types);
-  if (SUCCEEDED(hr)) hr = types->GetElement(0, &first);
-  if (SUCCEEDED(hr)) hr = first->QueryInterface(IID_IMFMediaType, reinterpret_cast<void**>(&aacType));
+                                                 config.Get(), types.GetAddressOf());
+  if (SUCCEEDED(hr)) hr = types->GetElement(0, first.GetAddressOf());
+  if (SUCCEEDED(hr)) hr = first->QueryInterface(IID_IMFMediaType, reinterpret_cast<void**>(aacType.GetAddressOf()));
   DWORD streamIndex = 0;
   if (SUCCEEDED(hr)) {
-    hr = sink->AddStream(MF_CAPTURE_ENGINE_PREFERRED_SOURCE_STREAM_FOR_AUDIO, aacType, nullptr, &streamIndex);
+    hr = sink->AddStream(MF_CAPTURE_ENGINE_PREFERRED_SOURCE_STREAM_FOR_AUDIO, aacType.Get(), nullptr, &streamIndex);
     if (hr == MF_E_INVALIDSTREAMNUMBER) hr = S_OK;  // a device without sound records video only
   }
-  releaseAndClear(config);
-  releaseAndClear(types);
-  releaseAndClear(first);
-  releaseAndClear(aacType);
   return hr;
 }
 
@@ -325,16 +302,17 @@ HRESULT CaptureManager::StartRecord(LPCWSTR path) {
   const GUID videoEncoding = hasVideo ? MFVideoFormat_H264 : GUID_NULL;
   const GUID audioEncoding = hasAudio ? MFAudioFormat_AAC : GUID_NULL;
 
-  IMFCaptureSink* sink = nullptr;
-  IMFCaptureRecordSink* recordSink = nullptr;
-  IMFCaptureSource* source = nullptr;
-  HRESULT hr = engine->GetSink(MF_CAPTURE_ENGINE_SINK_TYPE_RECORD, &sink);
-  if (SUCCEEDED(hr)) hr = sink->QueryInterface(IID_IMFCaptureRecordSink, reinterpret_cast<void**>(&recordSink));
-  if (SUCCEEDED(hr)) hr = engine->GetSource(&source);
+  ComPtr<IMFCaptureSink> sink;
+  ComPtr<IMFCaptureRecordSink> recordSink;
+  ComPtr<IMFCaptureSource> source;
+  HRESULT hr = engine->GetSink(MF_CAPTURE_ENGINE_SINK_TYPE_RECORD, sink.GetAddressOf());
+  if (SUCCEEDED(hr))
+    hr = sink->QueryInterface(IID_IMFCaptureRecordSink, reinterpret_cast<void**>(recordSink.GetAddressOf()));
+  if (SUCCEEDED(hr)) hr = engine->GetSource(source.GetAddressOf());
   if (SUCCEEDED(hr)) hr = recordSink->RemoveAllStreams();
   if (SUCCEEDED(hr)) hr = recordSink->SetOutputFileName(path);
-  if (SUCCEEDED(hr) && videoEncoding != GUID_NULL) hr = AddVideoRecordStream(source, recordSink);
-  if (SUCCEEDED(hr) && audioEncoding != GUID_NULL) hr = AddAudioRecordStream(recordSink);
+  if (SUCCEEDED(hr) && videoEncoding != GUID_NULL) hr = AddVideoRecordStream(source.Get(), recordSink.Get());
+  if (SUCCEEDED(hr) && audioEncoding != GUID_NULL) hr = AddAudioRecordStream(recordSink.Get());
   if (SUCCEEDED(hr)) {
     Mark before;
     mark(before);
@@ -345,9 +323,6 @@ HRESULT CaptureManager::StartRecord(LPCWSTR path) {
       if (handled_[RecordStarted].load() != before.handled[RecordStarted]) hr = recordStartStatus_.load();
     }
   }
-  releaseAndClear(sink);
-  releaseAndClear(recordSink);
-  releaseAndClear(source);
   return hr;
 }
 
@@ -361,6 +336,8 @@ HRESULT CaptureManager::StopRecord() {
 }
 
 HRESULT CaptureManager::HandleEngineEvent(IMFMediaEvent* event) {
+  ComPtr<IMFMediaEvent> taken;  // the caller's reference, let go once the event is handled
+  taken.Attach(event);
   HRESULT status = eventStatus(event);
   GUID type = GUID_NULL;
   if (SUCCEEDED(event->GetExtendedType(&type))) {
@@ -391,7 +368,7 @@ HRESULT CaptureManager::HandleEngineEvent(IMFMediaEvent* event) {
       DestroyEngine();
     }
   }
-  event->Release();
+  taken.Reset();
   SetEvent(engineEvent);  // a null handle after an error event: nothing to signal
   return status;
 }

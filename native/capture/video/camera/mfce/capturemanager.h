@@ -82,19 +82,19 @@ class CaptureManager {
   bool IsRecording() const { return recording; }
 
   HWND eventWindow = nullptr;
-  IMFCaptureEngine* engine = nullptr;
+  ComPtr<IMFCaptureEngine> engine;
   uint32_t hasAudio = 0;
   uint32_t hasVideo = 0;
-  IMFCapturePreviewSink* previewSink = nullptr;
+  ComPtr<IMFCapturePreviewSink> previewSink;
   HWND previewWindow = nullptr;
-  CaptureEngineVideoPreviewCB* videoSampleCallback = nullptr;
+  ComPtr<CaptureEngineVideoPreviewCB> videoSampleCallback;
   capture::video::FrameQueue* frameQueue = nullptr;
-  CaptureEngineAudioPreviewCB* audioSampleCallback = nullptr;
+  ComPtr<CaptureEngineAudioPreviewCB> audioSampleCallback;  // kept across engines
   uint32_t audioChannels = 0;
   uint32_t audioBitsPerSample = 0;
   std::atomic<double> leftPeak{0.0};
   std::atomic<double> rightPeak{0.0};
-  CaptureEngineCB* eventCallback = nullptr;
+  ComPtr<CaptureEngineCB> eventCallback;
   // Written on the engine's thread; a stale signal of engineEvent can end a wait before the write.
   std::atomic<bool> previewing{false};
   std::atomic<bool> recording{false};
@@ -103,8 +103,8 @@ class CaptureManager {
   HANDLE engineEvent = nullptr;
   HANDLE powerRequest = INVALID_HANDLE_VALUE;
   bool powerRequestSet = false;
-  IMFDXGIDeviceManager* dxgiManager = nullptr;
-  ID3D11Device* d3dDevice = nullptr;
+  ComPtr<IMFDXGIDeviceManager> dxgiManager;
+  ComPtr<ID3D11Device> d3dDevice;
   UINT resetToken = 0;
 
  private:

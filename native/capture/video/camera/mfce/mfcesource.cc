@@ -38,13 +38,11 @@ MFCESource::MFCESource(IMFActivate* audioDevice, IMFActivate* videoDevice, bool 
 
   if (audioDevice) {
     this->audioDevice = audioDevice;
-    audioDevice->AddRef();
     audioName = friendlyName(audioDevice, "Webcam Audio Name Placeholder", 62,
                              "Could not retrieve device audio friendly name");
   }
   if (videoDevice) {
     this->videoDevice = videoDevice;
-    videoDevice->AddRef();
     videoName = friendlyName(videoDevice, "Webcam Video Name Placeholder", 81,
                              "Could not retrieve device video friendly name");
   }
@@ -67,14 +65,8 @@ MFCESource::~MFCESource() {
     delete frameQueue;
     frameQueue = nullptr;
   }
-  if (audioDevice) {
-    audioDevice->Release();
-    audioDevice = nullptr;
-  }
-  if (videoDevice) {
-    videoDevice->Release();
-    videoDevice = nullptr;
-  }
+  audioDevice.Reset();  // before Media Foundation shuts down
+  videoDevice.Reset();
   checkResult(file, 133, MFShutdown(), "Could not shut down MFT.");
   log("MFCESource::~MFCESource() exit...");
 }
@@ -124,7 +116,7 @@ void MFCESource::stopPreview() {
 void MFCESource::reopen() {
   if (captureManager->engine) return;
   capturing = false;
-  if (FAILED(captureManager->Initialize(audioDevice, videoDevice))) return;
+  if (FAILED(captureManager->Initialize(audioDevice.Get(), videoDevice.Get()))) return;
   captureManager->eventCallback->direct = true;
   if (frameQueue && SUCCEEDED(captureManager->StartPreview(frameQueue))) log("MFCESource::reopen() preview started");
 }

@@ -56,8 +56,8 @@ class MFCESource : public capture::video::Source, public capture::audio::Source 
   bool capturing = false;
   uint32_t previewWidth = 0;  // zero until the first successful startPreview()
   uint32_t previewHeight = 0;
-  IMFActivate* audioDevice = nullptr;
-  IMFActivate* videoDevice = nullptr;
+  ComPtr<IMFActivate> audioDevice;
+  ComPtr<IMFActivate> videoDevice;
   std::string audioName;
   std::string videoName;
   bool isSelected = false;

@@ -69,14 +69,13 @@ HRESULT queryOne(Callback* self, REFIID riid, void** object) {
 }
 
 // The sample's bytes, locked; S_FALSE after the debug text when they cannot be had.
-HRESULT lockSample(IMFSample* sample, IMFMediaBuffer** buffer, BYTE** data, DWORD* length) {
-  if (FAILED(sample->ConvertToContiguousBuffer(buffer))) {
+HRESULT lockSample(IMFSample* sample, ComPtr<IMFMediaBuffer>& buffer, BYTE** data, DWORD* length) {
+  if (FAILED(sample->ConvertToContiguousBuffer(buffer.GetAddressOf()))) {
     OutputDebugStringW(L"ConvertToContiguousBuffer failed\n");
     return S_FALSE;
   }
-  if (FAILED((*buffer)->Lock(data, nullptr, length))) {
+  if (FAILED(buffer->Lock(data, nullptr, length))) {
     OutputDebugStringW(L"Lock failed\n");
-    (*buffer)->Release();
     return S_FALSE;
   }
   return S_OK;
@@ -86,10 +85,8 @@ HRESULT unlockSample(IMFMediaBuffer* buffer) {
   HRESULT hr = buffer->Unlock();
   if (FAILED(hr)) {
     OutputDebugStringW(L"Unlock failed\n");
-    buffer->Release();
     return S_FALSE;
   }
-  buffer->Release();
   return hr;
 }
 
@@ -107,13 +104,13 @@ ULONG CaptureManager::CaptureEngineVideoPreviewCB::Release() {
 
 HRESULT CaptureManager::CaptureEngineVideoPreviewCB::OnSample(IMFSample* sample) {
   if (!sample || !manager || !manager->frameQueue) return S_OK;
-  IMFMediaBuffer* buffer = nullptr;
+  ComPtr<IMFMediaBuffer> buffer;
   BYTE* data = nullptr;
   DWORD length = 0;
-  if (lockSample(sample, &buffer, &data, &length) != S_OK) return S_FALSE;
+  if (lockSample(sample, buffer, &data, &length) != S_OK) return S_FALSE;
   // The engine delivers whole ARGB32 pictures of the queue's size; the length is not compared.
   replaceFrame(*manager->frameQueue, data, capture::currentTimeMillis());
-  return unlockSample(buffer);
+  return unlockSample(buffer.Get());
 }
 
 HRESULT CaptureManager::CaptureEngineAudioPreviewCB::QueryInterface(REFIID riid, void** object) {
@@ -128,14 +125,14 @@ ULONG CaptureManager::CaptureEngineAudioPreviewCB::Release() {
 
 HRESULT CaptureManager::CaptureEngineAudioPreviewCB::OnSample(IMFSample* sample) {
   if (!sample || !manager) return S_OK;
-  IMFMediaBuffer* buffer = nullptr;
+  ComPtr<IMFMediaBuffer> buffer;
   BYTE* data = nullptr;
   DWORD length = 0;
-  if (lockSample(sample, &buffer, &data, &length) != S_OK) return S_FALSE;
+  if (lockSample(sample, buffer, &data, &length) != S_OK) return S_FALSE;
   const Peaks peaks = scanPeaks(data, length, manager->audioChannels, manager->audioBitsPerSample);
   manager->leftPeak.store(peaks.left);
   manager->rightPeak.store(peaks.right);
-  return unlockSample(buffer);
+  return unlockSample(buffer.Get());
 }
 
 }  // namespace capture::video::camera::mfce
