@@ -166,15 +166,6 @@ class ComObject : public I {
   std::atomic<ULONG> references_{1};
 };
 
-// Releases an interface pointer and clears it.
-template <class T>
-void release(T*& object) {
-  if (object) {
-    object->Release();
-    object = nullptr;
-  }
-}
-
 // UTF-16 code units (one per wchar_t) to UTF-8 and back, for names that cross the layer.
 std::string narrow(const wchar_t* utf16);
 std::wstring widen(const std::string& utf8);

@@ -89,3 +89,15 @@ class ComPtr {
 
   T* pointer_ = nullptr;
 };
+
+namespace platform {
+
+// Makes a T and answers its interface riid: the object lives on only through that answer.
+template <class T, class... Args>
+HRESULT createInstance(REFIID riid, void** object, Args&&... args) {
+  ComPtr<T> made;
+  made.Attach(new T(std::forward<Args>(args)...));
+  return made->QueryInterface(riid, object);
+}
+
+}  // namespace platform

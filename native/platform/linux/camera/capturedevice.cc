@@ -222,16 +222,16 @@ void requestKeyFrame(Device& device) {
 }
 
 HRESULT makeDeviceType(const Device& device, IMFMediaType** type) {
-  IMFMediaType* made = nullptr;
-  HRESULT hr = MFCreateMediaType(&made);
+  ComPtr<IMFMediaType> made;
+  HRESULT hr = MFCreateMediaType(made.GetAddressOf());
   if (FAILED(hr)) return hr;
   const DeviceFormat& f = device.current;
   if (device.video) {
     hr = made->SetGUID(MF_MT_MAJOR_TYPE, MFMediaType_Video);
     if (SUCCEEDED(hr)) hr = made->SetGUID(MF_MT_SUBTYPE, f.subtype);
-    if (SUCCEEDED(hr)) hr = MFSetAttributeSize(made, MF_MT_FRAME_SIZE, f.width, f.height);
-    if (SUCCEEDED(hr)) hr = MFSetAttributeRatio(made, MF_MT_FRAME_RATE, f.rate.num, f.rate.den);
-    if (SUCCEEDED(hr)) hr = MFSetAttributeRatio(made, MF_MT_PIXEL_ASPECT_RATIO, f.aspect.num, f.aspect.den);
+    if (SUCCEEDED(hr)) hr = MFSetAttributeSize(made.Get(), MF_MT_FRAME_SIZE, f.width, f.height);
+    if (SUCCEEDED(hr)) hr = MFSetAttributeRatio(made.Get(), MF_MT_FRAME_RATE, f.rate.num, f.rate.den);
+    if (SUCCEEDED(hr)) hr = MFSetAttributeRatio(made.Get(), MF_MT_PIXEL_ASPECT_RATIO, f.aspect.num, f.aspect.den);
     if (SUCCEEDED(hr)) hr = made->SetUINT32(MF_MT_INTERLACE_MODE, MFVideoInterlace_Progressive);
     if (SUCCEEDED(hr) && f.subtype != MFVideoFormat_MJPG && f.subtype != MFVideoFormat_H264)
       hr = made->SetUINT32(MF_MT_ALL_SAMPLES_INDEPENDENT, TRUE);
@@ -246,20 +246,17 @@ HRESULT makeDeviceType(const Device& device, IMFMediaType** type) {
     if (SUCCEEDED(hr)) hr = made->SetUINT32(MF_MT_AUDIO_AVG_BYTES_PER_SECOND, block * f.sampleRate);
     if (SUCCEEDED(hr)) hr = made->SetUINT32(MF_MT_ALL_SAMPLES_INDEPENDENT, TRUE);
   }
-  if (FAILED(hr)) {
-    made->Release();
-    return hr;
-  }
-  *type = made;
+  if (FAILED(hr)) return hr;
+  *type = made.Detach();
   return S_OK;
 }
 
 // A device object's link is "v4l2:<path>", "lavfi:<graph>" or "lavfi:h264:<graph>" for a camera,
 // a PulseAudio source name for a microphone.
 std::unique_ptr<Device> deviceFrom(IUnknown* object, bool video) {
-  IMFAttributes* found = nullptr;
-  if (!object || FAILED(object->QueryInterface(IID_IMFAttributes, reinterpret_cast<void**>(&found)))) return nullptr;
-  const std::unique_ptr<IMFAttributes, void (*)(IMFAttributes*)> attributes(found, [](IMFAttributes* a) { a->Release(); });
+  ComPtr<IMFAttributes> attributes;
+  if (!object || FAILED(object->QueryInterface(IID_IMFAttributes, reinterpret_cast<void**>(attributes.GetAddressOf()))))
+    return nullptr;
   wchar_t* link = nullptr;
   UINT32 length = 0;
   const GUID& key = video ? MF_DEVSOURCE_ATTRIBUTE_SOURCE_TYPE_VIDCAP_SYMBOLIC_LINK

@@ -72,27 +72,6 @@ class MediaEvent : public Attributes<IMFMediaEvent, IID_IMFMediaEvent> {
   HRESULT status_;
 };
 
-template <class T>
-struct ComPtr {
-  ComPtr() = default;
-  explicit ComPtr(T* p, bool addRef) : p(p) {
-    if (p && addRef) p->AddRef();
-  }
-  ComPtr(const ComPtr& other) : p(other.p) {
-    if (p) p->AddRef();
-  }
-  ComPtr& operator=(ComPtr other) {
-    std::swap(p, other.p);
-    return *this;
-  }
-  ~ComPtr() {
-    if (p) p->Release();
-  }
-  T* operator->() const { return p; }
-  explicit operator bool() const { return p != nullptr; }
-  T* p = nullptr;
-};
-
 // When a decoded frame was captured, in its stream's time base.
 int64_t timeOf(const AVFrame* frame) {
   return frame->best_effort_timestamp != AV_NOPTS_VALUE ? frame->best_effort_timestamp : frame->pts;
@@ -109,28 +88,23 @@ HRESULT fillSample(IMFMediaBuffer* buffer, DWORD length, LONGLONG time, LONGLONG
     buffer->Unlock();
     hr = buffer->SetCurrentLength(length);
   }
-  IMFSample* made = nullptr;
-  if (SUCCEEDED(hr)) hr = MFCreateSample(&made);
+  ComPtr<IMFSample> made;
+  if (SUCCEEDED(hr)) hr = MFCreateSample(made.GetAddressOf());
   if (SUCCEEDED(hr)) hr = made->AddBuffer(buffer);
   if (SUCCEEDED(hr)) hr = made->SetSampleTime(time);
   if (SUCCEEDED(hr)) hr = made->SetSampleDuration(duration);
-  if (FAILED(hr)) {
-    if (made) made->Release();
-    return hr;
-  }
-  *sample = made;
+  if (FAILED(hr)) return hr;
+  *sample = made.Detach();
   return S_OK;
 }
 
 // A sample holding a copy of bytes, or pixels written by fill(data), in a buffer of its own.
 template <class Fill>
 HRESULT makeSample(DWORD length, LONGLONG time, LONGLONG duration, Fill fill, IMFSample** sample) {
-  IMFMediaBuffer* buffer = nullptr;
-  HRESULT hr = MFCreateMemoryBuffer(length, &buffer);
+  ComPtr<IMFMediaBuffer> buffer;
+  HRESULT hr = MFCreateMemoryBuffer(length, buffer.GetAddressOf());
   if (FAILED(hr)) return hr;
-  hr = fillSample(buffer, length, time, duration, fill, sample);
-  buffer->Release();
-  return hr;
+  return fillSample(buffer.Get(), length, time, duration, fill, sample);
 }
 
 struct SinkStream {
@@ -291,9 +265,9 @@ void EngineThread::send(const GUID& type, HRESULT status) {
     callback = state_->events;
   }
   if (!callback) return;
-  auto* event = new MediaEvent(type, status);
-  callback->OnEvent(event);
-  event->Release();
+  ComPtr<IMFMediaEvent> event;
+  event.Attach(new MediaEvent(type, status));
+  callback->OnEvent(event.Get());
 }
 
 HRESULT EngineThread::openDevices() {
@@ -359,17 +333,17 @@ HRESULT EngineThread::startRecording(const Order& order) {
   const std::wstring url = widen(order.path);
   // Fragmented MP4: what was written before a failed write (a full disk) stays a file that plays.
   ComPtr<IMFAttributes> settings;
-  HRESULT hr = MFCreateAttributes(&settings.p, 1);
+  HRESULT hr = MFCreateAttributes(settings.GetAddressOf(), 1);
   if (SUCCEEDED(hr)) hr = settings->SetGUID(MF_TRANSCODE_CONTAINERTYPE, MFTranscodeContainerType_FMPEG4);
-  if (SUCCEEDED(hr)) hr = MFCreateSinkWriterFromURL(url.c_str(), nullptr, settings.p, &recording->writer.p);
+  if (SUCCEEDED(hr)) hr = MFCreateSinkWriterFromURL(url.c_str(), nullptr, settings.Get(), recording->writer.GetAddressOf());
   for (const SinkStream& stream : order.streams) {
     if (FAILED(hr)) break;
     Device* device = stream.video ? state_->video.get() : state_->audio.get();
     const DeviceFormat& f = device->current;
     DWORD index = 0;
-    ComPtr<IMFMediaType> output(stream.type.p, true);
+    ComPtr<IMFMediaType> output(stream.type);
     ComPtr<IMFMediaType> input;
-    hr = MFCreateMediaType(&input.p);
+    hr = MFCreateMediaType(input.GetAddressOf());
     if (FAILED(hr)) break;
     GUID wanted = GUID_NULL;
     UINT32 bitRate = 0;
@@ -380,8 +354,8 @@ HRESULT EngineThread::startRecording(const Order& order) {
       // packets are written, with its parameter sets when it has them apart from the packets.
       hr = input->SetGUID(MF_MT_MAJOR_TYPE, MFMediaType_Video);
       if (SUCCEEDED(hr)) hr = input->SetGUID(MF_MT_SUBTYPE, MFVideoFormat_H264);
-      if (SUCCEEDED(hr)) hr = MFSetAttributeSize(input.p, MF_MT_FRAME_SIZE, f.width, f.height);
-      if (SUCCEEDED(hr)) hr = MFSetAttributeRatio(input.p, MF_MT_FRAME_RATE, f.rate.num, f.rate.den);
+      if (SUCCEEDED(hr)) hr = MFSetAttributeSize(input.Get(), MF_MT_FRAME_SIZE, f.width, f.height);
+      if (SUCCEEDED(hr)) hr = MFSetAttributeRatio(input.Get(), MF_MT_FRAME_RATE, f.rate.num, f.rate.den);
       if (SUCCEEDED(hr)) hr = input->SetUINT32(MF_MT_INTERLACE_MODE, MFVideoInterlace_Progressive);
       const AVCodecParameters* delivered = device->input->delivered;
       if (SUCCEEDED(hr) && delivered->extradata_size > 0)
@@ -397,15 +371,15 @@ HRESULT EngineThread::startRecording(const Order& order) {
       constexpr UINT32 lowestBitRate = 1000;
       const bool slow = SUCCEEDED(stream.type->GetUINT32(MF_MT_AVG_BITRATE, &bitRate)) && bitRate < lowestBitRate;
       if (recording->padded || slow) {
-        hr = MFCreateMediaType(&output.p);
-        if (SUCCEEDED(hr)) hr = stream.type->CopyAllItems(output.p);
-        if (SUCCEEDED(hr)) hr = MFSetAttributeSize(output.p, MF_MT_FRAME_SIZE, width, height);
+        hr = MFCreateMediaType(output.ReleaseAndGetAddressOf());
+        if (SUCCEEDED(hr)) hr = stream.type->CopyAllItems(output.Get());
+        if (SUCCEEDED(hr)) hr = MFSetAttributeSize(output.Get(), MF_MT_FRAME_SIZE, width, height);
         if (SUCCEEDED(hr) && slow) hr = output->SetUINT32(MF_MT_AVG_BITRATE, lowestBitRate);
       }
       if (SUCCEEDED(hr)) hr = input->SetGUID(MF_MT_MAJOR_TYPE, MFMediaType_Video);
       if (SUCCEEDED(hr)) hr = input->SetGUID(MF_MT_SUBTYPE, MFVideoFormat_RGB32);
-      if (SUCCEEDED(hr)) hr = MFSetAttributeSize(input.p, MF_MT_FRAME_SIZE, width, height);
-      if (SUCCEEDED(hr)) hr = MFSetAttributeRatio(input.p, MF_MT_FRAME_RATE, f.rate.num, f.rate.den);
+      if (SUCCEEDED(hr)) hr = MFSetAttributeSize(input.Get(), MF_MT_FRAME_SIZE, width, height);
+      if (SUCCEEDED(hr)) hr = MFSetAttributeRatio(input.Get(), MF_MT_FRAME_RATE, f.rate.num, f.rate.den);
       if (SUCCEEDED(hr)) hr = input->SetUINT32(MF_MT_DEFAULT_STRIDE, static_cast<UINT32>(width * 4));
       if (SUCCEEDED(hr)) hr = input->SetUINT32(MF_MT_INTERLACE_MODE, MFVideoInterlace_Progressive);
     } else {
@@ -424,8 +398,8 @@ HRESULT EngineThread::startRecording(const Order& order) {
       if (SUCCEEDED(hr)) hr = input->SetUINT32(MF_MT_AUDIO_BLOCK_ALIGNMENT, 2 * channels);
       if (SUCCEEDED(hr)) hr = input->SetUINT32(MF_MT_AUDIO_AVG_BYTES_PER_SECOND, 2 * channels * rate);
     }
-    if (SUCCEEDED(hr)) hr = recording->writer->AddStream(output.p, &index);
-    if (SUCCEEDED(hr)) hr = recording->writer->SetInputMediaType(index, input.p, nullptr);
+    if (SUCCEEDED(hr)) hr = recording->writer->AddStream(output.Get(), &index);
+    if (SUCCEEDED(hr)) hr = recording->writer->SetInputMediaType(index, input.Get(), nullptr);
     if (FAILED(hr)) break;
     if (stream.video) {
       recording->videoStream = index;
@@ -564,14 +538,14 @@ IMFMediaBuffer* EngineThread::pictureBuffer(DWORD length) {
   for (auto& buffer : pictures_) {
     buffer->AddRef();
     DWORD room = 0;
-    if (buffer->Release() == 1 && SUCCEEDED(buffer->GetMaxLength(&room)) && room >= length) return buffer.p;
+    if (buffer->Release() == 1 && SUCCEEDED(buffer->GetMaxLength(&room)) && room >= length) return buffer.Get();
   }
   ComPtr<IMFMediaBuffer> made;
-  if (FAILED(MFCreateMemoryBuffer(length, &made.p))) return nullptr;
+  if (FAILED(MFCreateMemoryBuffer(length, made.GetAddressOf()))) return nullptr;
   // A clip holds a picture until the next, the engine the current one, a preview one more.
   if (pictures_.size() < 4) pictures_.push_back(made);
   else pictures_[pictures_.size() - 1] = made;
-  return made.p;
+  return made.Get();
 }
 
 // Pictures go to the preview and into the clips at the size the device was found with: a device
@@ -601,7 +575,7 @@ void EngineThread::deliverVideo(AVFrame* frame, int64_t pts, AVRational timeBase
     uint8_t* planes[1] = {data};
     int strides[1] = {width * 4};
     sws_scale(previewScaler_, picture->data, picture->linesize, 0, frame->height, planes, strides);
-  }, &sample.p);
+  }, sample.GetAddressOf());
   if (FAILED(hr)) return;
   lastPicture_ = sample;
   lastPictureTime_ = time;
@@ -616,8 +590,8 @@ void EngineThread::deliverVideo(AVFrame* frame, int64_t pts, AVRational timeBase
       if (stream.video && stream.callback) callbacks.push_back(stream.callback);
   }
   if (previewing)
-    for (auto& callback : callbacks) callback->OnSample(sample.p);
-  for (Recording* recording : recordings()) recordPicture(*recording, sample.p, time, readAt);
+    for (auto& callback : callbacks) callback->OnSample(sample.Get());
+  for (Recording* recording : recordings()) recordPicture(*recording, sample.Get(), time, readAt);
 }
 
 // Where a picture goes in its clip: its device time, which is steadier than the moments reads
@@ -635,12 +609,12 @@ void EngineThread::recordPicture(Recording& recording, IMFSample* picture, LONGL
   if (!recording.hasVideo || recording.videoPassthrough || recording.videoDone || FAILED(recording.failure)) return;
   if (recording.stopAt && readAt >= recording.stopAt) {
     // A clip stopped before the device's first picture came shows that picture all along.
-    if (!recording.held) recording.held = ComPtr<IMFSample>(picture, true);
+    if (!recording.held) recording.held = ComPtr<IMFSample>(picture);
     recording.videoDone = true;
     return;
   }
   if (!recording.held || readAt < recording.startAt) {
-    recording.held = ComPtr<IMFSample>(picture, true);
+    recording.held = ComPtr<IMFSample>(picture);
     recording.heldTime = 0;
     recording.firstDeviceTime = deviceTime;
     recording.firstReadAt = readAt;
@@ -649,7 +623,7 @@ void EngineThread::recordPicture(Recording& recording, IMFSample* picture, LONGL
   LONGLONG time = clipTime(recording, deviceTime, readAt);
   if (time <= recording.heldTime) time = recording.heldTime + recording.frameDuration;  // the device's clock jumped back
   writeHeld(recording, time - recording.heldTime);
-  recording.held = ComPtr<IMFSample>(picture, true);
+  recording.held = ComPtr<IMFSample>(picture);
   recording.heldTime = time;
 }
 
@@ -663,18 +637,18 @@ void EngineThread::writeHeld(Recording& recording, LONGLONG duration) {
     const int height = evenpicture::evenSize(recording.height);
     ComPtr<IMFMediaBuffer> source;
     BYTE* data = nullptr;
-    if (FAILED(sample->GetBufferByIndex(0, &source.p)) || FAILED(source->Lock(&data, nullptr, nullptr))) return;
+    if (FAILED(sample->GetBufferByIndex(0, source.GetAddressOf())) || FAILED(source->Lock(&data, nullptr, nullptr))) return;
     ComPtr<IMFSample> copy;
     const HRESULT hr = makeSample(static_cast<DWORD>(width * height * 4), 0, 0, [&](BYTE* to) {
       evenpicture::pad(data, recording.width, recording.height, to);
-    }, &copy.p);
+    }, copy.GetAddressOf());
     source->Unlock();
     if (FAILED(hr)) return;
     sample = copy;
   }
   sample->SetSampleTime(recording.heldTime);
   sample->SetSampleDuration(duration);
-  write(recording, recording.videoStream, sample.p);
+  write(recording, recording.videoStream, sample.Get());
 }
 
 void EngineThread::deliverAudio(AVFrame* frame, int64_t pts, AVRational timeBase) {
@@ -703,8 +677,8 @@ void EngineThread::deliverAudio(AVFrame* frame, int64_t pts, AVRational timeBase
     if (previewing && !callbacks.empty()) {
       ComPtr<IMFSample> sample;
       if (SUCCEEDED(makeSample(length, av_rescale_q(pts, timeBase, AVRational{1, static_cast<int>(ticksPerSecond)}), duration,
-                               [&](BYTE* data) { std::memcpy(data, frame->data[0], length); }, &sample.p)))
-        for (auto& callback : callbacks) callback->OnSample(sample.p);
+                               [&](BYTE* data) { std::memcpy(data, frame->data[0], length); }, sample.GetAddressOf())))
+        for (auto& callback : callbacks) callback->OnSample(sample.Get());
     }
   }
 }
@@ -770,8 +744,8 @@ void EngineThread::writeSound(Recording& recording, const uint8_t* data, int sam
   const LONGLONG span = av_rescale(samples, ticksPerSecond, recording.audioRate);
   recording.audioSamples += samples;
   ComPtr<IMFSample> sample;
-  if (SUCCEEDED(makeSample(bytes, time, span, [&](BYTE* to) { std::memcpy(to, data, bytes); }, &sample.p)))
-    write(recording, recording.audioStream, sample.p);
+  if (SUCCEEDED(makeSample(bytes, time, span, [&](BYTE* to) { std::memcpy(to, data, bytes); }, sample.GetAddressOf())))
+    write(recording, recording.audioStream, sample.Get());
 }
 
 // Writes a packet of an H.264 device into a passthrough clip as it came. The clip starts at 0
@@ -794,7 +768,7 @@ void EngineThread::passThrough(Recording& recording, const AVPacket* packet, AVR
 
   const DWORD length = static_cast<DWORD>(packet->size);
   ComPtr<IMFSample> sample;
-  HRESULT hr = makeSample(length, 0, duration, [&](BYTE* data) { std::memcpy(data, packet->data, length); }, &sample.p);
+  HRESULT hr = makeSample(length, 0, duration, [&](BYTE* data) { std::memcpy(data, packet->data, length); }, sample.GetAddressOf());
   if (SUCCEEDED(hr) && key) hr = sample->SetUINT32(MFSampleExtension_CleanPoint, TRUE);
   if (FAILED(hr)) return;
   if (!started) {
@@ -1006,7 +980,7 @@ HRESULT addSinkStream(EngineState& state, std::vector<SinkStream>& streams, DWOR
   SinkStream stream;
   stream.source = source;
   stream.video = device->video;
-  stream.type = ComPtr<IMFMediaType>(type, true);
+  stream.type = ComPtr<IMFMediaType>(type);
   streams.push_back(stream);
   if (index) *index = static_cast<DWORD>(streams.size() - 1);
   return S_OK;
@@ -1053,7 +1027,7 @@ class PreviewSink : public Sink<IMFCapturePreviewSink, IID_IMFCapturePreviewSink
   HRESULT SetSampleCallback(DWORD index, IMFCaptureEngineOnSampleCallback* callback) override {
     std::lock_guard<std::mutex> lock(state_->mutex);
     if (index >= streams().size()) return MF_E_INVALIDSTREAMNUMBER;
-    streams()[index].callback = ComPtr<IMFCaptureEngineOnSampleCallback>(callback, true);
+    streams()[index].callback = ComPtr<IMFCaptureEngineOnSampleCallback>(callback);
     return S_OK;
   }
 };
@@ -1112,7 +1086,7 @@ class CaptureEngine : public ComObject<IMFCaptureEngine, IID_IMFCaptureEngine> {
       state_->audio = deviceFrom(audio, false);
       if (!state_->audio) return E_INVALIDARG;
     }
-    state_->events = ComPtr<IMFCaptureEngineOnEventCallback>(callback, true);
+    state_->events = ComPtr<IMFCaptureEngineOnEventCallback>(callback);
     avdevice_register_all();
     auto state = state_;
     thread_ = std::thread([state] {
@@ -1130,11 +1104,11 @@ class CaptureEngine : public ComObject<IMFCaptureEngine, IID_IMFCaptureEngine> {
     *sink = nullptr;
     if (!thread_.joinable()) return MF_E_NOT_INITIALIZED;
     if (type == MF_CAPTURE_ENGINE_SINK_TYPE_PREVIEW) {
-      if (!preview_) preview_ = ComPtr<IMFCapturePreviewSink>(new PreviewSink(state_), false);
-      *sink = preview_.p;
+      if (!preview_) preview_.Attach(new PreviewSink(state_));
+      *sink = preview_.Get();
     } else if (type == MF_CAPTURE_ENGINE_SINK_TYPE_RECORD) {
-      if (!record_) record_ = ComPtr<IMFCaptureRecordSink>(new RecordSink(state_), false);
-      *sink = record_.p;
+      if (!record_) record_.Attach(new RecordSink(state_));
+      *sink = record_.Get();
     } else {
       return E_NOTIMPL;
     }
@@ -1179,10 +1153,7 @@ class CaptureEngineClassFactory : public ComObject<IMFCaptureEngineClassFactory,
     if (!object) return E_POINTER;
     *object = nullptr;
     if (clsid != CLSID_MFCaptureEngine) return CLASS_E_CLASSNOTAVAILABLE;
-    auto* engine = new CaptureEngine;
-    HRESULT hr = engine->QueryInterface(riid, object);
-    engine->Release();
-    return hr;
+    return createInstance<CaptureEngine>(riid, object);
   }
 };
 
@@ -1190,10 +1161,7 @@ class CaptureEngineClassFactory : public ComObject<IMFCaptureEngineClassFactory,
 
 HRESULT createCaptureEngineClassFactory(REFIID riid, void** object) {
   if (!object) return E_POINTER;
-  auto* factory = new CaptureEngineClassFactory;
-  HRESULT hr = factory->QueryInterface(riid, object);
-  factory->Release();
-  return hr;
+  return createInstance<CaptureEngineClassFactory>(riid, object);
 }
 
 }  // namespace platform

@@ -10,20 +10,17 @@ class DXGIDeviceManager : public ComObject<IMFDXGIDeviceManager, IID_IMFDXGIDevi
   // Any token works as long as ResetDevice gets the same one back.
   DXGIDeviceManager() : token_(static_cast<UINT>(reinterpret_cast<uintptr_t>(this) >> 4)) {}
   UINT token() const { return token_; }
-  ~DXGIDeviceManager() override { release(device_); }
 
   HRESULT ResetDevice(IUnknown* device, UINT token) override {
     if (!device) return E_INVALIDARG;
     if (token != token_) return E_INVALIDARG;
-    device->AddRef();
-    release(device_);
     device_ = device;
     return S_OK;
   }
 
  private:
   UINT token_;
-  IUnknown* device_ = nullptr;
+  ComPtr<IUnknown> device_;
 };
 
 }  // namespace

@@ -29,16 +29,16 @@ void release(KernelObject* object) {
 
 // A reference to the object behind a handle for the length of one call.
 template <class T>
-class Held {
+class HandleRef {
  public:
-  explicit Held(T* object) : object_(object) {
+  explicit HandleRef(T* object) : object_(object) {
     if (object_) object_->references.fetch_add(1, std::memory_order_relaxed);
   }
-  ~Held() {
+  ~HandleRef() {
     if (object_) release(object_);
   }
-  Held(const Held&) = delete;
-  Held& operator=(const Held&) = delete;
+  HandleRef(const HandleRef&) = delete;
+  HandleRef& operator=(const HandleRef&) = delete;
   T* operator->() const { return object_; }
   explicit operator bool() const { return object_ != nullptr; }
 
@@ -91,7 +91,7 @@ HANDLE CreateEventA(LPSECURITY_ATTRIBUTES, BOOL manualReset, BOOL initialState, 
 }
 
 BOOL SetEvent(HANDLE handle) {
-  Held<Event> event(as<Event>(handle));
+  HandleRef<Event> event(as<Event>(handle));
   if (!event) {
     SetLastError(ERROR_INVALID_HANDLE);
     return FALSE;
@@ -108,7 +108,7 @@ BOOL SetEvent(HANDLE handle) {
 }
 
 BOOL ResetEvent(HANDLE handle) {
-  Held<Event> event(as<Event>(handle));
+  HandleRef<Event> event(as<Event>(handle));
   if (!event) {
     SetLastError(ERROR_INVALID_HANDLE);
     return FALSE;
@@ -119,7 +119,7 @@ BOOL ResetEvent(HANDLE handle) {
 }
 
 DWORD WaitForSingleObject(HANDLE handle, DWORD milliseconds) {
-  Held<Event> event(as<Event>(handle));
+  HandleRef<Event> event(as<Event>(handle));
   if (!event) {
     SetLastError(ERROR_INVALID_HANDLE);
     return WAIT_FAILED;

@@ -805,8 +805,8 @@ class AudioEncoder : public StreamEncoder {
 // ---- the writer ----
 
 struct StreamSlot {
-  IMFMediaType* output = nullptr;
-  IMFMediaType* input = nullptr;
+  ComPtr<IMFMediaType> output;
+  ComPtr<IMFMediaType> input;
   AVStream* stream = nullptr;
   std::unique_ptr<StreamEncoder> encoder;
   MF_SINK_WRITER_STATISTICS statistics{};
@@ -831,11 +831,7 @@ class SinkWriter : public ComObject<IMFSinkWriter, IID_IMFSinkWriter> {
       : format_(format), file_(std::move(file)), hardware_(hardware), fragmented_(fragmented) {}
 
   ~SinkWriter() override {
-    for (StreamSlot& slot : streams_) {
-      slot.encoder.reset();
-      release(slot.output);
-      release(slot.input);
-    }
+    for (StreamSlot& slot : streams_) slot.encoder.reset();  // before the muxer they write into
     if (format_) {
       format_->pb = nullptr;  // the file's own; an unfinished file stays as it is, as when Windows drops a writer
       avformat_free_context(format_);
@@ -857,7 +853,6 @@ class SinkWriter : public ComObject<IMFSinkWriter, IID_IMFSinkWriter> {
     if (!stream) return E_OUTOFMEMORY;
     StreamSlot slot;
     slot.output = target;
-    target->AddRef();
     slot.stream = stream;
     streams_.push_back(std::move(slot));
     *streamIndex = static_cast<DWORD>(streams_.size() - 1);
@@ -870,28 +865,26 @@ class SinkWriter : public ComObject<IMFSinkWriter, IID_IMFSinkWriter> {
     if (streamIndex >= streams_.size()) return MF_E_INVALIDSTREAMNUMBER;
     if (state_ != State::configuring) return MF_E_INVALIDREQUEST;
     StreamSlot& slot = streams_[streamIndex];
-    const GUID outMajor = getGuid(slot.output, MF_MT_MAJOR_TYPE);
+    const GUID outMajor = getGuid(slot.output.Get(), MF_MT_MAJOR_TYPE);
     if (getGuid(input, MF_MT_MAJOR_TYPE) != outMajor) return MF_E_INVALIDMEDIATYPE;
     HRESULT hr;
     std::unique_ptr<StreamEncoder> encoder;
     if (outMajor == MFMediaType_Video && getGuid(input, MF_MT_SUBTYPE) == MFVideoFormat_H264) {
       auto copy = std::make_unique<VideoCopy>(format_, slot.stream, file_.get());
-      hr = copy->open(slot.output, input);
+      hr = copy->open(slot.output.Get(), input);
       encoder = std::move(copy);
     } else if (outMajor == MFMediaType_Video) {
       auto video = std::make_unique<VideoEncoder>(format_, slot.stream, file_.get());
-      hr = video->open(slot.output, input, hardware_);
+      hr = video->open(slot.output.Get(), input, hardware_);
       encoder = std::move(video);
     } else {
       auto audio = std::make_unique<AudioEncoder>(format_, slot.stream, file_.get());
-      hr = audio->open(slot.output, input);
+      hr = audio->open(slot.output.Get(), input);
       encoder = std::move(audio);
     }
     if (FAILED(hr)) return hr;
     slot.encoder = std::move(encoder);
-    release(slot.input);
     slot.input = input;
-    input->AddRef();
     return S_OK;
   }
 
@@ -926,27 +919,21 @@ class SinkWriter : public ComObject<IMFSinkWriter, IID_IMFSinkWriter> {
     LONGLONG time = 0, duration = 0;
     const bool hasTime = SUCCEEDED(sample->GetSampleTime(&time));
     const bool hasDuration = SUCCEEDED(sample->GetSampleDuration(&duration));
-    IMFMediaBuffer* buffer = nullptr;
+    ComPtr<IMFMediaBuffer> buffer;
     HRESULT hr;
     DWORD count = 0;
     sample->GetBufferCount(&count);
     BYTE* data = nullptr;
     DWORD length = 0;
     if (count > 0) {
-      hr = sample->ConvertToContiguousBuffer(&buffer);
+      hr = sample->ConvertToContiguousBuffer(buffer.GetAddressOf());
       if (FAILED(hr)) return hr;
       hr = buffer->Lock(&data, nullptr, &length);
-      if (FAILED(hr)) {
-        buffer->Release();
-        return hr;
-      }
+      if (FAILED(hr)) return hr;
     }
     hr = slot.encoder->write(data, length, time, hasTime, duration, hasDuration,
                              get32(sample, MFSampleExtension_CleanPoint, FALSE) != FALSE);
-    if (buffer) {
-      buffer->Unlock();
-      buffer->Release();
-    }
+    if (buffer) buffer->Unlock();
     MF_SINK_WRITER_STATISTICS& s = slot.statistics;
     ++s.qwNumSamplesReceived;
     if (hasTime) s.llLastTimestampReceived = s.llLastTimestampEncoded = s.llLastTimestampProcessed = time;

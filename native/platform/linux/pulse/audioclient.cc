@@ -416,10 +416,7 @@ HRESULT createAudioClient(std::shared_ptr<Connection> connection, const std::str
                           void** object) {
   pulse::Sink info;
   if (!connection->findSink(sink, info)) return AUDCLNT_E_DEVICE_INVALIDATED;
-  auto* client = new AudioClient(std::move(connection), info);
-  HRESULT hr = client->QueryInterface(riid, object);
-  client->Release();
-  return hr;
+  return createInstance<AudioClient>(riid, object, std::move(connection), info);
 }
 
 }  // namespace platform::wasapi

@@ -138,9 +138,7 @@ class Enumerator : public ComObject<IMMDeviceEnumerator, IID_IMMDeviceEnumerator
 }  // namespace
 
 HRESULT createDeviceEnumerator(REFIID riid, void** object) {
-  ComPtr<Enumerator> enumerator;
-  enumerator.Attach(new Enumerator());
-  return enumerator->QueryInterface(riid, object);
+  return createInstance<Enumerator>(riid, object);
 }
 
 }  // namespace platform::wasapi

@@ -62,9 +62,9 @@ HRESULT Context::Map(ID3D11Resource* resource, UINT subresource, D3D11_MAP mapTy
   return S_OK;
 }
 
-Device::Device(D3D_FEATURE_LEVEL level) : level_(level), context_(new Context()) {}
+Device::Device(D3D_FEATURE_LEVEL level) : level_(level) { context_.Attach(new Context()); }
 
-Device::~Device() { context_->Release(); }
+Device::~Device() = default;
 
 ULONG Device::Release() {
   ULONG left = --references_;
@@ -109,8 +109,8 @@ HRESULT Device::CreateTexture2D(const D3D11_TEXTURE2D_DESC* desc, const D3D11_SU
 }
 
 void Device::GetImmediateContext(ID3D11DeviceContext** context) {
-  context_->AddRef();
-  *context = context_;
+  *context = context_.Get();
+  context_->AddRef();  // the caller's reference
 }
 
 }  // namespace platform::d3d11
@@ -132,13 +132,10 @@ HRESULT D3D11CreateDevice(IDXGIAdapter* adapter, D3D_DRIVER_TYPE driverType, HMO
     if (i == featureLevelCount) return E_INVALIDARG;
     level = featureLevels[i];
   }
-  auto* created = new platform::d3d11::Device(level);
+  ComPtr<platform::d3d11::Device> created;
+  created.Attach(new platform::d3d11::Device(level));
   if (featureLevel) *featureLevel = level;
   if (immediateContext) created->GetImmediateContext(immediateContext);
-  if (device) {
-    *device = created;
-  } else {
-    created->Release();
-  }
+  if (device) *device = created.Detach();
   return S_OK;
 }

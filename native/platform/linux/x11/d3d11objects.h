@@ -73,7 +73,7 @@ class Device : public ID3D11Device, public ID3D10Multithread {
   ~Device() override;
   std::atomic<ULONG> references_{1};
   D3D_FEATURE_LEVEL level_;
-  Context* context_;
+  ComPtr<Context> context_;
   std::atomic<bool> protected_{false};
 };
 

@@ -32,10 +32,7 @@ int64_t ticks() {
 class DesktopTexture : public d3d11::Texture {
  public:
   DesktopTexture(const D3D11_TEXTURE2D_DESC& desc, Duplication* duplication)
-      : Texture(desc), duplication_(duplication) {
-    duplication_->AddRef();
-  }
-  ~DesktopTexture() override { duplication_->Release(); }
+      : Texture(desc), duplication_(duplication) {}
   HRESULT QueryInterface(REFIID riid, void** object) override {
     if (riid == IID_IDXGIResource || riid == IID_IDXGIObject) {
       AddRef();
@@ -59,7 +56,7 @@ class DesktopTexture : public d3d11::Texture {
     ULONG Release() override { return owner->Release(); }
     DesktopTexture* owner;
   };
-  Duplication* duplication_;
+  ComPtr<Duplication> duplication_;  // the frame keeps its duplication alive
   Resource resource_{this};
 };
 
@@ -121,12 +118,10 @@ HRESULT Duplication::open(const std::string& display, int screen, xcb_atom_t nam
       free(reply);
     }
   }
-  auto* duplication = new Duplication(std::move(connection), screen, name);
-  if (!duplication->setUp()) {
-    duplication->Release();
-    return DXGI_ERROR_UNSUPPORTED;
-  }
-  *result = duplication;
+  ComPtr<Duplication> duplication;
+  duplication.Attach(new Duplication(std::move(connection), screen, name));
+  if (!duplication->setUp()) return DXGI_ERROR_UNSUPPORTED;
+  *result = duplication.Detach();
   return S_OK;
 }
 
@@ -422,9 +417,9 @@ HRESULT Duplication::AcquireNextFrame(UINT timeoutMilliseconds, DXGI_OUTDUPL_FRA
   desc.Format = DXGI_FORMAT_B8G8R8A8_UNORM;
   desc.SampleDesc.Count = 1;
   desc.Usage = D3D11_USAGE_DEFAULT;
-  auto* texture = new DesktopTexture(desc, this);
+  ComPtr<DesktopTexture> texture;
+  texture.Attach(new DesktopTexture(desc, this));
   *desktopResource = texture->resource();
-  texture->Release();
   return S_OK;
 }
 

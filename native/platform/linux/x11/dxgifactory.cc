@@ -103,7 +103,5 @@ class Factory : public platform::ComObject<IDXGIFactory1, IID_IDXGIObject, IID_I
 HRESULT CreateDXGIFactory1(REFIID riid, void** factory) {
   if (!factory) return E_INVALIDARG;
   *factory = nullptr;
-  ComPtr<platform::dxgi::Factory> created;
-  created.Attach(new platform::dxgi::Factory());
-  return created->QueryInterface(riid, factory);
+  return platform::createInstance<platform::dxgi::Factory>(riid, factory);
 }
