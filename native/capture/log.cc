@@ -31,7 +31,7 @@ void waitForEnter() {
   std::cin.ignore(std::numeric_limits<std::streamsize>::max(), '\n');
 }
 
-std::string tempFileName(int32_t index, std::string suffix) {
+std::string tempFileName(int32_t index, const std::string& suffix) {
   std::ostringstream name;
   name << "temp-" << std::setfill('0') << std::setw(4) << index << suffix;
   return name.str();

@@ -13,6 +13,6 @@ void logTesting(const char* text);
 // Prompts "Press ENTER to continue... " and discards standard input up to the next newline.
 void waitForEnter();
 // "temp-" + index padded with zeros to four digits + suffix.
-std::string tempFileName(int32_t index, std::string suffix);
+std::string tempFileName(int32_t index, const std::string& suffix);
 
 }  // namespace capture

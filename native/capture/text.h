@@ -5,7 +5,7 @@
 
 namespace capture {
 
-std::string toUtf8(std::wstring text);
-std::wstring toWide(std::string text);
+std::string toUtf8(const std::wstring& text);
+std::wstring toWide(const std::string& text);
 
 }  // namespace capture

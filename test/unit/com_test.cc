@@ -76,7 +76,7 @@ TEST(ComPtr, HoldsExactlyOneReferenceEach) {
     EXPECT_EQ(object->AddRef(), 4u);
     EXPECT_EQ(object->Release(), 3u);
     ComPtr<ITest> moved = std::move(copy);
-    EXPECT_FALSE(copy);
+    EXPECT_FALSE(copy);  // NOLINT(bugprone-use-after-move): a moved-from holder is empty
     EXPECT_EQ(moved.Get(), first.Get());
     moved = moved;  // NOLINT: assigning a holder to itself keeps the reference
     EXPECT_EQ(object->AddRef(), 4u);

@@ -63,7 +63,7 @@ TEST(PointerComposition, MonochromeMasksKeepBlackenInvertAndWhiten) {
   p.position = {0, 0};
   p.shapeInfo = {DXGI_OUTDUPL_POINTER_SHAPE_TYPE_MONOCHROME, 32, 64, 4, {0, 0}};
   p.shapeBufferSize = 64 * 4;
-  p.shapeBuffer.reset(new uint8_t[p.shapeBufferSize]());
+  p.shapeBuffer = std::make_unique<uint8_t[]>(p.shapeBufferSize);
   // Columns 0-7: AND 1, XOR 0; 8-15: AND 0, XOR 0; 16-23: AND 1, XOR 1; 24-31: AND 0, XOR 1.
   for (int row = 0; row < 32; ++row) {
     uint8_t* andRow = &p.shapeBuffer[row * 4];

@@ -33,7 +33,7 @@ class Events : public platform::ComObject<IMFCaptureEngineOnEventCallback, IID_I
     event->GetExtendedType(&type);
     event->GetStatus(&status);
     std::lock_guard<std::mutex> lock(mutex_);
-    seen_.push_back({type, status});
+    seen_.emplace_back(type, status);
     changed_.notify_all();
     return S_OK;
   }

@@ -61,7 +61,7 @@ void sleepUntil(int64_t ms) {
 
 // A recording on its own thread, as a display's recording thread runs it.
 struct Recording {
-  Recording(FrameQueue& queue, std::shared_ptr<Clip> clip) : clip(clip) {
+  Recording(FrameQueue& queue, const std::shared_ptr<Clip>& clip) : clip(clip) {
     done = std::async(std::launch::async, [&queue, clip]() -> std::string {
       MFTEncoder encoder(clip);
       try {

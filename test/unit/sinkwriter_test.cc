@@ -783,12 +783,12 @@ TEST(Samples, BuffersTimesAndContiguousCopies) {
   EXPECT_EQ(max, 4u);
   EXPECT_EQ(current, 0u);
   EXPECT_EQ(reinterpret_cast<uintptr_t>(data) % 16, 0u);
-  std::memcpy(data, "abcd", 4);
+  std::memcpy(data, "abcd", 4);  // NOLINT(bugprone-not-null-terminated-result): bytes, not text
   a->Unlock();
   EXPECT_EQ(a->SetCurrentLength(5), E_INVALIDARG);
   a->SetCurrentLength(4);
   b->Lock(&data, nullptr, nullptr);
-  std::memcpy(data, "ef", 2);
+  std::memcpy(data, "ef", 2);  // NOLINT(bugprone-not-null-terminated-result): bytes, not text
   b->Unlock();
   b->SetCurrentLength(2);
 

@@ -18,7 +18,7 @@ const char* const file = "native/capture/audio/mfencoder";
 
 // A failure leaves Media Foundation started, as the caller expects; the objects made so far
 // are released on the way out, which nothing can observe but the memory.
-MFEncoder::MFEncoder(std::string path, const WAVEFORMATEXTENSIBLE* format) : format(format) {
+MFEncoder::MFEncoder(const std::string& path, const WAVEFORMATEXTENSIBLE* format) : format(format) {
   try {
     checkResult(file, 22, MFStartup(MF_VERSION, MFSTARTUP_FULL), "Unable to start media foundation.");
 

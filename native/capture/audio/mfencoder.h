@@ -15,7 +15,7 @@ class MFEncoder : public virtual Encoder {
  public:
   // Starts Media Foundation, creates the file at path (UTF-8) and begins writing. format is the
   // source's capture format and must outlive the encoder. Throws on any failure.
-  MFEncoder(std::string path, const WAVEFORMATEXTENSIBLE* format);
+  MFEncoder(const std::string& path, const WAVEFORMATEXTENSIBLE* format);
   // Releases the writer without finalising the file, then shuts Media Foundation down.
   ~MFEncoder() override;
   MFEncoder(const MFEncoder&) = delete;

@@ -41,7 +41,7 @@ class ComPtr {
     return *this;
   }
   ComPtr& operator=(const ComPtr& other) noexcept {
-    ComPtr(other).Swap(*this);
+    if (this != &other) ComPtr(other).Swap(*this);
     return *this;
   }
   ComPtr& operator=(ComPtr&& other) noexcept {

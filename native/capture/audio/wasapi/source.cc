@@ -365,7 +365,7 @@ void Source::runCapture(IAudioClient*& client, IAudioCaptureClient*& packets) {
     // Silence is handed on as a block of zeros of the packet's size: it is recorded as it is.
     std::unique_ptr<BYTE[]> silent;
     if (flags & AUDCLNT_BUFFERFLAGS_SILENT) {
-      silent.reset(new BYTE[static_cast<size_t>(captureFormat->Format.nBlockAlign) * frames]());
+      silent = std::make_unique<BYTE[]>(static_cast<size_t>(captureFormat->Format.nBlockAlign) * frames);
       data = silent.get();
     }
     if (flags & (AUDCLNT_BUFFERFLAGS_DATA_DISCONTINUITY | AUDCLNT_BUFFERFLAGS_TIMESTAMP_ERROR))

@@ -11,6 +11,7 @@ extern "C" {
 }
 
 #include <algorithm>
+#include <cmath>
 #include <optional>
 
 #include "platform/linux/ffmpeg/avlog.h"
@@ -49,7 +50,7 @@ class DeviceEncoder {
     encoder_->sample_aspect_ratio = stream->codecpar->sample_aspect_ratio;
     encoder_->time_base = stream->time_base;  // the packets keep the pictures' times
     encoder_->framerate = rate;
-    encoder_->gop_size = std::max(1, static_cast<int>(av_q2d(rate) + 0.5));
+    encoder_->gop_size = std::max(1, static_cast<int>(std::lround(av_q2d(rate))));
     encoder_->max_b_frames = 0;
     encoder_->thread_count = 1;
     encoder_->flags |= AV_CODEC_FLAG_GLOBAL_HEADER;

@@ -141,7 +141,7 @@ class CaptureEngine : public ComObject<IMFCaptureEngine, IID_IMFCaptureEngine> {
     if (!thread_.joinable()) return;
     {
       std::lock_guard<std::mutex> lock(state_->mutex);
-      state_->commands.push_back(Order(Command::Quit, 0));
+      state_->commands.emplace_back(Command::Quit, 0);
     }
     state_->changed.notify_all();
     // Released from inside one of its own callbacks (an error event), the thread finishes alone.

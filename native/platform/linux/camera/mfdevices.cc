@@ -179,6 +179,7 @@ HRESULT MFEnumDeviceSources(IMFAttributes* attributes, IMFActivate*** devices, U
     if (FAILED(hr)) return hr;
     made.push_back(std::move(activate));
   }
+  // NOLINTNEXTLINE(bugprone-sizeof-expression): an array of interface pointers
   auto** array = static_cast<IMFActivate**>(CoTaskMemAlloc(sizeof(IMFActivate*) * (made.empty() ? 1 : made.size())));
   if (!array) return E_OUTOFMEMORY;
   for (size_t i = 0; i < made.size(); ++i) array[i] = made[i].Detach();

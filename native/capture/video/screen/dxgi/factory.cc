@@ -13,10 +13,11 @@ ComPtr<IDXGIFactory1> createFactory() {
 
 std::vector<ComPtr<IDXGIAdapter1>> enumerateAdapters(IDXGIFactory1* factory) {
   std::vector<ComPtr<IDXGIAdapter1>> adapters;
-  ComPtr<IDXGIAdapter1> adapter;
-  for (UINT i = 0; factory->EnumAdapters1(i, adapter.ReleaseAndGetAddressOf()) == S_OK; ++i)
+  for (UINT i = 0;; ++i) {
+    ComPtr<IDXGIAdapter1> adapter;
+    if (factory->EnumAdapters1(i, adapter.GetAddressOf()) != S_OK) return adapters;
     adapters.push_back(std::move(adapter));
-  return adapters;
+  }
 }
 
 std::vector<ComPtr<IDXGIOutput1>> enumerateOutputs(IDXGIAdapter1* adapter) {

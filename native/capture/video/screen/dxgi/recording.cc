@@ -9,7 +9,8 @@
 
 namespace capture::video::screen::dxgi {
 
-void startRecording(std::shared_ptr<capture::video::FrameQueue> queue, std::shared_ptr<capture::video::Clip> clip) {
+void startRecording(const std::shared_ptr<capture::video::FrameQueue>& queue,
+                    const std::shared_ptr<capture::video::Clip>& clip) {
   std::thread([queue, clip] {
     capture::nameThread("tavio-record");
     capture::video::encoder::MFTEncoder encoder(clip);

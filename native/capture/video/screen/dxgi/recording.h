@@ -8,6 +8,7 @@
 namespace capture::video::screen::dxgi {
 
 // Starts a detached thread that records `clip` from the queue until the clip is stopped.
-void startRecording(std::shared_ptr<capture::video::FrameQueue> queue, std::shared_ptr<capture::video::Clip> clip);
+void startRecording(const std::shared_ptr<capture::video::FrameQueue>& queue,
+                    const std::shared_ptr<capture::video::Clip>& clip);
 
 }  // namespace capture::video::screen::dxgi
