@@ -41,8 +41,8 @@ int main(int argc, char** argv) {
   std::vector<uint8_t> y(static_cast<size_t>(width) * height), u(static_cast<size_t>(cw) * ch), v(u.size());
   std::vector<uint8_t> y2(y.size()), u2(u.size()), v2(v.size());
 
-  SwsContext* context = sws_getContext(width, height, AV_PIX_FMT_BGR0, width, height, AV_PIX_FMT_YUV420P,
-                                       SWS_BILINEAR, nullptr, nullptr, nullptr);
+  SwsContext* context = sws_getContext(width, height, AV_PIX_FMT_BGR0, width, height, AV_PIX_FMT_YUV420P, SWS_BILINEAR,
+                                       nullptr, nullptr, nullptr);
   int* table = const_cast<int*>(sws_getCoefficients(SWS_CS_ITU709));
   sws_setColorspaceDetails(context, table, 1, table, 0, 0, 1 << 16, 1 << 16);
 
@@ -65,7 +65,8 @@ int main(int argc, char** argv) {
   sws_freeContext(context);
   int worst = 0;
   for (size_t i = 0; i < y.size(); ++i) worst = std::max(worst, std::abs(y[i] - y2[i]));
-  std::printf("%dx%d, %d rounds: ours median %.3f ms, swscale median %.3f ms, ratio %.2f (largest luma difference %d)\n",
-              width, height, rounds, median(ours), median(theirs), median(ours) / median(theirs), worst);
+  std::printf(
+      "%dx%d, %d rounds: ours median %.3f ms, swscale median %.3f ms, ratio %.2f (largest luma difference %d)\n", width,
+      height, rounds, median(ours), median(theirs), median(ours) / median(theirs), worst);
   return 0;
 }

@@ -9,7 +9,6 @@
 
 #include "capture/video/scale.h"
 
-
 namespace {
 
 void perPixel(const uint8_t* src, uint64_t sw, uint64_t sh, uint8_t* dst, uint64_t dw, uint64_t dh) {

@@ -6,14 +6,10 @@ namespace capture {
 
 const char* typeName(int32_t type) {
   switch (type) {
-    case Screen:
-      return "dxgi";
-    case CameraVideo:
-      return "mfce_video";
-    case CameraMicrophone:
-      return "mfce_audio";
-    default:
-      return "wasapi";
+    case Screen: return "dxgi";
+    case CameraVideo: return "mfce_video";
+    case CameraMicrophone: return "mfce_audio";
+    default: return "wasapi";
   }
 }
 

@@ -150,11 +150,11 @@ NAN_METHOD(getPreview) {
     const int32_t height = intArgument(info, 2);
     if (width < 0 || height < 0) throw std::invalid_argument("preview size must not be negative");
     auto& video = dynamic_cast<capture::video::Source&>(*capture::at(sources, static_cast<size_t>(uid)));
-    const uint64_t bytes = static_cast<uint64_t>(video.pixelWidth()) * static_cast<uint64_t>(height) * static_cast<uint64_t>(width);
+    const uint64_t bytes =
+        static_cast<uint64_t>(video.pixelWidth()) * static_cast<uint64_t>(height) * static_cast<uint64_t>(width);
     // The scaler addresses the picture with 32-bit signed offsets, and a typed array holds at
     // most kMaxLength bytes: anything larger would be written out of bounds.
-    constexpr uint64_t largest =
-        std::min<uint64_t>(std::numeric_limits<int32_t>::max(), v8::TypedArray::kMaxLength);
+    constexpr uint64_t largest = std::min<uint64_t>(std::numeric_limits<int32_t>::max(), v8::TypedArray::kMaxLength);
     if (bytes > largest) {
       const std::string text = "getPreview: a preview of " + std::to_string(width) + "x" + std::to_string(height) +
                                " pixels is larger than " + std::to_string(largest) + " bytes.";

@@ -53,7 +53,7 @@ struct Stream {
   int channels = 0;
   double duration = 0;  // seconds, from the stream
   std::vector<Packet> packets;
-  int64_t bytes = 0;    // sum of packet sizes
+  int64_t bytes = 0;  // sum of packet sizes
 };
 
 struct File {
@@ -157,9 +157,9 @@ inline Decoded decode(const std::string& path, AVMediaType kind) {
         out.width = frame->width;
         out.height = frame->height;
         out.lastPicture.resize(static_cast<size_t>(frame->width) * frame->height * 4);
-        SwsContext* sws = sws_getContext(frame->width, frame->height, static_cast<AVPixelFormat>(frame->format),
-                                         frame->width, frame->height, AV_PIX_FMT_BGRA, SWS_POINT, nullptr, nullptr,
-                                         nullptr);
+        SwsContext* sws =
+            sws_getContext(frame->width, frame->height, static_cast<AVPixelFormat>(frame->format), frame->width,
+                           frame->height, AV_PIX_FMT_BGRA, SWS_POINT, nullptr, nullptr, nullptr);
         uint8_t* planes[1] = {out.lastPicture.data()};
         int strides[1] = {frame->width * 4};
         sws_scale(sws, frame->data, frame->linesize, 0, frame->height, planes, strides);

@@ -58,8 +58,7 @@ class FakeSink : public ComObject<IMFCaptureRecordSink, IID_IMFCaptureSink, IID_
   HRESULT SetSampleCallback(DWORD, IMFCaptureEngineOnSampleCallback*) override { return S_OK; }
 };
 
-class FakePreviewSink
-    : public ComObject<IMFCapturePreviewSink, IID_IMFCaptureSink, IID_IMFCapturePreviewSink> {
+class FakePreviewSink : public ComObject<IMFCapturePreviewSink, IID_IMFCaptureSink, IID_IMFCapturePreviewSink> {
  public:
   ~FakePreviewSink() override {
     for (IMFMediaType* type : added) type->Release();
@@ -67,7 +66,7 @@ class FakePreviewSink
       if (callback) callback->Release();
   }
   std::vector<DWORD> sources;
-  std::vector<IMFMediaType*> added;  // one reference each
+  std::vector<IMFMediaType*> added;                          // one reference each
   std::vector<IMFCaptureEngineOnSampleCallback*> callbacks;  // by sink stream index, one reference each
 
   HRESULT GetService(DWORD, REFGUID, REFIID, IUnknown**) override { return E_NOTIMPL; }
@@ -123,7 +122,7 @@ class FakeCaptureEngine : public ComObject<IMFCaptureEngine, IID_IMFCaptureEngin
   HRESULT GetSink(MF_CAPTURE_ENGINE_SINK_TYPE type, IMFCaptureSink** result) override {
     ++getSinkCalls;
     IMFCaptureSink* chosen = type == MF_CAPTURE_ENGINE_SINK_TYPE_PREVIEW ? static_cast<IMFCaptureSink*>(preview)
-                                                                          : static_cast<IMFCaptureSink*>(sink);
+                                                                         : static_cast<IMFCaptureSink*>(sink);
     chosen->AddRef();
     *result = chosen;
     return S_OK;

@@ -93,7 +93,8 @@ class Duplication : public Counted<IDXGIOutputDuplication> {
     *out = &resource;
     return step.result;
   }
-  HRESULT GetFramePointerShape(UINT size, void* buffer, UINT* required, DXGI_OUTDUPL_POINTER_SHAPE_INFO* info) override {
+  HRESULT GetFramePointerShape(UINT size, void* buffer, UINT* required,
+                               DXGI_OUTDUPL_POINTER_SHAPE_INFO* info) override {
     ++shapeFetches;
     *required = static_cast<UINT>(shape.size());
     if (size < shape.size()) return DXGI_ERROR_MORE_DATA;

@@ -35,10 +35,12 @@ int main(int argc, char** argv) {
   pa_buffer_attr attr{static_cast<uint32_t>(-1), 48000 * 8 / 100, static_cast<uint32_t>(-1), static_cast<uint32_t>(-1),
                       static_cast<uint32_t>(-1)};  // 10 ms queued ahead
   int error = 0;
-  pa_simple* sound = pa_simple_new(nullptr, "flashbeep", PA_STREAM_PLAYBACK, nullptr, "beep", &stereoFloat, nullptr, &attr, &error);
+  pa_simple* sound =
+      pa_simple_new(nullptr, "flashbeep", PA_STREAM_PLAYBACK, nullptr, "beep", &stereoFloat, nullptr, &attr, &error);
   if (!sound) return 2;
   std::vector<float> silence(480 * 2, 0.0f), beep(9600 * 2);
-  for (size_t i = 0; i < beep.size() / 2; ++i) beep[2 * i] = beep[2 * i + 1] = 0.5f * std::sin(2 * M_PI * 1000 * i / 48000.0);
+  for (size_t i = 0; i < beep.size() / 2; ++i)
+    beep[2 * i] = beep[2 * i + 1] = 0.5f * std::sin(2 * M_PI * 1000 * i / 48000.0);
   std::puts("ready");
   std::fflush(stdout);
   const auto go = std::chrono::steady_clock::now() + std::chrono::milliseconds(delay);

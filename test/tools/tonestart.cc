@@ -32,7 +32,9 @@ void signalStream(pa_stream*, void* loop) { pa_threaded_mainloop_signal(static_c
 void signalRequest(pa_stream*, size_t, void* loop) {
   pa_threaded_mainloop_signal(static_cast<pa_threaded_mainloop*>(loop), 0);
 }
-void signalDone(pa_stream*, int, void* loop) { pa_threaded_mainloop_signal(static_cast<pa_threaded_mainloop*>(loop), 0); }
+void signalDone(pa_stream*, int, void* loop) {
+  pa_threaded_mainloop_signal(static_cast<pa_threaded_mainloop*>(loop), 0);
+}
 
 [[noreturn]] void fail(const char* what) {
   std::fprintf(stderr, "tonestart: %s\n", what);
@@ -70,8 +72,8 @@ int main(int argc, char** argv) {
   attr.prebuf = static_cast<uint32_t>(-1);
   attr.minreq = static_cast<uint32_t>(-1);
   attr.fragsize = static_cast<uint32_t>(-1);
-  const auto flags =
-      static_cast<pa_stream_flags_t>(PA_STREAM_ADJUST_LATENCY | PA_STREAM_INTERPOLATE_TIMING | PA_STREAM_AUTO_TIMING_UPDATE);
+  const auto flags = static_cast<pa_stream_flags_t>(PA_STREAM_ADJUST_LATENCY | PA_STREAM_INTERPOLATE_TIMING |
+                                                    PA_STREAM_AUTO_TIMING_UPDATE);
   if (pa_stream_connect_playback(stream, sink, &attr, flags, nullptr, nullptr) < 0) fail("cannot connect");
   while (pa_stream_get_state(stream) != PA_STREAM_READY) {
     if (!PA_STREAM_IS_GOOD(pa_stream_get_state(stream))) fail("stream failed");

@@ -37,8 +37,9 @@ TEST(FFmpegLog, ErrorsBecomeWarningLinesAndNothingReachesStandardError) {
   const std::string out = testing::internal::GetCapturedStdout();
   EXPECT_EQ(testing::internal::GetCapturedStderr(), "");
 
-  const std::string first = "\tnative/platform/linux/avlog(46): 0x80004005: FFmpeg demo: Error opening 'x' with args 'y' "
-                            "(Unspecified error)\n";
+  const std::string first =
+      "\tnative/platform/linux/avlog(46): 0x80004005: FFmpeg demo: Error opening 'x' with args 'y' "
+      "(Unspecified error)\n";
   const std::string second = "\tnative/platform/linux/avlog(46): 0x80004005: FFmpeg: fatal 3 (Unspecified error)\n";
   const size_t at = out.find(first);
   ASSERT_NE(at, std::string::npos) << out;

@@ -209,7 +209,9 @@ TEST(CameraCaptureManager, RecordsOnlyToDotMp4SpeltExactly) {
 
 // The fake engine answers each command at once, as its event handled by the manager.
 void answerThrough(mfce::CaptureManager& manager, fakes::FakeCaptureEngine* engine) {
-  engine->answer = [&manager](const GUID& type, HRESULT status) { manager.HandleEngineEvent(new FakeEvent(type, status)); };
+  engine->answer = [&manager](const GUID& type, HRESULT status) {
+    manager.HandleEngineEvent(new FakeEvent(type, status));
+  };
 }
 
 TEST(CameraCaptureManager, VideoRecordStreamAsksForH264) {
@@ -278,7 +280,9 @@ TEST(CameraCaptureManager, AudioRecordStreamIsTheFirstAacType) {
 TEST(CameraCaptureManager, EngineEventsSetFlagsAndSignalEveryTime) {
   mfce::CaptureManager manager;
   manager.engineEvent = CreateEventA(nullptr, FALSE, FALSE, nullptr);
-  auto handle = [&](const GUID& type, HRESULT status) { return manager.HandleEngineEvent(new FakeEvent(type, status)); };
+  auto handle = [&](const GUID& type, HRESULT status) {
+    return manager.HandleEngineEvent(new FakeEvent(type, status));
+  };
 
   EXPECT_EQ(S_OK, handle(MF_CAPTURE_ENGINE_INITIALIZED, MF_E_NO_CAPTURE_DEVICES_AVAILABLE));
   EXPECT_TRUE(signalled(manager.engineEvent));
@@ -350,7 +354,8 @@ TEST(CameraCaptureManager, PreviewIsConfiguredOnceAndLaterCallsKeepTheCallersSiz
   EXPECT_EQ(MFVideoFormat_ARGB32, subtype);
   EXPECT_EQ(S_OK, engine->preview->added[0]->GetUINT32(MF_MT_ALL_SAMPLES_INDEPENDENT, &independent));
   EXPECT_EQ(1u, independent);
-  EXPECT_EQ(static_cast<IMFCaptureEngineOnSampleCallback*>(manager.videoSampleCallback.Get()), engine->preview->callbacks[0]);
+  EXPECT_EQ(static_cast<IMFCaptureEngineOnSampleCallback*>(manager.videoSampleCallback.Get()),
+            engine->preview->callbacks[0]);
   const int sinkCalls = engine->getSinkCalls;
 
   // Configured: the answer is S_OK and the caller's values come back as they went in.
@@ -504,8 +509,8 @@ class CameraSource : public ::testing::Test {
 };
 
 TEST_F(CameraSource, KindNameAndAudioAnswers) {
-  IMFActivate* camera = device(MF_DEVSOURCE_ATTRIBUTE_SOURCE_TYPE_VIDCAP_GUID, L"Red Camera",
-                               L"lavfi:color=c=red:size=160x120:rate=30");
+  IMFActivate* camera =
+      device(MF_DEVSOURCE_ATTRIBUTE_SOURCE_TYPE_VIDCAP_GUID, L"Red Camera", L"lavfi:color=c=red:size=160x120:rate=30");
   {
     mfce::MFCESource source(nullptr, camera, true);
     EXPECT_EQ(3, source.type());
@@ -530,8 +535,8 @@ TEST_F(CameraSource, KindNameAndAudioAnswers) {
 }
 
 TEST_F(CameraSource, PreviewShowsTheCameraAndEncodeRepeatsAreQuiet) {
-  IMFActivate* camera = device(MF_DEVSOURCE_ATTRIBUTE_SOURCE_TYPE_VIDCAP_GUID, L"Red Camera",
-                               L"lavfi:color=c=red:size=160x120:rate=30");
+  IMFActivate* camera =
+      device(MF_DEVSOURCE_ATTRIBUTE_SOURCE_TYPE_VIDCAP_GUID, L"Red Camera", L"lavfi:color=c=red:size=160x120:rate=30");
   mfce::MFCESource source(nullptr, camera, false);
   camera->Release();
   source.stopEncode();  // nothing recording: quiet

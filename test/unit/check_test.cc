@@ -46,8 +46,9 @@ TEST(CheckResult, FailureTextHasTimeLineFileCodeMessageAndSystemText) {
   const std::string text = failureText(E_POINTER, "x");
   // asctime's form, its own newline, then a tab. std::regex, since GoogleTest's own regex on
   // Windows knows neither groups nor alternation.
-  const std::regex form("(Sun|Mon|Tue|Wed|Thu|Fri|Sat) (Jan|Feb|Mar|Apr|May|Jun|Jul|Aug|Sep|Oct|Nov|Dec) "
-                        "[ 123][0-9] [0-2][0-9]:[0-5][0-9]:[0-6][0-9] [0-9]{4}\n\t[^\n]*");
+  const std::regex form(
+      "(Sun|Mon|Tue|Wed|Thu|Fri|Sat) (Jan|Feb|Mar|Apr|May|Jun|Jul|Aug|Sep|Oct|Nov|Dec) "
+      "[ 123][0-9] [0-2][0-9]:[0-5][0-9]:[0-6][0-9] [0-9]{4}\n\t[^\n]*");
   EXPECT_TRUE(std::regex_match(text, form)) << text;
   EXPECT_THAT(text, HasSubstr("\tnative/interface(47): 0x80004003: x ("));
   if (testsupport::underWine()) GTEST_SKIP() << "Wine has no system text for E_POINTER";
@@ -82,8 +83,10 @@ TEST(SystemMessage, ComesFromTheSystemTable) {
   EXPECT_EQ(capture::systemMessage(static_cast<HRESULT>(0x88890004)), "Unknown error 0x88890004");
   if (testsupport::underWine())
     GTEST_SKIP() << "Wine has no system text for E_POINTER, RPC_E_CHANGED_MODE and REGDB_E_CLASSNOTREG, and words "
-                    "ERROR_PATH_NOT_FOUND's as \"" << capture::systemMessage(HRESULT_FROM_WIN32(ERROR_PATH_NOT_FOUND)) << '"';
-  EXPECT_EQ(capture::systemMessage(HRESULT_FROM_WIN32(ERROR_PATH_NOT_FOUND)), "The system cannot find the path specified.");
+                    "ERROR_PATH_NOT_FOUND's as \""
+                 << capture::systemMessage(HRESULT_FROM_WIN32(ERROR_PATH_NOT_FOUND)) << '"';
+  EXPECT_EQ(capture::systemMessage(HRESULT_FROM_WIN32(ERROR_PATH_NOT_FOUND)),
+            "The system cannot find the path specified.");
   EXPECT_EQ(capture::systemMessage(E_POINTER), "Invalid pointer");
   EXPECT_EQ(capture::systemMessage(RPC_E_CHANGED_MODE), "Cannot change thread mode after it is set.");
   EXPECT_EQ(capture::systemMessage(static_cast<HRESULT>(0x80040154)), "Class not registered");
@@ -91,8 +94,9 @@ TEST(SystemMessage, ComesFromTheSystemTable) {
 
 TEST(FormatMessage, AllocatesATextEndingInCarriageReturnLineFeed) {
   char* text = nullptr;
-  DWORD length = FormatMessageA(FORMAT_MESSAGE_ALLOCATE_BUFFER | FORMAT_MESSAGE_FROM_SYSTEM | FORMAT_MESSAGE_IGNORE_INSERTS,
-                                nullptr, static_cast<DWORD>(E_OUTOFMEMORY), 0, reinterpret_cast<LPSTR>(&text), 0, nullptr);
+  DWORD length =
+      FormatMessageA(FORMAT_MESSAGE_ALLOCATE_BUFFER | FORMAT_MESSAGE_FROM_SYSTEM | FORMAT_MESSAGE_IGNORE_INSERTS,
+                     nullptr, static_cast<DWORD>(E_OUTOFMEMORY), 0, reinterpret_cast<LPSTR>(&text), 0, nullptr);
   ASSERT_NE(text, nullptr);
   const std::string message = text;
   EXPECT_THAT(message, EndsWith(".\r\n"));
@@ -101,7 +105,8 @@ TEST(FormatMessage, AllocatesATextEndingInCarriageReturnLineFeed) {
   text = nullptr;
   EXPECT_EQ(FormatMessageA(0x1300, nullptr, 0x88890001, 0, reinterpret_cast<LPSTR>(&text), 0, nullptr), 0u);
   EXPECT_EQ(text, nullptr);
-  if (testsupport::underWine()) GTEST_SKIP() << "Wine words E_OUTOFMEMORY's system text as \"" << message.substr(0, message.size() - 2) << '"';
+  if (testsupport::underWine())
+    GTEST_SKIP() << "Wine words E_OUTOFMEMORY's system text as \"" << message.substr(0, message.size() - 2) << '"';
   EXPECT_EQ(message, "Not enough memory resources are available to complete this operation.\r\n");
 }
 

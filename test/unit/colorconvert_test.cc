@@ -21,16 +21,21 @@ using platform::colour::bgrxToI420;
 
 struct Planes {
   Planes(int width, int height)
-      : width(width), height(height), cw((width + 1) / 2), ch((height + 1) / 2),
-        y(static_cast<size_t>(width) * height, 0), u(static_cast<size_t>(cw) * ch, 0), v(u.size(), 0) {}
+      : width(width),
+        height(height),
+        cw((width + 1) / 2),
+        ch((height + 1) / 2),
+        y(static_cast<size_t>(width) * height, 0),
+        u(static_cast<size_t>(cw) * ch, 0),
+        v(u.size(), 0) {}
   int width, height, cw, ch;
   std::vector<uint8_t> y, u, v;
 };
 
 Planes convert(const std::vector<uint8_t>& pixels, int width, int height) {
   Planes out(width, height);
-  bgrxToI420(pixels.data(), static_cast<ptrdiff_t>(width) * 4, width, height, out.y.data(), width, out.u.data(),
-             out.cw, out.v.data(), out.cw);
+  bgrxToI420(pixels.data(), static_cast<ptrdiff_t>(width) * 4, width, height, out.y.data(), width, out.u.data(), out.cw,
+             out.v.data(), out.cw);
   return out;
 }
 
@@ -100,8 +105,8 @@ int maxDifference(const std::vector<uint8_t>& a, const std::vector<uint8_t>& b) 
   return worst;
 }
 
-const int sizes[][2] = {{1, 1}, {2, 2}, {3, 3}, {2, 1}, {1, 2}, {15, 7}, {16, 2}, {17, 5}, {31, 4},
-                        {32, 3}, {33, 9}, {48, 1}, {64, 31}, {95, 16}, {250, 17}};
+const int sizes[][2] = {{1, 1},  {2, 2},  {3, 3},  {2, 1},  {1, 2},   {15, 7},  {16, 2},  {17, 5},
+                        {31, 4}, {32, 3}, {33, 9}, {48, 1}, {64, 31}, {95, 16}, {250, 17}};
 
 TEST(ColourConversion, MatchesTheMatrixWithinOneLevelAtOddAndEvenSizes) {
   for (const auto& size : sizes) {
@@ -131,8 +136,8 @@ TEST(ColourConversion, BlackWhiteGreyAndPrimariesLandOnTheirLevels) {
   struct Case {
     uint8_t b, g, r, y, u, v;
   } cases[] = {
-      {0, 0, 0, 16, 128, 128},     {255, 255, 255, 235, 128, 128}, {128, 128, 128, 126, 128, 128},
-      {0, 0, 255, 63, 102, 240},   {0, 255, 0, 173, 42, 26},       {255, 0, 0, 32, 240, 118},
+      {0, 0, 0, 16, 128, 128},   {255, 255, 255, 235, 128, 128}, {128, 128, 128, 126, 128, 128},
+      {0, 0, 255, 63, 102, 240}, {0, 255, 0, 173, 42, 26},       {255, 0, 0, 32, 240, 118},
   };
   for (const Case& c : cases) {
     SCOPED_TRACE(testing::Message() << int(c.b) << "," << int(c.g) << "," << int(c.r));
@@ -153,8 +158,7 @@ TEST(ColourConversion, NegativeStrideReadsBottomUpRowsUpright) {
   const auto upright = noise(width, height, 7);
   std::vector<uint8_t> flipped(upright.size());
   const size_t row = static_cast<size_t>(width) * 4;
-  for (int y = 0; y < height; ++y)
-    std::copy_n(&upright[y * row], row, &flipped[(height - 1 - y) * row]);
+  for (int y = 0; y < height; ++y) std::copy_n(&upright[y * row], row, &flipped[(height - 1 - y) * row]);
   Planes got(width, height);
   bgrxToI420(flipped.data() + (height - 1) * row, -static_cast<ptrdiff_t>(row), width, height, got.y.data(), width,
              got.u.data(), got.cw, got.v.data(), got.cw);
@@ -190,8 +194,8 @@ TEST(ColourConversion, AgreesWithSwscaleWithinTwoLevelsOnAScreenPattern) {
     }
   const Planes ours = convert(pixels, width, height);
 
-  SwsContext* context = sws_getContext(width, height, AV_PIX_FMT_BGR0, width, height, AV_PIX_FMT_YUV420P,
-                                       SWS_BILINEAR, nullptr, nullptr, nullptr);
+  SwsContext* context = sws_getContext(width, height, AV_PIX_FMT_BGR0, width, height, AV_PIX_FMT_YUV420P, SWS_BILINEAR,
+                                       nullptr, nullptr, nullptr);
   ASSERT_NE(context, nullptr);
   int* table = const_cast<int*>(sws_getCoefficients(SWS_CS_ITU709));
   sws_setColorspaceDetails(context, table, 1, table, 0, 0, 1 << 16, 1 << 16);

@@ -50,7 +50,8 @@ PointerInfo colourPointer(uint32_t type, uint32_t w, uint32_t h, LONG x, LONG y,
 // Counts the pixels of a frame that differ from `background`.
 int changedPixels(const Frame& frame, Pixel background) {
   int n = 0;
-  for (uint64_t i = 0; i < frame.width * frame.height; ++i) n += std::memcmp(&frame.data[i * 4], background.data(), 4) != 0;
+  for (uint64_t i = 0; i < frame.width * frame.height; ++i)
+    n += std::memcmp(&frame.data[i * 4], background.data(), 4) != 0;
   return n;
 }
 

@@ -83,9 +83,9 @@ void writeRawStream(const std::string& path, const media::CameraStream& camera, 
 struct InitializedEngine {
   explicit InitializedEngine(const std::wstring& link) {
     IMFCaptureEngineClassFactory* factory = nullptr;
-    EXPECT_EQ(platform::createCaptureEngineClassFactory(IID_IMFCaptureEngineClassFactory,
-                                                         reinterpret_cast<void**>(&factory)),
-              S_OK);
+    EXPECT_EQ(
+        platform::createCaptureEngineClassFactory(IID_IMFCaptureEngineClassFactory, reinterpret_cast<void**>(&factory)),
+        S_OK);
     EXPECT_EQ(factory->CreateInstance(CLSID_MFCaptureEngine, IID_IMFCaptureEngine, reinterpret_cast<void**>(&engine)),
               S_OK);
     factory->Release();
@@ -123,8 +123,9 @@ void prepareRecord(IMFCaptureEngine* engine, const std::string& clip, UINT32 bit
   EXPECT_EQ(sink->QueryInterface(IID_IMFCaptureRecordSink, reinterpret_cast<void**>(&recordSink)), S_OK);
   DWORD index = 0;
   EXPECT_EQ(recordSink->RemoveAllStreams(), S_OK);
-  EXPECT_EQ(recordSink->AddStream(MF_CAPTURE_ENGINE_PREFERRED_SOURCE_STREAM_FOR_VIDEO_RECORD, recordType, nullptr, &index),
-            S_OK);
+  EXPECT_EQ(
+      recordSink->AddStream(MF_CAPTURE_ENGINE_PREFERRED_SOURCE_STREAM_FOR_VIDEO_RECORD, recordType, nullptr, &index),
+      S_OK);
   EXPECT_EQ(recordSink->SetOutputFileName(platform::widen(clip).c_str()), S_OK);
   for (IUnknown* object : std::initializer_list<IUnknown*>{recordSink, sink, recordType, deviceType, source})
     object->Release();
@@ -240,7 +241,7 @@ TEST(LinuxCaptureEngine, H264TestCameraPreviewsItsPictureAndRecordsItsOwnStream)
   EXPECT_EQ(file.streams[0].profile, FF_PROFILE_H264_MAIN);  // the camera's; the engine's own is Baseline
   const std::vector<bool> keys = media::containerKeys(clip);
   ASSERT_GE(keys.size(), 30u);
-  EXPECT_TRUE(keys[0]);  // asked for at the start
+  EXPECT_TRUE(keys[0]);   // asked for at the start
   EXPECT_TRUE(keys[30]);  // the camera's own, every second
   const media::Decoded decoded = media::decode(clip, AVMEDIA_TYPE_VIDEO);
   EXPECT_EQ(decoded.errors, 0);
@@ -324,8 +325,7 @@ TEST(LinuxCaptureEngine, APictureACallbackKeepsIsNotOverwrittenByTheNextOnes) {
   const auto [now, atDelivery] = callback->kept();
   ASSERT_EQ(atDelivery.size(), 64u * 48u * 4u);
   EXPECT_TRUE(now == atDelivery);
-  for (IUnknown* object : std::initializer_list<IUnknown*>{type, previewSink, sink, callback})
-    object->Release();
+  for (IUnknown* object : std::initializer_list<IUnknown*>{type, previewSink, sink, callback}) object->Release();
 }
 
 // Odd sizes are recorded at the next even size, the last column and row repeated.
@@ -353,9 +353,9 @@ TEST(LinuxCaptureEngine, TestCameraGraphsTakeOnlyGeneratorsAndDrawingFilters) {
             (std::vector<std::string>{"testsrc2", "drawbox"}));
   EXPECT_EQ(filterNames("color@bg=c=red[a];[a]scale=w='iw\\,2':h=2[out]"),
             (std::vector<std::string>{"color", "scale"}));
-  for (const char* graph : {"testsrc2=size=640x480:rate=30", "color=c=red:size=1x1:rate=30", "smptebars",
-                            "mandelbrot=size=320x240", "color=c=blue:size=320x240,drawbox=x=0:y=0:w=9:h=9:t=fill",
-                            "testsrc=d=5,format=yuyv422,realtime"})
+  for (const char* graph :
+       {"testsrc2=size=640x480:rate=30", "color=c=red:size=1x1:rate=30", "smptebars", "mandelbrot=size=320x240",
+        "color=c=blue:size=320x240,drawbox=x=0:y=0:w=9:h=9:t=fill", "testsrc=d=5,format=yuyv422,realtime"})
     EXPECT_EQ(refusedFilter(graph), "") << graph;
   const std::pair<const char*, const char*> refused[] = {
       {"movie=/etc/passwd", "movie"},

@@ -62,7 +62,8 @@ void recordTone(MFEncoder& encoder, const WAVEFORMATEXTENSIBLE& format, int pack
 TEST(MFEncoder, FloatStereoEndpointGivesAnAacFileOfItsRateAndChannels) {
   media::TempFolder folder;
   const std::string path = folder.file("endpoint.mp4");
-  const auto format = captureFormat(2, 48000, 32, KSDATAFORMAT_SUBTYPE_IEEE_FLOAT, SPEAKER_FRONT_LEFT | SPEAKER_FRONT_RIGHT);
+  const auto format =
+      captureFormat(2, 48000, 32, KSDATAFORMAT_SUBTYPE_IEEE_FLOAT, SPEAKER_FRONT_LEFT | SPEAKER_FRONT_RIGHT);
   testing::internal::CaptureStdout();
   auto encoder = std::make_unique<MFEncoder>(path, &format);
   EXPECT_EQ(testing::internal::GetCapturedStdout(), "File: " + path + "\n");
@@ -96,7 +97,7 @@ TEST(MFEncoder, SampleSizesFollowTheBlockAlignment) {
   testing::internal::CaptureStdout();
   {
     MFEncoder encoder(path, &format);
-    recordTone(encoder, format, 10, 4410);  // 1 s
+    recordTone(encoder, format, 10, 4410);                // 1 s
     encoder.write(nullptr, 0, &format.Format, 10000000);  // a packet of no frames is written too
     encoder.finalize();
   }
@@ -120,7 +121,7 @@ TEST(MFEncoder, UnknownSubFormatFailsAfterTheOutputStream) {
   }
   EXPECT_EQ(testing::internal::GetCapturedStdout(), "File: " + path + "\n");
   EXPECT_TRUE(std::filesystem::exists(path));  // the sink was made before the failure
-  MFShutdown();  // the failed constructor left Media Foundation started, as it should
+  MFShutdown();                                // the failed constructor left Media Foundation started, as it should
 }
 
 TEST(MFEncoder, MissingFolderFailsToCreateTheSink) {
@@ -131,8 +132,9 @@ TEST(MFEncoder, MissingFolderFailsToCreateTheSink) {
     MFEncoder encoder(folder.file("missing/a.mp4"), &format);
     FAIL() << "no failure";
   } catch (const std::runtime_error& error) {
-    EXPECT_NE(std::string(error.what()).find("\tnative/capture/audio/mfencoder(35): 0x80070003: Could not create sink."),
-              std::string::npos)
+    EXPECT_NE(
+        std::string(error.what()).find("\tnative/capture/audio/mfencoder(35): 0x80070003: Could not create sink."),
+        std::string::npos)
         << error.what();
   }
   testing::internal::GetCapturedStdout();

@@ -178,8 +178,8 @@ TEST(MFTEncoder, AFailureAfterStartUpShutsMediaFoundationDownBeforeItLeaves) {
   }
   media::TempFolder folder;
   FrameQueue queue(L"display", 64, 64, 0);
-  MFTEncoder encoder(std::make_shared<Clip>(platform::widen(folder.file("missing/clip.mp4")), currentTimeMillis(),
-                                            frameAt(queue, 1)));
+  MFTEncoder encoder(
+      std::make_shared<Clip>(platform::widen(folder.file("missing/clip.mp4")), currentTimeMillis(), frameAt(queue, 1)));
   try {
     encoder.encode(&queue);
     FAIL() << "encode did not throw";

@@ -54,8 +54,7 @@ std::string failureOf(const WAVEFORMATEXTENSIBLE& format, const std::vector<uint
 
 TEST(AudioPeaks, IntegerWidthsScaleToTheirFullScale) {
   const GUID pcm = KSDATAFORMAT_SUBTYPE_PCM;
-  EXPECT_EQ(peaksOf(formatOf(pcm, 8, 2), std::vector<int8_t>{127, -64, 10, 0}),
-            (std::vector<double>{1.0, 64 / 127.0}));
+  EXPECT_EQ(peaksOf(formatOf(pcm, 8, 2), std::vector<int8_t>{127, -64, 10, 0}), (std::vector<double>{1.0, 64 / 127.0}));
   EXPECT_EQ(peaksOf(formatOf(pcm, 16, 2), std::vector<int16_t>{16384, -32767, -100, 200}),
             (std::vector<double>{16384 / 32767.0, 1.0}));
   EXPECT_EQ(peaksOf(formatOf(pcm, 32, 1), std::vector<int32_t>{-1073741824, 5}),
@@ -81,8 +80,7 @@ TEST(AudioPeaks, FloatSamplesKeepSignZeroNanAndClamp) {
   std::vector<double> zero = peaksOf(formatOf(ieee, 32, 2), std::vector<float>{-0.0f, 0.0f});
   EXPECT_EQ(zero, (std::vector<double>{0.0, 0.0}));
   const float nan = std::numeric_limits<float>::quiet_NaN();
-  EXPECT_EQ(peaksOf(formatOf(ieee, 32, 2), std::vector<float>{nan, 3.5f, nan, -2.0f}),
-            (std::vector<double>{0.0, 1.0}));
+  EXPECT_EQ(peaksOf(formatOf(ieee, 32, 2), std::vector<float>{nan, 3.5f, nan, -2.0f}), (std::vector<double>{0.0, 1.0}));
   EXPECT_EQ(peaksOf(formatOf(ieee, 64, 1), std::vector<double>{-0.375, 0.25, std::nan("")}),
             std::vector<double>{0.375});
 }

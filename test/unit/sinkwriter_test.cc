@@ -61,7 +61,7 @@ IMFMediaType* rgb32Type(UINT32 width, UINT32 height) {
 // A video writer of one H.264 stream fed with RGB32; input is adjusted by `adjust` if given.
 template <class Adjust>
 IMFSinkWriter* videoWriterWith(const std::string& path, UINT32 width, UINT32 height, DWORD* stream, Adjust adjust,
-                           UINT32 profile = eAVEncH264VProfile_Main) {
+                               UINT32 profile = eAVEncH264VProfile_Main) {
   IMFSinkWriter* writer = createWriter(path);
   if (!writer) return nullptr;
   IMFMediaType* out = h264Type(width, height, profile);
@@ -76,7 +76,8 @@ IMFSinkWriter* videoWriterWith(const std::string& path, UINT32 width, UINT32 hei
 }
 IMFSinkWriter* videoWriter(const std::string& path, UINT32 width, UINT32 height, DWORD* stream,
                            UINT32 profile = eAVEncH264VProfile_Main) {
-  return videoWriterWith(path, width, height, stream, [](IMFMediaType*) {}, profile);
+  return videoWriterWith(
+      path, width, height, stream, [](IMFMediaType*) {}, profile);
 }
 
 IMFSample* sampleOf(const void* bytes, DWORD length, LONGLONG time, LONGLONG duration, bool timed = true) {
@@ -415,7 +416,8 @@ HRESULT copyStream(const std::string& path, const media::CameraStream& camera, i
   out->Release();
   IMFMediaType* in = h264Type(width, height);
   in->DeleteItem(MF_MT_AVG_BITRATE);
-  if (withHeader) in->SetBlob(MF_MT_MPEG_SEQUENCE_HEADER, camera.header.data(), static_cast<UINT32>(camera.header.size()));
+  if (withHeader)
+    in->SetBlob(MF_MT_MPEG_SEQUENCE_HEADER, camera.header.data(), static_cast<UINT32>(camera.header.size()));
   if (SUCCEEDED(hr)) hr = writer->SetInputMediaType(stream, in, nullptr);
   in->Release();
   if (SUCCEEDED(hr)) hr = writer->BeginWriting();
@@ -443,7 +445,8 @@ void expectCameraStreamIn(const std::string& path, const media::CameraStream& ca
   EXPECT_EQ(video.width, 160);
   EXPECT_EQ(video.height, 120);
   ASSERT_EQ(video.packets.size(), camera.packets.size());
-  for (size_t i = 0; i < video.packets.size(); ++i) EXPECT_NEAR(video.packets[i].time, i / 30.0, 1e-4) << "packet " << i;
+  for (size_t i = 0; i < video.packets.size(); ++i)
+    EXPECT_NEAR(video.packets[i].time, i / 30.0, 1e-4) << "packet " << i;
   EXPECT_EQ(media::containerKeys(path), camera.keys);  // the file's own sync samples, from the clean points
   EXPECT_NEAR(file.duration, camera.packets.size() / 30.0, 1e-3);
   // The decoder needs the parameter sets from the file's avcC or the packets: no errors, every frame.
@@ -610,13 +613,13 @@ TEST_P(AacFile, KeepsRateChannelsDurationAndTheTone) {
 
 INSTANTIATE_TEST_SUITE_P(
     SampleKinds, AacFile,
-    testing::Values(
-        AudioCase{"Float48kStereo", 48000, 2, WAVE_FORMAT_IEEE_FLOAT, 32, SPEAKER_FRONT_LEFT | SPEAKER_FRONT_RIGHT},
-        AudioCase{"Pcm16At44kMono", 44100, 1, WAVE_FORMAT_PCM, 16, SPEAKER_FRONT_CENTER},
-        AudioCase{"Pcm24Stereo", 48000, 2, WAVE_FORMAT_PCM, 24, 0},
-        AudioCase{"Pcm32Stereo", 48000, 2, WAVE_FORMAT_PCM, 32, 0},
-        AudioCase{"Float5_1", 48000, 6, WAVE_FORMAT_IEEE_FLOAT, 32, 0x3F},
-        AudioCase{"Float5_1WithSideSpeakers", 48000, 6, WAVE_FORMAT_IEEE_FLOAT, 32, 0x60F}),
+    testing::Values(AudioCase{"Float48kStereo", 48000, 2, WAVE_FORMAT_IEEE_FLOAT, 32,
+                              SPEAKER_FRONT_LEFT | SPEAKER_FRONT_RIGHT},
+                    AudioCase{"Pcm16At44kMono", 44100, 1, WAVE_FORMAT_PCM, 16, SPEAKER_FRONT_CENTER},
+                    AudioCase{"Pcm24Stereo", 48000, 2, WAVE_FORMAT_PCM, 24, 0},
+                    AudioCase{"Pcm32Stereo", 48000, 2, WAVE_FORMAT_PCM, 32, 0},
+                    AudioCase{"Float5_1", 48000, 6, WAVE_FORMAT_IEEE_FLOAT, 32, 0x3F},
+                    AudioCase{"Float5_1WithSideSpeakers", 48000, 6, WAVE_FORMAT_IEEE_FLOAT, 32, 0x60F}),
     [](const testing::TestParamInfo<AudioCase>& info) { return std::string(info.param.name); });
 
 TEST(SinkWriter, AudioGapsInSampleTimesBecomeSilence) {

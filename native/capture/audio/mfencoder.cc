@@ -34,14 +34,14 @@ MFEncoder::MFEncoder(const std::string& path, const WAVEFORMATEXTENSIBLE* format
 
     const std::wstring widePath = toWide(path);
     std::cout << "File: " << path << std::endl;
-    checkResult(file, 35, MFCreateSinkWriterFromURL(widePath.c_str(), nullptr, attributes.Get(), sinkWriter.GetAddressOf()),
+    checkResult(file, 35,
+                MFCreateSinkWriterFromURL(widePath.c_str(), nullptr, attributes.Get(), sinkWriter.GetAddressOf()),
                 "Could not create sink.");
     attributes.Reset();
 
     ComPtr<IMFMediaType> output;
     checkResult(file, 41, MFCreateMediaType(output.GetAddressOf()), "Could not create output media type.");
-    checkResult(file, 42, output->SetGUID(MF_MT_MAJOR_TYPE, MFMediaType_Audio),
-                "Unable to set major type of output.");
+    checkResult(file, 42, output->SetGUID(MF_MT_MAJOR_TYPE, MFMediaType_Audio), "Unable to set major type of output.");
     checkResult(file, 43, output->SetGUID(MF_MT_SUBTYPE, MFAudioFormat_AAC), "Unable to set subtype of output.");
     checkResult(file, 44, output->SetUINT32(MF_MT_AUDIO_BITS_PER_SAMPLE, 16),
                 "Unable to set bits per sample of output.");
@@ -117,8 +117,6 @@ void MFEncoder::write(const uint8_t* data, uint32_t frames, const WAVEFORMATEX* 
   checkResult(file, 106, sinkWriter->WriteSample(0, sample.Get()), "Could not write sample.");
 }
 
-void MFEncoder::finalize() {
-  checkResult(file, 113, sinkWriter->Finalize(), "Unable to finalize audio encoder.");
-}
+void MFEncoder::finalize() { checkResult(file, 113, sinkWriter->Finalize(), "Unable to finalize audio encoder."); }
 
 }  // namespace capture::audio

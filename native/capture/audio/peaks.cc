@@ -27,9 +27,12 @@ T sampleAt(const uint8_t* data, size_t index) {
 void computePeaks(const uint8_t* data, uint32_t frames, const WAVEFORMATEXTENSIBLE* format, std::vector<double>& peaks,
                   std::mutex& lock) {
   bool isFloat;
-  if (format->SubFormat == KSDATAFORMAT_SUBTYPE_PCM) isFloat = false;
-  else if (format->SubFormat == KSDATAFORMAT_SUBTYPE_IEEE_FLOAT) isFloat = true;
-  else fail(322, "Peaks cannot be calculated as the data format is unknown.");
+  if (format->SubFormat == KSDATAFORMAT_SUBTYPE_PCM)
+    isFloat = false;
+  else if (format->SubFormat == KSDATAFORMAT_SUBTYPE_IEEE_FLOAT)
+    isFloat = true;
+  else
+    fail(322, "Peaks cannot be calculated as the data format is unknown.");
 
   const uint16_t channels = format->Format.nChannels;
   const uint16_t bits = format->Format.wBitsPerSample;
@@ -44,9 +47,7 @@ void computePeaks(const uint8_t* data, uint32_t frames, const WAVEFORMATEXTENSIB
           case 8: x = sampleAt<int8_t>(data, index) / 127.0; break;
           case 16: x = sampleAt<int16_t>(data, index) / 32767.0; break;
           case 32: x = sampleAt<int32_t>(data, index) / 2147483647.0; break;
-          case 64:
-            x = static_cast<double>(sampleAt<int64_t>(data, index)) / static_cast<double>(INT64_MAX);
-            break;
+          case 64: x = static_cast<double>(sampleAt<int64_t>(data, index)) / static_cast<double>(INT64_MAX); break;
           default: fail(354, "Peaks cannot be calculated as the bit depth is unknown.");
         }
       } else {

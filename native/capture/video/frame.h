@@ -13,14 +13,14 @@
 namespace capture::video {
 
 struct Frame {
-  uint64_t size = 0;           // width * height * 4
+  uint64_t size = 0;  // width * height * 4
   uint64_t bytesPerPixel = 4;
   uint64_t width = 0;
   uint64_t height = 0;
-  uint64_t rowPixels = 0;      // equal to width: rows are packed
-  uint32_t channelOrder = 0;   // 0 display, 1 camera
+  uint64_t rowPixels = 0;           // equal to width: rows are packed
+  uint32_t channelOrder = 0;        // 0 display, 1 camera
   std::unique_ptr<uint8_t[]> data;  // top-down rows, bytes B, G, R, A
-  int64_t timestamp = 0;       // ms since 1970 when the frame was built
+  int64_t timestamp = 0;            // ms since 1970 when the frame was built
 
   // A frame of width x height pixels with uninitialised pixel bytes.
   static std::unique_ptr<Frame> make(uint64_t width, uint64_t height, uint32_t channelOrder, int64_t timestamp) {
@@ -46,9 +46,9 @@ struct FrameQueue {
   FrameQueue(std::wstring path, uint64_t width, uint64_t height, uint32_t channelOrder)
       : path(std::move(path)), width(width), height(height), channelOrder(channelOrder) {}
 
-  std::atomic<bool> stopped{true};  // no clip is being recorded
-  std::wstring path;  // the source's name until a display's startEncode stores the file name
-  std::mutex mutex;   // guards frames
+  std::atomic<bool> stopped{true};            // no clip is being recorded
+  std::wstring path;                          // the source's name until a display's startEncode stores the file name
+  std::mutex mutex;                           // guards frames
   std::deque<std::unique_ptr<Frame>> frames;  // oldest first
   const uint64_t width;
   const uint64_t height;
@@ -63,7 +63,7 @@ struct Clip {
       : path(std::move(path)), start(start), first(std::move(first)) {}
 
   const std::wstring path;
-  const int64_t start;          // ms since 1970, when the file was accepted
+  const int64_t start;           // ms since 1970, when the file was accepted
   std::unique_ptr<Frame> first;  // the picture current at the start; null when there was none yet
   std::atomic<int64_t> stop{0};  // ms since 1970 of the stop request, 0 while recording
 };

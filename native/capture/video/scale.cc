@@ -62,9 +62,8 @@ void copySwapped(const uint8_t* from, uint8_t* to, uint32_t pixels, bool avx2) {
   const __m128i low = _mm_set1_epi32(0xFF);
   for (; i + 4 <= pixels; i += 4) {
     const __m128i p = _mm_loadu_si128(reinterpret_cast<const __m128i*>(from + 4 * i));
-    const __m128i q = _mm_or_si128(_mm_and_si128(p, keep),
-                                   _mm_or_si128(_mm_and_si128(_mm_srli_epi32(p, 16), low),
-                                                _mm_slli_epi32(_mm_and_si128(p, low), 16)));
+    const __m128i q = _mm_or_si128(_mm_and_si128(p, keep), _mm_or_si128(_mm_and_si128(_mm_srli_epi32(p, 16), low),
+                                                                        _mm_slli_epi32(_mm_and_si128(p, low), 16)));
     _mm_storeu_si128(reinterpret_cast<__m128i*>(to + 4 * i), q);
   }
 #endif

@@ -36,10 +36,10 @@ using LPWAVEFORMATEX = WAVEFORMATEX*;
 using PWAVEFORMATEXTENSIBLE = WAVEFORMATEXTENSIBLE*;
 
 // The extensible subtypes: the format tag in the first four bytes of the wave-format base GUID.
-inline constexpr GUID KSDATAFORMAT_SUBTYPE_PCM = {0x00000001, 0x0000, 0x0010,
-                                                  {0x80, 0x00, 0x00, 0xAA, 0x00, 0x38, 0x9B, 0x71}};
-inline constexpr GUID KSDATAFORMAT_SUBTYPE_IEEE_FLOAT = {0x00000003, 0x0000, 0x0010,
-                                                         {0x80, 0x00, 0x00, 0xAA, 0x00, 0x38, 0x9B, 0x71}};
+inline constexpr GUID KSDATAFORMAT_SUBTYPE_PCM = {
+    0x00000001, 0x0000, 0x0010, {0x80, 0x00, 0x00, 0xAA, 0x00, 0x38, 0x9B, 0x71}};
+inline constexpr GUID KSDATAFORMAT_SUBTYPE_IEEE_FLOAT = {
+    0x00000003, 0x0000, 0x0010, {0x80, 0x00, 0x00, 0xAA, 0x00, 0x38, 0x9B, 0x71}};
 
 // Speaker positions of dwChannelMask (channel order in the data follows the bit order).
 constexpr DWORD SPEAKER_FRONT_LEFT = 0x1;

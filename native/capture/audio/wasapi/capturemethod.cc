@@ -22,7 +22,8 @@ std::vector<std::shared_ptr<capture::Source>> CaptureMethod::sources() {
                                         reinterpret_cast<void**>(enumerator.GetAddressOf())),
                        "Could not initialize IMMDeviceEnumerator.");
   ComPtr<IMMDevice> defaultEndpoint;
-  capture::checkResult(kFile, 30, enumerator->GetDefaultAudioEndpoint(eRender, eConsole, defaultEndpoint.GetAddressOf()),
+  capture::checkResult(kFile, 30,
+                       enumerator->GetDefaultAudioEndpoint(eRender, eConsole, defaultEndpoint.GetAddressOf()),
                        "Could not get the default device.");
   LPWSTR defaultId = nullptr;
   capture::checkResult(kFile, 34, defaultEndpoint->GetId(&defaultId), "Unable to get the default device id.");
@@ -33,7 +34,8 @@ std::vector<std::shared_ptr<capture::Source>> CaptureMethod::sources() {
   result.push_back(std::make_shared<Source>(defaultEndpoint.Get(), true));
 
   ComPtr<IMMDeviceCollection> collection;
-  capture::checkResult(kFile, 45, enumerator->EnumAudioEndpoints(eRender, DEVICE_STATE_ACTIVE, collection.GetAddressOf()),
+  capture::checkResult(kFile, 45,
+                       enumerator->EnumAudioEndpoints(eRender, DEVICE_STATE_ACTIVE, collection.GetAddressOf()),
                        "Could not enumerate aaudio endpoints.");
   UINT count = 0;
   capture::checkResult(kFile, 50, collection->GetCount(&count), "Could not get the device collection count.");

@@ -115,24 +115,25 @@ struct Source::Silence {
     // A try after a failure starts with clients of its own.
     renderClient.Reset();
     silenceClient.Reset();
-    capture::checkResult(
-        kFile, 173,
-        endpoint->Activate(IID_IAudioClient, CLSCTX_ALL, nullptr, reinterpret_cast<void**>(silenceClient.GetAddressOf())),
-        "Could not create audio client.");
+    capture::checkResult(kFile, 173,
+                         endpoint->Activate(IID_IAudioClient, CLSCTX_ALL, nullptr,
+                                            reinterpret_cast<void**>(silenceClient.GetAddressOf())),
+                         "Could not create audio client.");
     WAVEFORMATEXTENSIBLE* mix = readMixFormat(silenceClient.Get());
     HRESULT hr = silenceClient->Initialize(AUDCLNT_SHAREMODE_SHARED, 0, kBufferDuration, 0, &mix->Format, nullptr);
     delete mix;
     capture::checkResult(kFile, 178, hr, "Could not initialize the audio client.");
     UINT32 bufferFrames = 0;
     capture::checkResult(kFile, 183, silenceClient->GetBufferSize(&bufferFrames), "Could not get the buffer size.");
-    capture::checkResult(kFile, 186,
-                         silenceClient->GetService(IID_IAudioRenderClient,
-                                                   reinterpret_cast<void**>(renderClient.GetAddressOf())),
-                         "Could not get the audio capture client service from the audio client.");
+    capture::checkResult(
+        kFile, 186,
+        silenceClient->GetService(IID_IAudioRenderClient, reinterpret_cast<void**>(renderClient.GetAddressOf())),
+        "Could not get the audio capture client service from the audio client.");
     capture::checkResult(kFile, 189, silenceClient->Start(), "Could not start the audio client.");
     for (;;) {
       UINT32 padding = 0;
-      capture::checkResult(kFile, 194, silenceClient->GetCurrentPadding(&padding), "Could not get current padding size.");
+      capture::checkResult(kFile, 194, silenceClient->GetCurrentPadding(&padding),
+                           "Could not get current padding size.");
       if (padding < bufferFrames) {
         const UINT32 frames = bufferFrames - padding;
         BYTE* data = nullptr;
@@ -242,7 +243,8 @@ void Source::record(const BYTE* data, UINT32 frames, uint64_t begin, const WAVEF
   const uint64_t end = begin + frames * kUnitsPerSecond / rate;
   auto frameAt = [&](uint64_t time) {
     if (time >= end) return frames;
-    return static_cast<UINT32>(std::min<uint64_t>(frames, ((time - begin) * rate + kUnitsPerSecond / 2) / kUnitsPerSecond));
+    return static_cast<UINT32>(
+        std::min<uint64_t>(frames, ((time - begin) * rate + kUnitsPerSecond / 2) / kUnitsPerSecond));
   };
   for (auto it = writing.begin(); it != writing.end();) {
     Clip& clip = **it;
@@ -301,7 +303,8 @@ double Source::peak(int32_t channel) {
 }
 
 void Source::runCapture(IAudioClient*& client, IAudioCaptureClient*& packets) {
-  capture::checkResult(kFile, 212, endpoint->Activate(IID_IAudioClient, CLSCTX_ALL, nullptr, reinterpret_cast<void**>(&client)),
+  capture::checkResult(kFile, 212,
+                       endpoint->Activate(IID_IAudioClient, CLSCTX_ALL, nullptr, reinterpret_cast<void**>(&client)),
                        "Could not create audio client.");
   audioClient.exchange(client);
 
@@ -349,14 +352,19 @@ void Source::runCapture(IAudioClient*& client, IAudioCaptureClient*& packets) {
     UINT64 qpcPosition = 0;
     HRESULT hr = packets->GetBuffer(&data, &frames, &flags, &devicePosition, &qpcPosition);
     if (hr == AUDCLNT_E_OUT_OF_ORDER) {
-      capture::checkResult(kFile, 259, packets->ReleaseBuffer(0), "Could not release the audio capture client's buffer.");
+      capture::checkResult(kFile, 259, packets->ReleaseBuffer(0),
+                           "Could not release the audio capture client's buffer.");
       continue;
     }
-    if (hr == AUDCLNT_E_DEVICE_INVALIDATED) capture::checkResult(kFile, 262, hr, "Audio device is no longer valid for capture.");
-    if (hr == AUDCLNT_E_BUFFER_OPERATION_PENDING) capture::checkResult(kFile, 264, hr, "Audio buffer operation is pending.");
-    if (hr == AUDCLNT_E_SERVICE_NOT_RUNNING) capture::checkResult(kFile, 266, hr, "Audio client service is not running.");
+    if (hr == AUDCLNT_E_DEVICE_INVALIDATED)
+      capture::checkResult(kFile, 262, hr, "Audio device is no longer valid for capture.");
+    if (hr == AUDCLNT_E_BUFFER_OPERATION_PENDING)
+      capture::checkResult(kFile, 264, hr, "Audio buffer operation is pending.");
+    if (hr == AUDCLNT_E_SERVICE_NOT_RUNNING)
+      capture::checkResult(kFile, 266, hr, "Audio client service is not running.");
     if (frames == 0 && hr == AUDCLNT_S_BUFFER_EMPTY) {
-      capture::checkResult(kFile, 271, packets->ReleaseBuffer(0), "Could not release the audio capture client's buffer.");
+      capture::checkResult(kFile, 271, packets->ReleaseBuffer(0),
+                           "Could not release the audio capture client's buffer.");
       finishOverdue(counterNow());
       pause();
       continue;
@@ -376,7 +384,8 @@ void Source::runCapture(IAudioClient*& client, IAudioCaptureClient*& packets) {
     finishOverdue(counterNow());
     if (previewing.load()) computePeaks(data, frames, captureFormat, peaks, peakLock);
     silent.reset();
-    capture::checkResult(kFile, 309, packets->ReleaseBuffer(frames), "Could not release the audio capture client's buffer.");
+    capture::checkResult(kFile, 309, packets->ReleaseBuffer(frames),
+                         "Could not release the audio capture client's buffer.");
   }
 }
 

@@ -67,8 +67,8 @@ class Source : public capture::audio::Source, public std::enable_shared_from_thi
   // hands a new clip to the capture thread through `started`; the thread writes each packet's part
   // of every clip it holds and finishes a clip once packets have passed its stop.
   std::mutex clipsLock;
-  std::deque<std::shared_ptr<Clip>> started;  // guarded by clipsLock
-  std::shared_ptr<Clip> latest;               // the caller's thread only
+  std::deque<std::shared_ptr<Clip>> started;   // guarded by clipsLock
+  std::shared_ptr<Clip> latest;                // the caller's thread only
   std::vector<std::shared_ptr<Clip>> writing;  // the capture thread only
   EncoderFactory makeEncoder;
   bool isSelected;

@@ -163,8 +163,7 @@ void MFTEncoder::configure() {
   checkResult(file, 49, attrs->SetUINT32(MF_LOW_LATENCY, TRUE), "Unable to set low latency mode.");
   checkResult(file, 50, attrs->SetUINT32(MF_READWRITE_ENABLE_HARDWARE_TRANSFORMS, TRUE),
               "Unable to enable hardware transforms.");
-  checkResult(file, 51, attrs->SetUINT32(MF_SINK_WRITER_DISABLE_THROTTLING, TRUE),
-              "Unable to disable throttling.");
+  checkResult(file, 51, attrs->SetUINT32(MF_SINK_WRITER_DISABLE_THROTTLING, TRUE), "Unable to disable throttling.");
   checkResult(file, 52, attrs->SetGUID(MF_TRANSCODE_CONTAINERTYPE, MFTranscodeContainerType_MPEG4),
               "Unable to set container type.");
   checkResult(file, 54, MFCreateSinkWriterFromURL(clip->path.c_str(), nullptr, attrs.Get(), writer.GetAddressOf()),
@@ -186,8 +185,7 @@ void MFTEncoder::configure() {
   checkResult(file, 64, out->SetUINT64(MF_MT_FRAME_RATE, frameRate), "Unable to set output framerate.");
   checkResult(file, 65, out->SetUINT64(MF_MT_PIXEL_ASPECT_RATIO, aspectRatio),
               "Unable to set output pixel aspect ratio.");
-  checkResult(file, 66, out->SetUINT32(MF_MT_MPEG2_PROFILE, eAVEncH264VProfile_Main),
-              "Unable to set output profile.");
+  checkResult(file, 66, out->SetUINT32(MF_MT_MPEG2_PROFILE, eAVEncH264VProfile_Main), "Unable to set output profile.");
   checkResult(file, 67, writer->AddStream(out.Get(), &streamIndex), "Could not add stream to writer.");
   out.Reset();
 

@@ -158,10 +158,11 @@ HRESULT openInput(Device& device, std::shared_ptr<Input>& result) {
     error = avformat_open_input(&input->format, url.c_str(), format, &options);
   }
   av_dict_free(&options);
-  if (error < 0) return device.video ? MF_E_VIDEO_RECORDING_DEVICE_INVALIDATED : MF_E_AUDIO_RECORDING_DEVICE_INVALIDATED;
+  if (error < 0)
+    return device.video ? MF_E_VIDEO_RECORDING_DEVICE_INVALIDATED : MF_E_AUDIO_RECORDING_DEVICE_INVALIDATED;
   if (avformat_find_stream_info(input->format, nullptr) < 0) return MF_E_INVALID_STREAM_DATA;
-  input->stream = av_find_best_stream(input->format, device.video ? AVMEDIA_TYPE_VIDEO : AVMEDIA_TYPE_AUDIO, -1, -1,
-                                      nullptr, 0);
+  input->stream =
+      av_find_best_stream(input->format, device.video ? AVMEDIA_TYPE_VIDEO : AVMEDIA_TYPE_AUDIO, -1, -1, nullptr, 0);
   if (input->stream < 0)
     return device.video ? MF_E_CAPTURE_SOURCE_NO_VIDEO_STREAM_PRESENT : MF_E_CAPTURE_SOURCE_NO_AUDIO_STREAM_PRESENT;
   AVStream* stream = input->format->streams[input->stream];

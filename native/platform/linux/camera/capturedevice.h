@@ -50,7 +50,7 @@ struct Device {
   std::string formatName;  // "v4l2", "lavfi" or "pulse"
   std::string url;
   bool encodesH264 = false;  // a lavfi test camera that looks like an H.264 webcam
-  int rate = 48000;  // microphones: what to ask the server for
+  int rate = 48000;          // microphones: what to ask the server for
   int channels = 2;
   DeviceFormat current;
   std::shared_ptr<Input> input;  // shared with the device's reader while it reads

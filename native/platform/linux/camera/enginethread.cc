@@ -118,7 +118,7 @@ struct Recording {
   bool padded = false;            // an odd-sized picture is encoded at the next even size
   int width = 0;                  // the device's picture size
   int height = 0;
-  LONGLONG frameDuration = 0;     // at the device's frame rate
+  LONGLONG frameDuration = 0;  // at the device's frame rate
   // The last picture, written when the next one shows how long it lasted.
   ComPtr<IMFSample> held;
   LONGLONG heldTime = 0;
@@ -166,8 +166,8 @@ class EngineThread {
   std::vector<Recording*> recordings();
 
   std::shared_ptr<EngineState> state_;
-  std::unique_ptr<Recording> current_;                   // the clip being recorded
-  std::vector<std::unique_ptr<Recording>> finishing_;    // stopped clips waiting for their last data
+  std::unique_ptr<Recording> current_;                       // the clip being recorded
+  std::vector<std::unique_ptr<Recording>> finishing_;        // stopped clips waiting for their last data
   std::unique_ptr<capturedevice::DeviceReader> readers_[2];  // video, audio
   uint64_t generations_[2] = {0, 0};
   SwsContext* previewScaler_ = nullptr;
@@ -261,7 +261,8 @@ HRESULT EngineThread::startRecording(const Order& order) {
   ComPtr<IMFAttributes> settings;
   HRESULT hr = MFCreateAttributes(settings.GetAddressOf(), 1);
   if (SUCCEEDED(hr)) hr = settings->SetGUID(MF_TRANSCODE_CONTAINERTYPE, MFTranscodeContainerType_FMPEG4);
-  if (SUCCEEDED(hr)) hr = MFCreateSinkWriterFromURL(url.c_str(), nullptr, settings.Get(), recording->writer.GetAddressOf());
+  if (SUCCEEDED(hr))
+    hr = MFCreateSinkWriterFromURL(url.c_str(), nullptr, settings.Get(), recording->writer.GetAddressOf());
   for (const SinkStream& stream : order.streams) {
     if (FAILED(hr)) break;
     Device* device = stream.video ? state_->video.get() : state_->audio.get();
@@ -402,7 +403,8 @@ HRESULT EngineThread::finish(Recording& recording) {
   }
   if (recording.hasAudio && recording.stopAt && SUCCEEDED(recording.failure)) {
     // At least one sample, so that even a clip stopped at once is a file that plays.
-    const LONGLONG wanted = std::max<LONGLONG>(1, av_rescale(recording.stopAt - recording.startAt, recording.audioRate, 1000000));
+    const LONGLONG wanted =
+        std::max<LONGLONG>(1, av_rescale(recording.stopAt - recording.startAt, recording.audioRate, 1000000));
     std::vector<uint8_t> silence(static_cast<size_t>(recording.audioRate / 10) * recording.audioChannels * 2, 0);
     while (recording.audioSamples < wanted && SUCCEEDED(recording.failure))
       writeSound(recording, silence.data(),
@@ -469,8 +471,10 @@ IMFMediaBuffer* EngineThread::pictureBuffer(DWORD length) {
   ComPtr<IMFMediaBuffer> made;
   if (FAILED(MFCreateMemoryBuffer(length, made.GetAddressOf()))) return nullptr;
   // A clip holds a picture until the next, the engine the current one, a preview one more.
-  if (pictures_.size() < 4) pictures_.push_back(made);
-  else pictures_[pictures_.size() - 1] = made;
+  if (pictures_.size() < 4)
+    pictures_.push_back(made);
+  else
+    pictures_[pictures_.size() - 1] = made;
   return made.Get();
 }
 
@@ -491,17 +495,21 @@ void EngineThread::deliverVideo(AVFrame* frame, int64_t pts, AVRational timeBase
   if (!previewScaler_) return;
   const AVRational rate = f.rate;
   const LONGLONG duration = av_rescale(ticksPerSecond, rate.den, rate.num);
-  const LONGLONG time = pts != AV_NOPTS_VALUE ? av_rescale_q(pts, timeBase, AVRational{1, static_cast<int>(ticksPerSecond)})
-                                              : (readAt * 10);
+  const LONGLONG time = pts != AV_NOPTS_VALUE
+                            ? av_rescale_q(pts, timeBase, AVRational{1, static_cast<int>(ticksPerSecond)})
+                            : (readAt * 10);
 
   IMFMediaBuffer* buffer = pictureBuffer(length);
   if (!buffer) return;
   ComPtr<IMFSample> sample;
-  HRESULT hr = fillSample(buffer, length, time, duration, [&](BYTE* data) {
-    uint8_t* planes[1] = {data};
-    int strides[1] = {width * 4};
-    sws_scale(previewScaler_, picture->data, picture->linesize, 0, frame->height, planes, strides);
-  }, sample.GetAddressOf());
+  HRESULT hr = fillSample(
+      buffer, length, time, duration,
+      [&](BYTE* data) {
+        uint8_t* planes[1] = {data};
+        int strides[1] = {width * 4};
+        sws_scale(previewScaler_, picture->data, picture->linesize, 0, frame->height, planes, strides);
+      },
+      sample.GetAddressOf());
   if (FAILED(hr)) return;
   lastPicture_ = sample;
   lastPictureTime_ = time;
@@ -547,7 +555,8 @@ void EngineThread::recordPicture(Recording& recording, IMFSample* picture, LONGL
     return;
   }
   LONGLONG time = clipTime(recording, deviceTime, readAt);
-  if (time <= recording.heldTime) time = recording.heldTime + recording.frameDuration;  // the device's clock jumped back
+  if (time <= recording.heldTime)
+    time = recording.heldTime + recording.frameDuration;  // the device's clock jumped back
   writeHeld(recording, time - recording.heldTime);
   recording.held = ComPtr<IMFSample>(picture);
   recording.heldTime = time;
@@ -563,11 +572,12 @@ void EngineThread::writeHeld(Recording& recording, LONGLONG duration) {
     const int height = evenpicture::evenSize(recording.height);
     ComPtr<IMFMediaBuffer> source;
     BYTE* data = nullptr;
-    if (FAILED(sample->GetBufferByIndex(0, source.GetAddressOf())) || FAILED(source->Lock(&data, nullptr, nullptr))) return;
+    if (FAILED(sample->GetBufferByIndex(0, source.GetAddressOf())) || FAILED(source->Lock(&data, nullptr, nullptr)))
+      return;
     ComPtr<IMFSample> copy;
-    const HRESULT hr = makeSample(static_cast<DWORD>(width * height * 4), 0, 0, [&](BYTE* to) {
-      evenpicture::pad(data, recording.width, recording.height, to);
-    }, copy.GetAddressOf());
+    const HRESULT hr = makeSample(
+        static_cast<DWORD>(width * height * 4), 0, 0,
+        [&](BYTE* to) { evenpicture::pad(data, recording.width, recording.height, to); }, copy.GetAddressOf());
     source->Unlock();
     if (FAILED(hr)) return;
     sample = copy;
@@ -602,8 +612,9 @@ void EngineThread::deliverAudio(AVFrame* frame, int64_t pts, AVRational timeBase
     }
     if (previewing && !callbacks.empty()) {
       ComPtr<IMFSample> sample;
-      if (SUCCEEDED(makeSample(length, av_rescale_q(pts, timeBase, AVRational{1, static_cast<int>(ticksPerSecond)}), duration,
-                               [&](BYTE* data) { std::memcpy(data, frame->data[0], length); }, sample.GetAddressOf())))
+      if (SUCCEEDED(makeSample(
+              length, av_rescale_q(pts, timeBase, AVRational{1, static_cast<int>(ticksPerSecond)}), duration,
+              [&](BYTE* data) { std::memcpy(data, frame->data[0], length); }, sample.GetAddressOf())))
         for (auto& callback : callbacks) callback->OnSample(sample.Get());
     }
   }
@@ -623,7 +634,9 @@ void EngineThread::recordSound(Recording& recording, AVFrame* frame, int64_t cap
   const int64_t stopAt = recording.stopAt;
   int first = 0;
   int last = count;
-  if (capturedAt < startAt) first = static_cast<int>(std::min<int64_t>(count, av_rescale_rnd(startAt - capturedAt, rate, 1000000, AV_ROUND_UP)));
+  if (capturedAt < startAt)
+    first =
+        static_cast<int>(std::min<int64_t>(count, av_rescale_rnd(startAt - capturedAt, rate, 1000000, AV_ROUND_UP)));
   if (stopAt) last = static_cast<int>(std::clamp<int64_t>(av_rescale(stopAt - capturedAt, rate, 1000000), 0, count));
   if (stopAt && recording.audioReachedAt >= stopAt) return;  // the clip has all its sound
   recording.audioReachedAt = std::max(recording.audioReachedAt, end);
@@ -670,7 +683,8 @@ void EngineThread::writeSound(Recording& recording, const uint8_t* data, int sam
   const LONGLONG span = av_rescale(samples, ticksPerSecond, recording.audioRate);
   recording.audioSamples += samples;
   ComPtr<IMFSample> sample;
-  if (SUCCEEDED(makeSample(bytes, time, span, [&](BYTE* to) { std::memcpy(to, data, bytes); }, sample.GetAddressOf())))
+  if (SUCCEEDED(makeSample(
+          bytes, time, span, [&](BYTE* to) { std::memcpy(to, data, bytes); }, sample.GetAddressOf())))
     write(recording, recording.audioStream, sample.Get());
 }
 
@@ -688,13 +702,15 @@ void EngineThread::passThrough(Recording& recording, const AVPacket* packet, AVR
   }
   if (!started && !key) return;
   const AVRational ticks{1, static_cast<int>(ticksPerSecond)};
-  const LONGLONG duration = packet->duration > 0 ? av_rescale_q(packet->duration, timeBase, ticks) : recording.frameDuration;
+  const LONGLONG duration =
+      packet->duration > 0 ? av_rescale_q(packet->duration, timeBase, ticks) : recording.frameDuration;
   const int64_t pts = packet->pts != AV_NOPTS_VALUE ? packet->pts : packet->dts;
   const LONGLONG deviceTime = pts != AV_NOPTS_VALUE ? av_rescale_q(pts, timeBase, ticks) : AV_NOPTS_VALUE;
 
   const DWORD length = static_cast<DWORD>(packet->size);
   ComPtr<IMFSample> sample;
-  HRESULT hr = makeSample(length, 0, duration, [&](BYTE* data) { std::memcpy(data, packet->data, length); }, sample.GetAddressOf());
+  HRESULT hr = makeSample(
+      length, 0, duration, [&](BYTE* data) { std::memcpy(data, packet->data, length); }, sample.GetAddressOf());
   if (SUCCEEDED(hr) && key) hr = sample->SetUINT32(MFSampleExtension_CleanPoint, TRUE);
   if (FAILED(hr)) return;
   if (!started) {
@@ -798,8 +814,7 @@ void EngineThread::execute(Order& order) {
       }
       stopRecording(order.at);
       break;
-    case Command::Quit:
-      break;
+    case Command::Quit: break;
   }
 }
 

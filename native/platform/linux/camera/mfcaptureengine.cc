@@ -156,9 +156,11 @@ class CaptureEngine : public ComObject<IMFCaptureEngine, IID_IMFCaptureEngine> {
     if (!callback) return E_POINTER;
     if (thread_.joinable()) return MF_E_INVALIDREQUEST;
     UINT32 only = 0;
-    const bool videoOnly = attributes && SUCCEEDED(attributes->GetUINT32(MF_CAPTURE_ENGINE_USE_VIDEO_DEVICE_ONLY, &only)) && only;
+    const bool videoOnly =
+        attributes && SUCCEEDED(attributes->GetUINT32(MF_CAPTURE_ENGINE_USE_VIDEO_DEVICE_ONLY, &only)) && only;
     only = 0;
-    const bool audioOnly = attributes && SUCCEEDED(attributes->GetUINT32(MF_CAPTURE_ENGINE_USE_AUDIO_DEVICE_ONLY, &only)) && only;
+    const bool audioOnly =
+        attributes && SUCCEEDED(attributes->GetUINT32(MF_CAPTURE_ENGINE_USE_AUDIO_DEVICE_ONLY, &only)) && only;
     if (video && !audioOnly) {
       state_->video = deviceFrom(video, true);
       if (!state_->video) return E_INVALIDARG;

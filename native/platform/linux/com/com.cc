@@ -71,8 +71,7 @@ HRESULT PropVariantCopy(PROPVARIANT* destination, const PROPVARIANT* source) {
     case VT_I4:
     case VT_R8:
     case VT_UI4:
-    case VT_UI8:
-      break;
+    case VT_UI8: break;
     case VT_LPWSTR:
       if (source->pwszVal) {
         size_t units = 0;
@@ -93,8 +92,7 @@ HRESULT PropVariantCopy(PROPVARIANT* destination, const PROPVARIANT* source) {
       copy.caub.pElems = static_cast<BYTE*>(CoTaskMemAlloc(source->caub.cElems));
       if (source->caub.cElems) std::memcpy(copy.caub.pElems, source->caub.pElems, source->caub.cElems);
       break;
-    default:
-      return hresult(0x80030001);  // STG_E_INVALIDFUNCTION: a type this layer does not hand out
+    default: return hresult(0x80030001);  // STG_E_INVALIDFUNCTION: a type this layer does not hand out
   }
   *destination = copy;
   return S_OK;

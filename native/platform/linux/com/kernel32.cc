@@ -149,8 +149,8 @@ HANDLE GetCurrentProcess() { return INVALID_HANDLE_VALUE; }  // Windows' pseudo 
 BOOL DuplicateHandle(HANDLE sourceProcess, HANDLE source, HANDLE targetProcess, HANDLE* target, DWORD, BOOL,
                      DWORD options) {
   // Handles of this process only, with the access they have.
-  if (sourceProcess != GetCurrentProcess() || targetProcess != GetCurrentProcess() || !target ||
-      invalid(source) || !(options & DUPLICATE_SAME_ACCESS)) {
+  if (sourceProcess != GetCurrentProcess() || targetProcess != GetCurrentProcess() || !target || invalid(source) ||
+      !(options & DUPLICATE_SAME_ACCESS)) {
     SetLastError(ERROR_INVALID_PARAMETER);
     return FALSE;
   }
@@ -196,8 +196,8 @@ BOOL PowerSetRequest(HANDLE handle, POWER_REQUEST_TYPE) {
     return FALSE;
   }
   if (request->inhibitor >= 0) return TRUE;
-  DBusMessage* call = dbus_message_new_method_call(login1, "/org/freedesktop/login1",
-                                                   "org.freedesktop.login1.Manager", "Inhibit");
+  DBusMessage* call =
+      dbus_message_new_method_call(login1, "/org/freedesktop/login1", "org.freedesktop.login1.Manager", "Inhibit");
   if (!call) {
     SetLastError(ERROR_NOT_ENOUGH_MEMORY);
     return FALSE;

@@ -62,27 +62,35 @@ const Message hresultMessages[] = {
     {0x80040111, "ClassFactory cannot supply requested class"},
     {0x80040154, "Class not registered"},
     // DXGI
-    {0x887A0001, "The application made a call that is invalid. Either the parameters of the call or the state of "
-                 "some object was incorrect.\r\nEnable the D3D debug layer in order to see details via debug messages."},
-    {0x887A0002, "Object was not found. If calling IDXGIFactory::EnumAdaptes, there is no adapter with the "
-                 "specified ordinal."},
+    {0x887A0001,
+     "The application made a call that is invalid. Either the parameters of the call or the state of "
+     "some object was incorrect.\r\nEnable the D3D debug layer in order to see details via debug messages."},
+    {0x887A0002,
+     "Object was not found. If calling IDXGIFactory::EnumAdaptes, there is no adapter with the "
+     "specified ordinal."},
     {0x887A0003, "The caller did not supply a sufficiently large buffer."},
     {0x887A0004, "The specified device interface or feature level is not supported on this system."},
-    {0x887A0005, "The GPU device instance has been suspended. Use GetDeviceRemovedReason to determine the "
-                 "appropriate action."},
-    {0x887A0006, "The GPU will not respond to more commands, most likely because of an invalid command passed by "
-                 "the calling application."},
-    {0x887A0007, "The GPU will not respond to more commands, most likely because some other application submitted "
-                 "invalid commands.\r\nThe calling application should re-create the device and continue."},
-    {0x887A000A, "The GPU was busy at the moment when the call was made, and the call was neither executed nor "
-                 "scheduled."},
+    {0x887A0005,
+     "The GPU device instance has been suspended. Use GetDeviceRemovedReason to determine the "
+     "appropriate action."},
+    {0x887A0006,
+     "The GPU will not respond to more commands, most likely because of an invalid command passed by "
+     "the calling application."},
+    {0x887A0007,
+     "The GPU will not respond to more commands, most likely because some other application submitted "
+     "invalid commands.\r\nThe calling application should re-create the device and continue."},
+    {0x887A000A,
+     "The GPU was busy at the moment when the call was made, and the call was neither executed nor "
+     "scheduled."},
     {0x887A0022, "The requested functionality is not supported by the device or the driver."},
-    {0x887A0026, "The desktop duplication interface is invalid. The desktop duplication interface typically "
-                 "becomes invalid when a different type of image is displayed on the desktop."},
+    {0x887A0026,
+     "The desktop duplication interface is invalid. The desktop duplication interface typically "
+     "becomes invalid when a different type of image is displayed on the desktop."},
     {0x887A0027, "The time-out interval elapsed before the next desktop frame was available."},
     {0x887A0028, "The Remote Desktop Services session is currently disconnected."},
-    {0x887A002B, "You tried to use a resource to which you did not have the required access privileges. This error "
-                 "is most typically caused when you write to a shared resource with read-only access."},
+    {0x887A002B,
+     "You tried to use a resource to which you did not have the required access privileges. This error "
+     "is most typically caused when you write to a shared resource with read-only access."},
     // Media Foundation
     {0xC00D36B0, "Platform not initialized. Please call MFStartup()."},
     {0xC00D36B1, "The buffer was too small to carry out the requested action."},
@@ -92,8 +100,9 @@ const Message hresultMessages[] = {
     {0xC00D36B5, "The callee is currently not accepting further input."},
     {0xC00D36B6, "This object needs to be initialized before the requested operation can be carried out."},
     {0xC00D36B7, "The requested representation is not supported by this object."},
-    {0xC00D36B9, "An object ran out of media types to suggest therefore the requested chain of streaming objects "
-                 "cannot be completed."},
+    {0xC00D36B9,
+     "An object ran out of media types to suggest therefore the requested chain of streaming objects "
+     "cannot be completed."},
     {0xC00D36BA, "The object does not support the specified service."},
     {0xC00D36BB, "An unexpected error has occurred in the operation requested."},
     {0xC00D36BC, "Invalid name."},

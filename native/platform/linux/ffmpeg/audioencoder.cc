@@ -14,14 +14,21 @@ namespace {
 
 bool inputSamples(REFGUID subtype, UINT32 bits, AVSampleFormat* format) {
   if (subtype == MFAudioFormat_Float) {
-    if (bits == 32) *format = AV_SAMPLE_FMT_FLT;
-    else if (bits == 64) *format = AV_SAMPLE_FMT_DBL;
-    else return false;
+    if (bits == 32)
+      *format = AV_SAMPLE_FMT_FLT;
+    else if (bits == 64)
+      *format = AV_SAMPLE_FMT_DBL;
+    else
+      return false;
   } else if (subtype == MFAudioFormat_PCM) {
-    if (bits == 8) *format = AV_SAMPLE_FMT_U8;
-    else if (bits == 16) *format = AV_SAMPLE_FMT_S16;
-    else if (bits == 24 || bits == 32) *format = AV_SAMPLE_FMT_S32;  // 24-bit samples are widened first
-    else return false;
+    if (bits == 8)
+      *format = AV_SAMPLE_FMT_U8;
+    else if (bits == 16)
+      *format = AV_SAMPLE_FMT_S16;
+    else if (bits == 24 || bits == 32)
+      *format = AV_SAMPLE_FMT_S32;  // 24-bit samples are widened first
+    else
+      return false;
   } else {
     return false;
   }

@@ -47,10 +47,10 @@ inline __m128i pairSums(__m128i first, __m128i second) {
 
 // Y' of eight pixels (two unpacked halves each of two loads) as eight 16-bit values.
 inline __m128i luma8(__m128i lo0, __m128i hi0, __m128i lo1, __m128i hi1, __m128i weights, __m128i bias) {
-  const __m128i first = _mm_srai_epi32(
-      _mm_add_epi32(pairSums(_mm_madd_epi16(lo0, weights), _mm_madd_epi16(hi0, weights)), bias), 15);
-  const __m128i second = _mm_srai_epi32(
-      _mm_add_epi32(pairSums(_mm_madd_epi16(lo1, weights), _mm_madd_epi16(hi1, weights)), bias), 15);
+  const __m128i first =
+      _mm_srai_epi32(_mm_add_epi32(pairSums(_mm_madd_epi16(lo0, weights), _mm_madd_epi16(hi0, weights)), bias), 15);
+  const __m128i second =
+      _mm_srai_epi32(_mm_add_epi32(pairSums(_mm_madd_epi16(lo1, weights), _mm_madd_epi16(hi1, weights)), bias), 15);
   return _mm_packs_epi32(first, second);
 }
 
@@ -67,8 +67,8 @@ inline __m128i blockSums(__m128i upperLo, __m128i upperHi, __m128i lowerLo, __m1
 }
 
 // Sixteen columns at a time from column `x` (even); returns the first column left for pairTail.
-int pairWide(const uint8_t* upper, const uint8_t* lower, int x, int width, uint8_t* yUpper, uint8_t* yLower,
-             uint8_t* u, uint8_t* v) {
+int pairWide(const uint8_t* upper, const uint8_t* lower, int x, int width, uint8_t* yUpper, uint8_t* yLower, uint8_t* u,
+             uint8_t* v) {
   const __m128i zero = _mm_setzero_si128();
   const __m128i yWeights = _mm_setr_epi16(yB, yG, yR, 0, yB, yG, yR, 0);
   const __m128i uWeights = _mm_setr_epi16(uB, uG, uR, 0, uB, uG, uR, 0);
@@ -96,10 +96,10 @@ int pairWide(const uint8_t* upper, const uint8_t* lower, int x, int width, uint8
     }
     __m128i blocks[4];
     for (int i = 0; i < 4; ++i) blocks[i] = blockSums(ul[i], uh[i], ll[i], lh[i]);
-    const __m128i cb = _mm_packs_epi32(chroma4(blocks[0], blocks[1], uWeights, cBias),
-                                       chroma4(blocks[2], blocks[3], uWeights, cBias));
-    const __m128i cr = _mm_packs_epi32(chroma4(blocks[0], blocks[1], vWeights, cBias),
-                                       chroma4(blocks[2], blocks[3], vWeights, cBias));
+    const __m128i cb =
+        _mm_packs_epi32(chroma4(blocks[0], blocks[1], uWeights, cBias), chroma4(blocks[2], blocks[3], uWeights, cBias));
+    const __m128i cr =
+        _mm_packs_epi32(chroma4(blocks[0], blocks[1], vWeights, cBias), chroma4(blocks[2], blocks[3], vWeights, cBias));
     _mm_storel_epi64(reinterpret_cast<__m128i*>(u + x / 2), _mm_packus_epi16(cb, cb));
     _mm_storel_epi64(reinterpret_cast<__m128i*>(v + x / 2), _mm_packus_epi16(cr, cr));
   }
@@ -111,7 +111,6 @@ int pairWide(const uint8_t* upper, const uint8_t* lower, int x, int width, uint8
 int pairWide(const uint8_t*, const uint8_t*, int x, int, uint8_t*, uint8_t*, uint8_t*, uint8_t*) { return x; }
 
 #endif
-
 
 #if defined(TAVIO_AVX2)
 

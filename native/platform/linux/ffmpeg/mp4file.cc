@@ -19,7 +19,8 @@ namespace {
 constexpr int bufferSize = 1 << 16;
 
 uint32_t read32(const uint8_t* p) {
-  return static_cast<uint32_t>(p[0]) << 24 | static_cast<uint32_t>(p[1]) << 16 | static_cast<uint32_t>(p[2]) << 8 | p[3];
+  return static_cast<uint32_t>(p[0]) << 24 | static_cast<uint32_t>(p[1]) << 16 | static_cast<uint32_t>(p[2]) << 8 |
+         p[3];
 }
 
 void write32(uint8_t* p, uint32_t v) {
@@ -89,18 +90,11 @@ int Mp4File::writePacket(void* opaque, uint8_t* data, int size) {
 int64_t Mp4File::seek(void* opaque, int64_t offset, int whence) {
   auto* self = static_cast<Mp4File*>(opaque);
   switch (whence & ~AVSEEK_FORCE) {
-    case AVSEEK_SIZE:
-      return self->end_;
-    case SEEK_SET:
-      break;
-    case SEEK_CUR:
-      offset += self->position_;
-      break;
-    case SEEK_END:
-      offset += self->end_;
-      break;
-    default:
-      return AVERROR(EINVAL);
+    case AVSEEK_SIZE: return self->end_;
+    case SEEK_SET: break;
+    case SEEK_CUR: offset += self->position_; break;
+    case SEEK_END: offset += self->end_; break;
+    default: return AVERROR(EINVAL);
   }
   if (offset < 0) return AVERROR(EINVAL);
   self->position_ = offset;
@@ -141,8 +135,10 @@ void Mp4File::stampDurations() {
   uint32_t timescale = 0;
   auto stamp = [&](size_t field, bool wide, double seconds) {
     const uint64_t units = static_cast<uint64_t>(std::llround(std::max(0.0, seconds) * timescale));
-    if (wide) write64(&head[field], units);
-    else write32(&head[field], static_cast<uint32_t>(std::min<uint64_t>(units, UINT32_MAX)));
+    if (wide)
+      write64(&head[field], units);
+    else
+      write32(&head[field], static_cast<uint32_t>(std::min<uint64_t>(units, UINT32_MAX)));
   };
   size_t track = 0;
   forEachBox(head, moov + 8, moov + moovSize, [&](const std::string& type, size_t offset, size_t size) {

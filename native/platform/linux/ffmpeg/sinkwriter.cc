@@ -179,8 +179,6 @@ class SinkWriter : public ComObject<IMFSinkWriter, IID_IMFSinkWriter> {
     return MF_E_INVALIDREQUEST;
   }
 
-
-
   HRESULT Finalize() override {
     std::lock_guard<std::mutex> lock(mutex_);
     if (state_ != State::writing) return MF_E_INVALIDREQUEST;
@@ -206,7 +204,6 @@ class SinkWriter : public ComObject<IMFSinkWriter, IID_IMFSinkWriter> {
     if (SUCCEEDED(hr) && !anyPackets) hr = MF_E_SINK_NO_SAMPLES_PROCESSED;
     return hr;
   }
-
 
   HRESULT GetStatistics(DWORD streamIndex, MF_SINK_WRITER_STATISTICS* stats) override {
     if (!stats) return E_INVALIDARG;

@@ -7,30 +7,21 @@ namespace platform::sinkwriter {
 HRESULT fromErrno(int error) {
   switch (error) {
     case ENOENT:  // the file is being created, so what is missing is a folder
-    case ENOTDIR:
-      return HRESULT_FROM_WIN32(ERROR_PATH_NOT_FOUND);
+    case ENOTDIR: return HRESULT_FROM_WIN32(ERROR_PATH_NOT_FOUND);
     case EACCES:
     case EPERM:
     case EISDIR:  // Windows refuses to open a folder as a file with access denied
       return HRESULT_FROM_WIN32(ERROR_ACCESS_DENIED);
-    case EROFS:
-      return HRESULT_FROM_WIN32(ERROR_WRITE_PROTECT);
-    case ENAMETOOLONG:
-      return HRESULT_FROM_WIN32(ERROR_FILENAME_EXCED_RANGE);
+    case EROFS: return HRESULT_FROM_WIN32(ERROR_WRITE_PROTECT);
+    case ENAMETOOLONG: return HRESULT_FROM_WIN32(ERROR_FILENAME_EXCED_RANGE);
     case ENOSPC:
-    case EDQUOT:
-      return HRESULT_FROM_WIN32(ERROR_DISK_FULL);
+    case EDQUOT: return HRESULT_FROM_WIN32(ERROR_DISK_FULL);
     case EBUSY:
-    case ETXTBSY:
-      return HRESULT_FROM_WIN32(ERROR_SHARING_VIOLATION);
-    case EEXIST:
-      return HRESULT_FROM_WIN32(ERROR_FILE_EXISTS);
-    case EINVAL:
-      return HRESULT_FROM_WIN32(ERROR_INVALID_NAME);
-    case ENOMEM:
-      return E_OUTOFMEMORY;
-    default:
-      return E_FAIL;
+    case ETXTBSY: return HRESULT_FROM_WIN32(ERROR_SHARING_VIOLATION);
+    case EEXIST: return HRESULT_FROM_WIN32(ERROR_FILE_EXISTS);
+    case EINVAL: return HRESULT_FROM_WIN32(ERROR_INVALID_NAME);
+    case ENOMEM: return E_OUTOFMEMORY;
+    default: return E_FAIL;
   }
 }
 

@@ -124,7 +124,6 @@ class StreamEncoder {
   double end() const { return end_; }
 
  protected:
-
   AVFormatContext* format_;
   AVStream* stream_;
   Mp4File* file_;

@@ -37,8 +37,8 @@ class VideoCopy : public StreamEncoder {
     return S_OK;
   }
 
-  HRESULT write(const uint8_t* data, DWORD length, LONGLONG time, bool hasTime, LONGLONG duration,
-                bool hasDuration, bool cleanPoint) override {
+  HRESULT write(const uint8_t* data, DWORD length, LONGLONG time, bool hasTime, LONGLONG duration, bool hasDuration,
+                bool cleanPoint) override {
     clock_.stamp(time, hasTime, duration, hasDuration);
     if (length == 0) return S_OK;  // nothing to copy
     int result = av_new_packet(packet_.get(), static_cast<int>(length));

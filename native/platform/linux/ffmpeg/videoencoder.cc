@@ -27,13 +27,20 @@ struct InputPicture {
 
 bool inputPicture(REFGUID subtype, InputPicture* picture) {
   // Media Foundation's RGB32 and ARGB32 lie in memory as B, G, R, X/A; RGB24 as B, G, R.
-  if (subtype == MFVideoFormat_RGB32) *picture = {AV_PIX_FMT_BGR0, 4, true};
-  else if (subtype == MFVideoFormat_ARGB32) *picture = {AV_PIX_FMT_BGRA, 4, true};
-  else if (subtype == MFVideoFormat_RGB24) *picture = {AV_PIX_FMT_BGR24, 3, true};
-  else if (subtype == MFVideoFormat_NV12) *picture = {AV_PIX_FMT_NV12, 0, false};
-  else if (subtype == MFVideoFormat_YUY2) *picture = {AV_PIX_FMT_YUYV422, 2, false};
-  else if (subtype == MFVideoFormat_I420 || subtype == MFVideoFormat_IYUV) *picture = {AV_PIX_FMT_YUV420P, 0, false};
-  else return false;
+  if (subtype == MFVideoFormat_RGB32)
+    *picture = {AV_PIX_FMT_BGR0, 4, true};
+  else if (subtype == MFVideoFormat_ARGB32)
+    *picture = {AV_PIX_FMT_BGRA, 4, true};
+  else if (subtype == MFVideoFormat_RGB24)
+    *picture = {AV_PIX_FMT_BGR24, 3, true};
+  else if (subtype == MFVideoFormat_NV12)
+    *picture = {AV_PIX_FMT_NV12, 0, false};
+  else if (subtype == MFVideoFormat_YUY2)
+    *picture = {AV_PIX_FMT_YUYV422, 2, false};
+  else if (subtype == MFVideoFormat_I420 || subtype == MFVideoFormat_IYUV)
+    *picture = {AV_PIX_FMT_YUV420P, 0, false};
+  else
+    return false;
   return true;
 }
 
@@ -71,8 +78,9 @@ class VideoEncoder : public StreamEncoder {
     // costs a fraction of swscale's, which matters at 60 frames a second.
     directI420_ = picture_.bytesPerPixel == 4 && target == AV_PIX_FMT_YUV420P && inWidth_ == static_cast<int>(width) &&
                   inHeight_ == static_cast<int>(height);
-    if (!directI420_) scaler_.reset(sws_getContext(inWidth_, inHeight_, picture_.format, static_cast<int>(width), static_cast<int>(height),
-                                 target, SWS_BILINEAR, nullptr, nullptr, nullptr));
+    if (!directI420_)
+      scaler_.reset(sws_getContext(inWidth_, inHeight_, picture_.format, static_cast<int>(width),
+                                   static_cast<int>(height), target, SWS_BILINEAR, nullptr, nullptr, nullptr));
     if (!directI420_) {
       if (!scaler_) return MF_E_INVALIDMEDIATYPE;
       // BT.709, limited range, as the stream declares.
@@ -89,8 +97,8 @@ class VideoEncoder : public StreamEncoder {
     return describe();
   }
 
-  HRESULT write(const uint8_t* data, DWORD length, LONGLONG time, bool hasTime, LONGLONG duration,
-                bool hasDuration, bool) override {
+  HRESULT write(const uint8_t* data, DWORD length, LONGLONG time, bool hasTime, LONGLONG duration, bool hasDuration,
+                bool) override {
     clock_.stamp(time, hasTime, duration, hasDuration);
     if (static_cast<int64_t>(length) < requiredLength()) return MF_E_BUFFERTOOSMALL;
 
@@ -199,12 +207,9 @@ class VideoEncoder : public StreamEncoder {
 
   static const char* profileName(UINT32 profile) {
     switch (profile) {
-      case eAVEncH264VProfile_Main:
-        return "main";
-      case eAVEncH264VProfile_High:
-        return "high";
-      default:
-        return "baseline";  // Base and ConstrainedBase, and Media Foundation's default
+      case eAVEncH264VProfile_Main: return "main";
+      case eAVEncH264VProfile_High: return "high";
+      default: return "baseline";  // Base and ConstrainedBase, and Media Foundation's default
     }
   }
 
@@ -218,8 +223,9 @@ class VideoEncoder : public StreamEncoder {
 
   bool openNvenc(UINT32 width, UINT32 height, int64_t bitRate, UINT32 profile) {
     if (access("/dev/nvidiactl", R_OK | W_OK) != 0) return false;
-    return openSoftwareInput("h264_nvenc", width, height, bitRate,
-                             {{"preset", "p2"}, {"tune", "ll"}, {"zerolatency", "1"}, {"profile", profileName(profile)}});
+    return openSoftwareInput(
+        "h264_nvenc", width, height, bitRate,
+        {{"preset", "p2"}, {"tune", "ll"}, {"zerolatency", "1"}, {"profile", profileName(profile)}});
   }
 
   // Opens an encoder that takes yuv420p frames from memory, with its private options.

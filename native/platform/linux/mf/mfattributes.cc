@@ -28,26 +28,18 @@ size_t units(const wchar_t* text) {
 bool equalValues(const PROPVARIANT& a, const PROPVARIANT& b) {
   if (a.vt != b.vt) return false;
   switch (a.vt) {
-    case VT_EMPTY:
-      return true;
+    case VT_EMPTY: return true;
     case VT_I4:
-    case VT_UI4:
-      return a.ulVal == b.ulVal;
-    case VT_UI8:
-      return a.uhVal == b.uhVal;
-    case VT_R8:
-      return a.dblVal == b.dblVal;
-    case VT_CLSID:
-      return a.puuid && b.puuid && *a.puuid == *b.puuid;
-    case VT_LPWSTR:
-      return a.pwszVal && b.pwszVal && std::wcscmp(a.pwszVal, b.pwszVal) == 0;
-    case VT_UNKNOWN:
-      return a.punkVal == b.punkVal;
+    case VT_UI4: return a.ulVal == b.ulVal;
+    case VT_UI8: return a.uhVal == b.uhVal;
+    case VT_R8: return a.dblVal == b.dblVal;
+    case VT_CLSID: return a.puuid && b.puuid && *a.puuid == *b.puuid;
+    case VT_LPWSTR: return a.pwszVal && b.pwszVal && std::wcscmp(a.pwszVal, b.pwszVal) == 0;
+    case VT_UNKNOWN: return a.punkVal == b.punkVal;
     case VT_VECTOR | VT_UI1:
       return a.caub.cElems == b.caub.cElems &&
              (a.caub.cElems == 0 || std::memcmp(a.caub.pElems, b.caub.pElems, a.caub.cElems) == 0);
-    default:
-      return false;
+    default: return false;
   }
 }
 
@@ -140,18 +132,10 @@ HRESULT AttributeStore::compare(IMFAttributes* self, IMFAttributes* theirs, MF_A
   UINT32 ours = static_cast<UINT32>(items_.size()), theirCount = 0;
   theirs->GetCount(&theirCount);
   switch (matchType) {
-    case MF_ATTRIBUTES_MATCH_OUR_ITEMS:
-      *result = contained(self, theirs, false);
-      break;
-    case MF_ATTRIBUTES_MATCH_THEIR_ITEMS:
-      *result = contained(theirs, self, false);
-      break;
-    case MF_ATTRIBUTES_MATCH_ALL_ITEMS:
-      *result = ours == theirCount && contained(self, theirs, false);
-      break;
-    case MF_ATTRIBUTES_MATCH_INTERSECTION:
-      *result = contained(self, theirs, true);
-      break;
+    case MF_ATTRIBUTES_MATCH_OUR_ITEMS: *result = contained(self, theirs, false); break;
+    case MF_ATTRIBUTES_MATCH_THEIR_ITEMS: *result = contained(theirs, self, false); break;
+    case MF_ATTRIBUTES_MATCH_ALL_ITEMS: *result = ours == theirCount && contained(self, theirs, false); break;
+    case MF_ATTRIBUTES_MATCH_INTERSECTION: *result = contained(self, theirs, true); break;
     case MF_ATTRIBUTES_MATCH_SMALLER:
       *result = ours <= theirCount ? contained(self, theirs, false) : contained(theirs, self, false);
       break;
@@ -356,7 +340,8 @@ HRESULT AttributeStore::copyAllItems(IMFAttributes* destination) {
   if (!destination) return E_POINTER;
   std::lock_guard<std::recursive_mutex> lock(mutex_);
   HRESULT hr = destination->DeleteAllItems();
-  for (size_t i = 0; SUCCEEDED(hr) && i < items_.size(); ++i) hr = destination->SetItem(items_[i].first, items_[i].second);
+  for (size_t i = 0; SUCCEEDED(hr) && i < items_.size(); ++i)
+    hr = destination->SetItem(items_[i].first, items_[i].second);
   return hr;
 }
 
@@ -411,7 +396,6 @@ class MediaType : public Attributes<IMFMediaType, IID_IMFMediaType> {
     PropVariantClear(&theirData);
     return *flags == 0xF ? S_OK : S_FALSE;
   }
-
 };
 
 }  // namespace

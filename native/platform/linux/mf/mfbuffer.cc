@@ -162,7 +162,9 @@ class Collection : public ComObject<IMFCollection, IID_IMFCollection> {
     *element = nullptr;
     return elements_[index] ? elements_[index].CopyTo(element) : S_OK;
   }
-  HRESULT AddElement(IUnknown* element) override { return InsertElementAt(static_cast<DWORD>(elements_.size()), element); }
+  HRESULT AddElement(IUnknown* element) override {
+    return InsertElementAt(static_cast<DWORD>(elements_.size()), element);
+  }
   HRESULT RemoveElement(DWORD index, IUnknown** element) override {
     if (!element) return E_POINTER;
     if (index >= elements_.size()) return E_INVALIDARG;

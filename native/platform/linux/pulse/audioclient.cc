@@ -198,7 +198,6 @@ class CaptureClient : public ComObject<IAudioCaptureClient, IID_IAudioCaptureCli
     return S_OK;
   }
 
-
  private:
   std::shared_ptr<Stream> s_;
 };
@@ -256,26 +255,31 @@ class AudioClient : public ComObject<IAudioClient, IID_IAudioClient> {
     if (shareMode != AUDCLNT_SHAREMODE_SHARED) return AUDCLNT_E_EXCLUSIVE_MODE_NOT_ALLOWED;
     // Event-driven clients are not offered: nothing here waits on events.
     if (streamFlags & AUDCLNT_STREAMFLAGS_EVENTCALLBACK) return E_NOTIMPL;
-    if (streamFlags & ~(AUDCLNT_STREAMFLAGS_LOOPBACK | AUDCLNT_STREAMFLAGS_CROSSPROCESS | AUDCLNT_STREAMFLAGS_NOPERSIST))
+    if (streamFlags &
+        ~(AUDCLNT_STREAMFLAGS_LOOPBACK | AUDCLNT_STREAMFLAGS_CROSSPROCESS | AUDCLNT_STREAMFLAGS_NOPERSIST))
       return E_INVALIDARG;
     pa_sample_spec sampleSpec;
     pa_channel_map map;
-    if (!pulse::specOf(format, sampleSpec, map, &sink_.map) || sampleSpec.rate != sink_.sampleSpec.rate || sampleSpec.channels != sink_.sampleSpec.channels)
+    if (!pulse::specOf(format, sampleSpec, map, &sink_.map) || sampleSpec.rate != sink_.sampleSpec.rate ||
+        sampleSpec.channels != sink_.sampleSpec.channels)
       return AUDCLNT_E_UNSUPPORTED_FORMAT;
 
     Stream& s = *s_;
     s.loopback = (streamFlags & AUDCLNT_STREAMFLAGS_LOOPBACK) != 0;
     s.sampleSpec = sampleSpec;
     s.frameBytes = static_cast<uint32_t>(pa_frame_size(&sampleSpec));
-    s.bufferFrames = static_cast<uint32_t>(std::max<int64_t>(bufferDuration, kShortestBuffer) * sampleSpec.rate / kUnitsPerSecond);
+    s.bufferFrames =
+        static_cast<uint32_t>(std::max<int64_t>(bufferDuration, kShortestBuffer) * sampleSpec.rate / kUnitsPerSecond);
 
     Lock lock(*s.connection);
     if (pa_context_get_state(s.connection->context()) != PA_CONTEXT_READY) return AUDCLNT_E_DEVICE_INVALIDATED;
     pa_stream* stream = pa_stream_new(s.connection->context(), s.loopback ? "Loopback" : "Playback", &sampleSpec, &map);
     if (!stream) return AUDCLNT_E_UNSUPPORTED_FORMAT;
     pa_stream_set_state_callback(stream, streamStateChanged, &s);
-    if (s.loopback) pa_stream_set_read_callback(stream, streamReadable, &s);
-    else pa_stream_set_write_callback(stream, streamWritable, &s);
+    if (s.loopback)
+      pa_stream_set_read_callback(stream, streamReadable, &s);
+    else
+      pa_stream_set_write_callback(stream, streamWritable, &s);
     pa_buffer_attr attr;
     attr.maxlength = static_cast<uint32_t>(-1);
     attr.prebuf = static_cast<uint32_t>(-1);
@@ -283,11 +287,11 @@ class AudioClient : public ComObject<IAudioClient, IID_IAudioClient> {
     attr.tlength = s.bytesOf(kPlaybackTarget);
     attr.fragsize = s.bytesOf(kRecordFragment);
     // A vanished sink ends the stream instead of moving it elsewhere, so capture sees it.
-    const auto flags = static_cast<pa_stream_flags_t>(PA_STREAM_START_CORKED | PA_STREAM_ADJUST_LATENCY |
-                                                      PA_STREAM_DONT_MOVE);
-    const int connected = s.loopback ? pa_stream_connect_record(stream, sink_.monitor.c_str(), &attr, flags)
-                                     : pa_stream_connect_playback(stream, sink_.name.c_str(), &attr, flags, nullptr,
-                                                                  nullptr);
+    const auto flags =
+        static_cast<pa_stream_flags_t>(PA_STREAM_START_CORKED | PA_STREAM_ADJUST_LATENCY | PA_STREAM_DONT_MOVE);
+    const int connected = s.loopback
+                              ? pa_stream_connect_record(stream, sink_.monitor.c_str(), &attr, flags)
+                              : pa_stream_connect_playback(stream, sink_.name.c_str(), &attr, flags, nullptr, nullptr);
     pa_stream_state_t state = connected < 0 ? PA_STREAM_FAILED : pa_stream_get_state(stream);
     while (state == PA_STREAM_CREATING || state == PA_STREAM_UNCONNECTED) {
       pa_threaded_mainloop_wait(s.connection->loop());
@@ -310,7 +314,6 @@ class AudioClient : public ComObject<IAudioClient, IID_IAudioClient> {
     *frames = s_->bufferFrames;
     return S_OK;
   }
-
 
   // Playback: what is queued beyond what the server asks for now. Capture: the next packet.
   HRESULT GetCurrentPadding(UINT32* frames) override {
@@ -347,7 +350,6 @@ class AudioClient : public ComObject<IAudioClient, IID_IAudioClient> {
     return S_OK;
   }
 
-
   HRESULT Start() override { return cork(false); }
 
   HRESULT Reset() override {
@@ -357,13 +359,14 @@ class AudioClient : public ComObject<IAudioClient, IID_IAudioClient> {
     if (s_->holding) return AUDCLNT_E_BUFFER_OPERATION_PENDING;
     if (s_->invalid()) return AUDCLNT_E_DEVICE_INVALIDATED;
     s_->connection->wait(pa_stream_flush(s_->stream, nullptr, nullptr));
-    if (s_->loopback) s_->readable = pa_stream_readable_size(s_->stream);
-    else s_->writable = pa_stream_writable_size(s_->stream);
+    if (s_->loopback)
+      s_->readable = pa_stream_readable_size(s_->stream);
+    else
+      s_->writable = pa_stream_writable_size(s_->stream);
     s_->position = 0;
     s_->anchored = false;
     return S_OK;
   }
-
 
   HRESULT GetService(REFIID riid, void** object) override {
     if (!object) return E_POINTER;
@@ -412,8 +415,7 @@ UINT64 performanceCounterPosition() {
   return static_cast<UINT64>(now.tv_sec) * kUnitsPerSecond + static_cast<UINT64>(now.tv_nsec) / 100;
 }
 
-HRESULT createAudioClient(std::shared_ptr<Connection> connection, const std::string& sink, REFIID riid,
-                          void** object) {
+HRESULT createAudioClient(std::shared_ptr<Connection> connection, const std::string& sink, REFIID riid, void** object) {
   pulse::Sink info;
   if (!connection->findSink(sink, info)) return AUDCLNT_E_DEVICE_INVALIDATED;
   return createInstance<AudioClient>(riid, object, std::move(connection), info);

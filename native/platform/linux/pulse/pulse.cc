@@ -25,8 +25,10 @@ struct SinkQuery {
 
 void collectSink(pa_context*, const pa_sink_info* info, int eol, void* data) {
   auto* query = static_cast<SinkQuery*>(data);
-  if (eol == 0 && info) query->found.push_back(sinkOf(info));
-  else pa_threaded_mainloop_signal(query->loop, 0);
+  if (eol == 0 && info)
+    query->found.push_back(sinkOf(info));
+  else
+    pa_threaded_mainloop_signal(query->loop, 0);
 }
 
 struct ServerQuery {
@@ -77,9 +79,7 @@ Connection::~Connection() {
   if (loop_) pa_threaded_mainloop_free(loop_);
 }
 
-bool Connection::connected() {
-  return context_ && ready();
-}
+bool Connection::connected() { return context_ && ready(); }
 
 bool Connection::wait(pa_operation* operation) {
   if (!operation) return false;

@@ -106,8 +106,10 @@ bool specOf(const WAVEFORMATEX* format, pa_sample_spec& sampleSpec, pa_channel_m
                           format->cbSize >= sizeof(WAVEFORMATEXTENSIBLE) - sizeof(WAVEFORMATEX);
   const auto* wide = reinterpret_cast<const WAVEFORMATEXTENSIBLE*>(format);
   if (extensible) {
-    if (wide->SubFormat == KSDATAFORMAT_SUBTYPE_IEEE_FLOAT) isFloat = true;
-    else if (!(wide->SubFormat == KSDATAFORMAT_SUBTYPE_PCM)) return false;
+    if (wide->SubFormat == KSDATAFORMAT_SUBTYPE_IEEE_FLOAT)
+      isFloat = true;
+    else if (!(wide->SubFormat == KSDATAFORMAT_SUBTYPE_PCM))
+      return false;
   } else if (format->wFormatTag == WAVE_FORMAT_IEEE_FLOAT) {
     isFloat = true;
   } else if (format->wFormatTag != WAVE_FORMAT_PCM) {
@@ -115,12 +117,18 @@ bool specOf(const WAVEFORMATEX* format, pa_sample_spec& sampleSpec, pa_channel_m
   }
   const unsigned bits = format->wBitsPerSample;
   if (format->nBlockAlign != format->nChannels * bits / 8) return false;
-  if (isFloat && bits == 32) sampleSpec.format = PA_SAMPLE_FLOAT32LE;
-  else if (!isFloat && bits == 8) sampleSpec.format = PA_SAMPLE_U8;
-  else if (!isFloat && bits == 16) sampleSpec.format = PA_SAMPLE_S16LE;
-  else if (!isFloat && bits == 24) sampleSpec.format = PA_SAMPLE_S24LE;
-  else if (!isFloat && bits == 32) sampleSpec.format = PA_SAMPLE_S32LE;
-  else return false;
+  if (isFloat && bits == 32)
+    sampleSpec.format = PA_SAMPLE_FLOAT32LE;
+  else if (!isFloat && bits == 8)
+    sampleSpec.format = PA_SAMPLE_U8;
+  else if (!isFloat && bits == 16)
+    sampleSpec.format = PA_SAMPLE_S16LE;
+  else if (!isFloat && bits == 24)
+    sampleSpec.format = PA_SAMPLE_S24LE;
+  else if (!isFloat && bits == 32)
+    sampleSpec.format = PA_SAMPLE_S32LE;
+  else
+    return false;
   sampleSpec.rate = format->nSamplesPerSec;
   sampleSpec.channels = static_cast<uint8_t>(format->nChannels);
   if (!pa_sample_spec_valid(&sampleSpec)) return false;

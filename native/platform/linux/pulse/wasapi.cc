@@ -137,8 +137,6 @@ class Enumerator : public ComObject<IMMDeviceEnumerator, IID_IMMDeviceEnumerator
 
 }  // namespace
 
-HRESULT createDeviceEnumerator(REFIID riid, void** object) {
-  return createInstance<Enumerator>(riid, object);
-}
+HRESULT createDeviceEnumerator(REFIID riid, void** object) { return createInstance<Enumerator>(riid, object); }
 
 }  // namespace platform::wasapi

@@ -43,9 +43,7 @@ Connection connect(const std::string& name) {
   return Connection(connection, &xcb_disconnect);
 }
 
-int screenCount(xcb_connection_t* connection) {
-  return xcb_setup_roots_length(xcb_get_setup(connection));
-}
+int screenCount(xcb_connection_t* connection) { return xcb_setup_roots_length(xcb_get_setup(connection)); }
 
 xcb_screen_t* screenOf(xcb_connection_t* connection, int index) {
   auto it = xcb_setup_roots_iterator(xcb_get_setup(connection));

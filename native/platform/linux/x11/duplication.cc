@@ -150,7 +150,7 @@ bool Duplication::setUp() {
       pixels_.green = v.data->green_mask;
       pixels_.blue = v.data->blue_mask;
       convertible_ = convertible_ && v.data->_class == XCB_VISUAL_CLASS_TRUE_COLOR && pixels_.red && pixels_.green &&
-                    pixels_.blue && (pixels_.pad == 8 || pixels_.pad == 16 || pixels_.pad == 32);
+                     pixels_.blue && (pixels_.pad == 8 || pixels_.pad == 16 || pixels_.pad == 32);
     }
   }
   if (convertible_ && !pixels_.words()) {
@@ -203,7 +203,8 @@ bool Duplication::setUp() {
   const xcb_query_extension_reply_t* render = xcb_get_extension_data(c, &xcb_render_id);
   xcb_render_pictformat_t rootFormat = 0;
   const bool ownConversionFaster = convertible_ && pixels_.bytes == 4 && !pixels_.words();
-  if (!ownConversionFaster && shm_ && shm->shared_pixmaps && shm->pixmap_format == XCB_IMAGE_FORMAT_Z_PIXMAP && render && render->present) {
+  if (!ownConversionFaster && shm_ && shm->shared_pixmaps && shm->pixmap_format == XCB_IMAGE_FORMAT_Z_PIXMAP &&
+      render && render->present) {
     free(xcb_render_query_version_reply(c, xcb_render_query_version(c, 0, 11), nullptr));
     if (findFormats(c, screen, &argbFormat_, &rootFormat)) {
       rootPicture_ = xcb_generate_id(c);
@@ -226,7 +227,8 @@ void Duplication::convert(const uint8_t* from, size_t fromStride, uint8_t* to, i
   const uint32_t width = monitor_.width;
   if (pixels_.words()) {
     if (from != to)
-      for (int32_t y = 0; y < rows; ++y) std::memcpy(to + y * size_t{width} * 4, from + y * fromStride, size_t{width} * 4);
+      for (int32_t y = 0; y < rows; ++y)
+        std::memcpy(to + y * size_t{width} * 4, from + y * fromStride, size_t{width} * 4);
     // The server leaves the padding byte of a 24-bit pixel at 0; the format promises opaque alpha.
     auto* words = reinterpret_cast<uint32_t*>(to);
     const size_t count = size_t{width} * rows;
@@ -330,8 +332,8 @@ bool Duplication::pointerMoved() {
 
 // XFIXES gives premultiplied ARGB words; shapes are handed on as B, G, R, A with straight alpha.
 void Duplication::fetchCursor() {
-  auto image = own(xcb_xfixes_get_cursor_image_reply(connection_.get(),
-                                                     xcb_xfixes_get_cursor_image(connection_.get()), nullptr));
+  auto image = own(
+      xcb_xfixes_get_cursor_image_reply(connection_.get(), xcb_xfixes_get_cursor_image(connection_.get()), nullptr));
   if (!image) return;
   cursorWidth_ = image->width;
   cursorHeight_ = image->height;
@@ -494,10 +496,10 @@ bool Duplication::fetch(d3d11::TextureMemory& memory, int32_t top, int32_t rows)
   uint8_t* at = memory.data() + static_cast<size_t>(top) * rowBytes;
   if (picture_) {
     // The check's round trip also tells that the server has written the rows.
-    return !failed(c, xcb_render_composite_checked(c, XCB_RENDER_PICT_OP_SRC, rootPicture_, XCB_NONE, picture_,
-                                                   monitor_.x, static_cast<int16_t>(monitor_.y + top), 0, 0, 0,
-                                                   static_cast<int16_t>(top), monitor_.width,
-                                                   static_cast<uint16_t>(rows)));
+    return !failed(
+        c, xcb_render_composite_checked(c, XCB_RENDER_PICT_OP_SRC, rootPicture_, XCB_NONE, picture_, monitor_.x,
+                                        static_cast<int16_t>(monitor_.y + top), 0, 0, 0, static_cast<int16_t>(top),
+                                        monitor_.width, static_cast<uint16_t>(rows)));
   }
   if (!convertible_) return false;
   const size_t stride = pixels_.stride(monitor_.width);
@@ -511,11 +513,11 @@ bool Duplication::fetch(d3d11::TextureMemory& memory, int32_t top, int32_t rows)
     if (!image) return false;
     convert(at, stride, at, rows);
   } else {
-    auto image = own(xcb_get_image_reply(c,
-                                         xcb_get_image(c, XCB_IMAGE_FORMAT_Z_PIXMAP, root_, monitor_.x,
-                                                       static_cast<int16_t>(monitor_.y + top), monitor_.width,
-                                                       static_cast<uint16_t>(rows), ~0u),
-                                         nullptr));
+    auto image = own(xcb_get_image_reply(
+        c,
+        xcb_get_image(c, XCB_IMAGE_FORMAT_Z_PIXMAP, root_, monitor_.x, static_cast<int16_t>(monitor_.y + top),
+                      monitor_.width, static_cast<uint16_t>(rows), ~0u),
+        nullptr));
     if (!image || static_cast<size_t>(xcb_get_image_data_length(image.get())) < stride * rows) return false;
     convert(xcb_get_image_data(image.get()), stride, at, rows);
   }

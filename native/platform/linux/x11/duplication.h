@@ -81,8 +81,8 @@ class Duplication : public platform::ComObject<IDXGIOutputDuplication, IID_IDXGI
     uint32_t pad = 32;
     size_t stride(uint32_t width) const { return (static_cast<size_t>(width) * bytes * 8 + pad - 1) / pad * (pad / 8); }
     bool words() const { return bytes == 4 && red == 0xFF0000 && green == 0xFF00 && blue == 0xFF; }
-    std::vector<uint32_t> words16;      // 2-byte pixels: the word of every value
-    std::vector<uint8_t> levels[3];     // 4-byte pixels: the level of every blue, green, red value
+    std::vector<uint32_t> words16;   // 2-byte pixels: the word of every value
+    std::vector<uint8_t> levels[3];  // 4-byte pixels: the level of every blue, green, red value
   } pixels_;
   bool convertible_ = false;
 

@@ -42,7 +42,8 @@ class Output : public platform::ComObject<IDXGIOutput1, IID_IDXGIObject, IID_IDX
 
 std::string atomName(xcb_connection_t* connection, xcb_atom_t atom) {
   std::string text;
-  if (xcb_get_atom_name_reply_t* reply = xcb_get_atom_name_reply(connection, xcb_get_atom_name(connection, atom), nullptr)) {
+  if (xcb_get_atom_name_reply_t* reply =
+          xcb_get_atom_name_reply(connection, xcb_get_atom_name(connection, atom), nullptr)) {
     text.assign(xcb_get_atom_name_name(reply), static_cast<size_t>(xcb_get_atom_name_name_length(reply)));
     free(reply);
   }
@@ -70,7 +71,6 @@ class Adapter : public platform::ComObject<IDXGIAdapter1, IID_IDXGIObject, IID_I
     *output = new Output(display_, screen_, desc, m.name, atomName(connection_.get(), m.name));
     return S_OK;
   }
-
 
  private:
   std::string display_;

@@ -41,8 +41,8 @@ bool sendClientMessage(xcb_connection_t* connection, xcb_window_t destination, x
   event.window = window;
   event.type = type;
   for (int i = 0; i < 5; ++i) event.data.data32[i] = data[i];
-  xcb_void_cookie_t cookie = xcb_send_event_checked(connection, 0, destination, eventMask,
-                                                    reinterpret_cast<const char*>(&event));
+  xcb_void_cookie_t cookie =
+      xcb_send_event_checked(connection, 0, destination, eventMask, reinterpret_cast<const char*>(&event));
   xcb_generic_error_t* error = xcb_request_check(connection, cookie);
   std::free(error);
   return error == nullptr;

@@ -68,8 +68,8 @@ HRESULT CaptureManager::Initialize(IUnknown* audioDevice, IUnknown* videoDevice)
   ComPtr<ID3D11DeviceContext> context;
   D3D_FEATURE_LEVEL level{};
   HRESULT hr = D3D11CreateDevice(nullptr, D3D_DRIVER_TYPE_HARDWARE, nullptr, D3D11_CREATE_DEVICE_VIDEO_SUPPORT, levels,
-                                 sizeof(levels) / sizeof(levels[0]), D3D11_SDK_VERSION, d3dDevice.GetAddressOf(), &level,
-                                 context.GetAddressOf());
+                                 sizeof(levels) / sizeof(levels[0]), D3D11_SDK_VERSION, d3dDevice.GetAddressOf(),
+                                 &level, context.GetAddressOf());
   if (SUCCEEDED(hr)) {
     ComPtr<ID3D10Multithread> multithread;
     hr = d3dDevice->QueryInterface(IID_ID3D10Multithread, reinterpret_cast<void**>(multithread.GetAddressOf()));
@@ -204,9 +204,8 @@ CaptureManager::Mark::~Mark() {
 
 void CaptureManager::mark(Mark& before) const {
   for (int kind = 0; kind < EventKinds; ++kind) before.handled[kind] = handled_[kind].load();
-  if (engineEvent &&
-      !DuplicateHandle(GetCurrentProcess(), engineEvent, GetCurrentProcess(), &before.event, 0, FALSE,
-                       DUPLICATE_SAME_ACCESS))
+  if (engineEvent && !DuplicateHandle(GetCurrentProcess(), engineEvent, GetCurrentProcess(), &before.event, 0, FALSE,
+                                      DUPLICATE_SAME_ACCESS))
     before.event = nullptr;
 }
 

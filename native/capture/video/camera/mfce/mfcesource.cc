@@ -38,13 +38,13 @@ MFCESource::MFCESource(IMFActivate* audioDevice, IMFActivate* videoDevice, bool 
 
   if (audioDevice) {
     this->audioDevice = audioDevice;
-    audioName = friendlyName(audioDevice, "Webcam Audio Name Placeholder", 62,
-                             "Could not retrieve device audio friendly name");
+    audioName =
+        friendlyName(audioDevice, "Webcam Audio Name Placeholder", 62, "Could not retrieve device audio friendly name");
   }
   if (videoDevice) {
     this->videoDevice = videoDevice;
-    videoName = friendlyName(videoDevice, "Webcam Video Name Placeholder", 81,
-                             "Could not retrieve device video friendly name");
+    videoName =
+        friendlyName(videoDevice, "Webcam Video Name Placeholder", 81, "Could not retrieve device video friendly name");
   }
   frameQueue = nullptr;
   capturing = false;
@@ -94,7 +94,8 @@ void MFCESource::startPreview() {
     frameQueue = new capture::video::FrameQueue(std::wstring(), width, height, static_cast<uint32_t>(channelOrder()));
   }
   if (!captureManager->engine)
-    checkResult(file, 230, MF_E_NOT_INITIALIZED, "MFCESource::startPreview() could not start preview: StartPreview() failed");
+    checkResult(file, 230, MF_E_NOT_INITIALIZED,
+                "MFCESource::startPreview() could not start preview: StartPreview() failed");
   if (!captureManager->IsPreviewing())
     checkResult(file, 230, captureManager->StartPreview(frameQueue),
                 "MFCESource::startPreview() could not start preview: StartPreview() failed");

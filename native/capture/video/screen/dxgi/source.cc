@@ -79,9 +79,10 @@ void Source::capture() {
   }
   if (hr == DXGI_ERROR_WAIT_TIMEOUT) return;
 
-  updatePointer(pointer, frameInfo, [this](UINT size, void* buffer, UINT* required, DXGI_OUTDUPL_POINTER_SHAPE_INFO* info) {
-    return duplication->GetFramePointerShape(size, buffer, required, info);
-  });
+  updatePointer(pointer, frameInfo,
+                [this](UINT size, void* buffer, UINT* required, DXGI_OUTDUPL_POINTER_SHAPE_INFO* info) {
+                  return duplication->GetFramePointerShape(size, buffer, required, info);
+                });
 
   ComPtr<ID3D11Texture2D> texture;
   hr = resource ? resource->QueryInterface(IID_ID3D11Texture2D, reinterpret_cast<void**>(texture.GetAddressOf()))
@@ -127,8 +128,8 @@ void Source::startEncode(std::string filename) {
     const int64_t now = capture::currentTimeMillis();
     if (clip && clip->stop.load() == 0) clip->stop = now;
     queue->path = capture::toWide(filename);
-    started = std::make_shared<capture::video::Clip>(
-        queue->path, now, queue->frames.empty() ? nullptr : queue->frames.back()->clone());
+    started = std::make_shared<capture::video::Clip>(queue->path, now,
+                                                     queue->frames.empty() ? nullptr : queue->frames.back()->clone());
     clip = started;
     queue->stopped = false;
   }
