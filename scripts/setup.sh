@@ -4,7 +4,7 @@
 set -euo pipefail
 
 packages=(
-  build-essential python3 pkg-config cmake git
+  build-essential python3 pkg-config cmake git clang-format clang-tidy
   libgtest-dev libgmock-dev googletest
   libavformat-dev libavcodec-dev libavdevice-dev libavutil-dev libswscale-dev libswresample-dev
   libxcb1-dev libxcb-shm0-dev libxcb-damage0-dev libxcb-xfixes0-dev libxcb-randr0-dev libxcb-render0-dev

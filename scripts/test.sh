@@ -1,5 +1,6 @@
 #!/usr/bin/env bash
-# Every test: the add-on and the unit tests are built, the unit tests run plainly, under
+# Every test: the add-on and the unit tests are built, the C++ files are checked for format and
+# lint, the unit tests run plainly, under
 # AddressSanitizer + UndefinedBehaviorSanitizer and under ThreadSanitizer, then the Windows checks
 # (every Windows source compiles; the capture code links for Windows and its unit tests and start-up
 # run under Wine), then the JavaScript integration tests (each starts its own Xvfb and PulseAudio).
@@ -22,6 +23,8 @@ unit() {  # unit <folder> <cmake options...>
 
 echo "== unit tests"
 unit build-test
+echo "== format and lint"
+bash scripts/lint.sh build-test
 echo "== unit tests, address and undefined-behaviour sanitizers"
 ASAN_OPTIONS=detect_leaks=1 unit build-asan -DSANITIZE=address,undefined
 echo "== unit tests, thread sanitizer"
