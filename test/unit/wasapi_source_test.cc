@@ -387,6 +387,7 @@ struct Failure {
   HRESULT result;
   const char* text;
 };
+void PrintTo(const Failure& failure, std::ostream* out) { *out << failure.text; }
 
 class WasapiSourceFailure : public WasapiSource, public testing::WithParamInterface<Failure> {};
 
