@@ -23,6 +23,7 @@ const os = require('os');
 const path = require('path');
 const { startDesktop } = require('../scripts/desktop');
 const { runAddon } = require('../test/js/addon');
+const { CLOCK, CLOCK_READER } = require('./clockcamera');
 
 const seconds = Number(process.argv[2] || 20);
 const SOURCE = 'testsrc2=size=1280x720:rate=30';
@@ -30,11 +31,6 @@ const BITRATE = 9216000;  // 1280 / 3 * 720 * 30, the estimate the capture manag
 const X264 = ['-c:v', 'libx264', '-preset', 'superfast', '-tune', 'zerolatency', '-profile:v', 'baseline',
   '-b:v', String(BITRATE), '-maxrate', String(BITRATE), '-bufsize', String(BITRATE), '-g', '60', '-bf', '0',
   '-pix_fmt', 'yuv420p'];
-// Bit b of the Gray code of the clock's milliseconds (mod 65536) in column b.
-const CLOCK = 'color=c=black:size=16x9:rate=30,realtime,' +
-  "geq=lum='16+219*mod(floor(mod(time(0)*1000,65536)/pow(2,X))+floor(mod(time(0)*1000,65536)/pow(2,X+1)),2)':cb=128:cr=128," +
-  'scale=1280:720:flags=neighbor';
-
 function stream(file) {
   const r = spawnSync('ffprobe', ['-v', 'error', '-select_streams', 'v:0', '-count_packets', '-show_entries',
     'stream=nb_read_packets,profile,bit_rate,width,height', '-of', 'json', file], { encoding: 'utf8' });
@@ -119,40 +115,14 @@ async function main() {
 
     // Preview latency.
     const latencyFile = path.join(dir, 'latency.mp4');
-    const lat = await runAddon(`${CHILD_HELPERS}
+    const lat = await runAddon(`${CHILD_HELPERS}${CLOCK_READER}
       addon.initialize();
       const camera = events.find((e) => e.type === 'new source' && e.source.type === 'mfce_video').source;
-      const W = 320, H = 180;
-      // The clock drawn in the picture, as milliseconds mod 65536, or -1 before the first frame.
-      const drawn = () => {
-        const p = addon.getPreview(camera.id, W, H);
-        if (!p || !p.length) return -1;
-        let gray = 0;
-        for (let b = 0; b < 16; b++) if (p[((H >> 1) * W + 10 + 20 * b) * 4] > 128) gray |= 1 << b;
-        let value = 0;
-        for (let g = gray; g; g >>= 1) value ^= g;
-        return value;
-      };
-      const measure = async (ms) => {
-        const delays = [];
-        let last = -1;
-        const end = Date.now() + ms;
-        while (Date.now() < end) {
-          const value = drawn();
-          const now = wall() * 1000;
-          if (value >= 0 && value !== last) {
-            last = value;
-            delays.push((((Math.floor(now) - value) % 65536) + 65536) % 65536 + (now - Math.floor(now)));
-          }
-          await sleep(1);
-        }
-        return delays;
-      };
       await sleep(3000);
-      const previewing = await measure(${seconds * 500});
+      const previewing = await measureClock(camera.id, ${seconds * 500});
       addon.startCapture(camera.id, ${JSON.stringify(latencyFile)});
       await sleep(1000);
-      const recording = await measure(${seconds * 500});
+      const recording = await measureClock(camera.id, ${seconds * 500});
       addon.stopCapture(camera.id);
       report({ previewing, recording });
     `, { env: { ...desktop.env, TAVIO_TEST_CAMERAS: `Clock Camera=${CLOCK}` }, timeoutMs: (seconds + 60) * 1000 });
