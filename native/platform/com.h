@@ -14,3 +14,13 @@ using Microsoft::WRL::ComPtr;
 #else
 #include "platform/linux/comptr.h"
 #endif
+
+// A holder that takes over a reference already counted, as a creating call hands it out.
+// mingw-w64's ComPtr::Attach counts such a reference once more, so the capture code, which
+// builds for Windows with mingw-w64 as well as with the SDK, adopts instead of attaching.
+template <class T>
+ComPtr<T> adopt(T* counted) {
+  ComPtr<T> held;
+  *held.GetAddressOf() = counted;
+  return held;
+}

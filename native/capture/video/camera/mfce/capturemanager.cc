@@ -55,7 +55,7 @@ HRESULT CaptureManager::Initialize(IUnknown* audioDevice, IUnknown* videoDevice)
   engineEvent = CreateEventA(nullptr, FALSE, FALSE, nullptr);
   if (!engineEvent) return HRESULT_FROM_WIN32(GetLastError());
 
-  eventCallback.Attach(new (std::nothrow) CaptureEngineCB(eventWindow));
+  eventCallback = adopt(new (std::nothrow) CaptureEngineCB(eventWindow));
   if (!eventCallback) return E_OUTOFMEMORY;
   eventCallback->manager = this;
   previewWindow = nullptr;
@@ -162,7 +162,7 @@ HRESULT CaptureManager::ConfigurePreview(UINT32& width, UINT32& height) {
       hr = previewSink->AddStream(MF_CAPTURE_ENGINE_PREFERRED_SOURCE_STREAM_FOR_VIDEO_PREVIEW, previewType.Get(),
                                   nullptr, &streamIndex);
     if (SUCCEEDED(hr) && !previewWindow) {
-      videoSampleCallback.Attach(new (std::nothrow) CaptureEngineVideoPreviewCB);
+      videoSampleCallback = adopt(new (std::nothrow) CaptureEngineVideoPreviewCB);
       if (!videoSampleCallback) {
         hr = E_OUTOFMEMORY;
       } else {
@@ -186,7 +186,7 @@ HRESULT CaptureManager::ConfigurePreview(UINT32& width, UINT32& height) {
       hr = previewSink->AddStream(MF_CAPTURE_ENGINE_PREFERRED_SOURCE_STREAM_FOR_AUDIO, pcmType.Get(), nullptr,
                                   &streamIndex);
     if (SUCCEEDED(hr)) {
-      audioSampleCallback.Attach(new (std::nothrow) CaptureEngineAudioPreviewCB);
+      audioSampleCallback = adopt(new (std::nothrow) CaptureEngineAudioPreviewCB);
       if (!audioSampleCallback) {
         hr = E_OUTOFMEMORY;
       } else {
@@ -335,8 +335,7 @@ HRESULT CaptureManager::StopRecord() {
 }
 
 HRESULT CaptureManager::HandleEngineEvent(IMFMediaEvent* event) {
-  ComPtr<IMFMediaEvent> taken;  // the caller's reference, let go once the event is handled
-  taken.Attach(event);
+  ComPtr<IMFMediaEvent> taken = adopt(event);  // the caller's reference, let go once handled
   HRESULT status = eventStatus(event);
   GUID type = GUID_NULL;
   if (SUCCEEDED(event->GetExtendedType(&type))) {

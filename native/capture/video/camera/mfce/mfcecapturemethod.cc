@@ -59,7 +59,7 @@ std::vector<std::shared_ptr<Element>> enumerate(const Category& category, bool a
                 category.enumerateMessage);
     // The list's references, let go whatever happens; each source takes one of its own.
     std::vector<ComPtr<IMFActivate>> listed(count);
-    for (UINT32 i = 0; i < count; ++i) listed[i].Attach(devices[i]);
+    for (UINT32 i = 0; i < count; ++i) listed[i] = adopt(devices[i]);
     CoTaskMemFree(devices);
 
     for (UINT32 i = 0; i < count; ++i) {

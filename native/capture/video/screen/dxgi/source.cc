@@ -27,8 +27,8 @@ Source::Source(IDXGIOutput1* output, ID3D11Device* device, bool selected) : outp
   output->GetDesc(&desc);
   outputWidth = desc.DesktopCoordinates.right - desc.DesktopCoordinates.left;
   outputHeight = desc.DesktopCoordinates.bottom - desc.DesktopCoordinates.top;
-  stagingTexture.Attach(createStagingTexture(device, outputWidth, outputHeight));
-  duplication.Attach(duplicateOutput(output, device));
+  stagingTexture = adopt(createStagingTexture(device, outputWidth, outputHeight));
+  duplication = adopt(duplicateOutput(output, device));
   queue = std::make_shared<capture::video::FrameQueue>(capture::toWide(name()), outputWidth, outputHeight, 0);
 }
 
@@ -62,7 +62,7 @@ void Source::capture() {
     bool reported = false;
     while (!duplication) {
       try {
-        duplication.Attach(duplicateOutput(output.Get(), device.Get()));
+        duplication = adopt(duplicateOutput(output.Get(), device.Get()));
       } catch (const std::exception& e) {
         // Access comes back after the mode change or desktop switch is over, or once the display
         // server runs again; until then the pump waits here without spinning. Said once.
