@@ -16,7 +16,7 @@
 #include "media.h"
 #include "platform/linux/ffmpeg/evenpicture.h"
 #include "platform/linux/mfcapture.h"
-#include "platform/linux/camera/testcameragraph.h"
+#include "platform/linux/capture/testcameragraph.h"
 
 namespace {
 

@@ -14,7 +14,7 @@ extern "C" {
 #include <libavutil/time.h>
 }
 
-#include "platform/linux/camera/enginestate.h"
+#include "platform/linux/capture/enginestate.h"
 #include "platform/linux/mf/mfattributes.h"
 #include "platform/linux/mfcapture.h"
 

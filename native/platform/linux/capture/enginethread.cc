@@ -25,8 +25,8 @@ extern "C" {
 #include <thread>
 #include <vector>
 
-#include "platform/linux/camera/devicereader.h"
-#include "platform/linux/camera/enginestate.h"
+#include "platform/linux/capture/devicereader.h"
+#include "platform/linux/capture/enginestate.h"
 #include "platform/linux/ffmpeg/evenpicture.h"
 #include "platform/linux/mf/mfattributes.h"
 

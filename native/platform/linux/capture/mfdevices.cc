@@ -18,7 +18,7 @@
 #include "capture/log.h"
 #include "platform/linux/mf/mfattributes.h"
 #include "platform/linux/mfcapture.h"
-#include "platform/linux/camera/testcameragraph.h"
+#include "platform/linux/capture/testcameragraph.h"
 
 namespace platform {
 

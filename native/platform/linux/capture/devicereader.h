@@ -11,7 +11,7 @@ extern "C" {
 #include <functional>
 #include <memory>
 
-#include "platform/linux/camera/capturedevice.h"
+#include "platform/linux/capture/capturedevice.h"
 
 namespace platform::capturedevice {
 

@@ -1,4 +1,4 @@
-#include "platform/linux/camera/testcameragraph.h"
+#include "platform/linux/capture/testcameragraph.h"
 
 #include <algorithm>
 #include <iterator>

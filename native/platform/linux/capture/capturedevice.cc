@@ -1,4 +1,4 @@
-#include "platform/linux/camera/capturedevice.h"
+#include "platform/linux/capture/capturedevice.h"
 
 #include <fcntl.h>
 #include <linux/videodev2.h>

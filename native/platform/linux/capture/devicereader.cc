@@ -1,4 +1,4 @@
-#include "platform/linux/camera/devicereader.h"
+#include "platform/linux/capture/devicereader.h"
 
 #include <pthread.h>
 

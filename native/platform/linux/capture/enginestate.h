@@ -15,7 +15,7 @@ extern "C" {
 #include <libavcodec/avcodec.h>
 }
 
-#include "platform/linux/camera/capturedevice.h"
+#include "platform/linux/capture/capturedevice.h"
 #include "platform/linux/mfcapture.h"
 
 namespace platform::engine {
