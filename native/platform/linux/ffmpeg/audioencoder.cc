@@ -252,10 +252,7 @@ class AudioEncoder : public StreamEncoder {
 
 HRESULT openAudioEncoder(AVFormatContext* format, AVStream* stream, Mp4File* file, IMFMediaType* output,
                          IMFMediaType* input, std::unique_ptr<StreamEncoder>* encoder) {
-  auto made = std::make_unique<AudioEncoder>(format, stream, file);
-  const HRESULT hr = made->open(output, input);
-  if (SUCCEEDED(hr)) *encoder = std::move(made);
-  return hr;
+  return openStream<AudioEncoder>(format, stream, file, encoder, output, input);
 }
 
 }  // namespace platform::sinkwriter

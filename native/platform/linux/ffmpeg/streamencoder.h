@@ -168,6 +168,16 @@ class VideoClock {
   LONGLONG next_ = 0;
 };
 
+// Opens a new stream of kind E (its open() takes `how`), which becomes *encoder if that succeeds.
+template <class E, class... How>
+HRESULT openStream(AVFormatContext* format, AVStream* stream, Mp4File* file, std::unique_ptr<StreamEncoder>* encoder,
+                   How... how) {
+  auto made = std::make_unique<E>(format, stream, file);
+  const HRESULT hr = made->open(how...);
+  if (SUCCEEDED(hr)) *encoder = std::move(made);
+  return hr;
+}
+
 // The three kinds of stream: each checks the types, opens its codec and declares the stream.
 HRESULT openVideoEncoder(AVFormatContext* format, AVStream* stream, Mp4File* file, IMFMediaType* output,
                          IMFMediaType* input, bool hardware, std::unique_ptr<StreamEncoder>* encoder);

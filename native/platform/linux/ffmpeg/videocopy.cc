@@ -63,10 +63,7 @@ class VideoCopy : public StreamEncoder {
 
 HRESULT openVideoCopy(AVFormatContext* format, AVStream* stream, Mp4File* file, IMFMediaType* output,
                       IMFMediaType* input, std::unique_ptr<StreamEncoder>* encoder) {
-  auto made = std::make_unique<VideoCopy>(format, stream, file);
-  const HRESULT hr = made->open(output, input);
-  if (SUCCEEDED(hr)) *encoder = std::move(made);
-  return hr;
+  return openStream<VideoCopy>(format, stream, file, encoder, output, input);
 }
 
 }  // namespace platform::sinkwriter

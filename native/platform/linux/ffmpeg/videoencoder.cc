@@ -292,10 +292,7 @@ class VideoEncoder : public StreamEncoder {
 
 HRESULT openVideoEncoder(AVFormatContext* format, AVStream* stream, Mp4File* file, IMFMediaType* output,
                          IMFMediaType* input, bool hardware, std::unique_ptr<StreamEncoder>* encoder) {
-  auto made = std::make_unique<VideoEncoder>(format, stream, file);
-  const HRESULT hr = made->open(output, input, hardware);
-  if (SUCCEEDED(hr)) *encoder = std::move(made);
-  return hr;
+  return openStream<VideoEncoder>(format, stream, file, encoder, output, input, hardware);
 }
 
 }  // namespace platform::sinkwriter
