@@ -1,7 +1,8 @@
 // The thread of a Linux capture engine: it opens the device (capturedevice.h)
 // while a preview or a recording runs, decodes what the device's reader (devicereader.h) hands
 // over, gives ARGB32 pictures and PCM buffers to the preview sink's callbacks, feeds the record
-// sink's sink writer, and delivers the engine's events to its event callback. Callers only queue
+// sink's sink writer (I420 pictures, converted once from what the device sends and shared with the
+// preview's conversion), and delivers the engine's events to its event callback. Callers only queue
 // commands, and since the thread never reads a device itself, it takes them between two packets.
 // A camera that sends H.264 is recorded as it sends it when the record stream asks for H.264
 // without a bit rate of its own; its pictures are still decoded for the preview.
@@ -154,11 +155,10 @@ class EngineThread {
   void arrive(Arrival& arrival);
   void receive(Device& device, AVPacket* packet, int64_t readAt);
   void passThrough(Recording& recording, const AVPacket* packet, AVRational timeBase, int64_t readAt);
-  const AVFrame* unpacked(const AVFrame* frame);
-  IMFMediaBuffer* pictureBuffer(DWORD length);
+  static IMFMediaBuffer* pooledBuffer(std::vector<ComPtr<IMFMediaBuffer>>& pool, DWORD length);
   void deliverVideo(AVFrame* frame, int64_t pts, AVRational timeBase, int64_t readAt);
   void deliverAudio(AVFrame* frame, int64_t pts, AVRational timeBase);
-  void recordPicture(Recording& recording, IMFSample* picture, LONGLONG deviceTime, int64_t readAt);
+  void recordPicture(Recording& recording, IMFSample* bgra, IMFSample* i420, LONGLONG deviceTime, int64_t readAt);
   void writeHeld(Recording& recording, LONGLONG duration);
   void recordSound(Recording& recording, AVFrame* frame, int64_t capturedAt);
   void writeSound(Recording& recording, const uint8_t* data, int samples);
@@ -170,15 +170,17 @@ class EngineThread {
   std::vector<std::unique_ptr<Recording>> finishing_;        // stopped clips waiting for their last data
   std::unique_ptr<capturedevice::DeviceReader> readers_[2];  // video, audio
   uint64_t generations_[2] = {0, 0};
-  SwsContext* previewScaler_ = nullptr;
-  SwsContext* unpacker_ = nullptr;  // packed 4:2:2 pictures into planar_
-  AVFrame* planar_ = nullptr;
+  SwsContext* toI420_ = nullptr;  // the device's pictures into I420 at the device's size
+  SwsContext* toBgra_ = nullptr;  // and those into the preview's BGRA
   AVFrame* frame_ = nullptr;
-  // Picture buffers, used again when nothing else holds them any more (the preview copies a
-  // picture, the sink writer encodes it at once): a new one for each picture costs the kernel a
-  // fresh zeroed page for every 4 KB of it.
+  // Picture buffers (BGRA, I420), used again when nothing else holds them any more (the preview
+  // copies a picture, the sink writer encodes it at once): a new one for each picture costs the
+  // kernel a fresh zeroed page for every 4 KB of it.
   std::vector<ComPtr<IMFMediaBuffer>> pictures_;
-  ComPtr<IMFSample> lastPicture_;  // the picture current now, which a clip starting now opens with
+  std::vector<ComPtr<IMFMediaBuffer>> i420Pictures_;
+  // The picture current now, which a clip starting now opens with.
+  ComPtr<IMFSample> lastPicture_;
+  ComPtr<IMFSample> lastI420_;
   LONGLONG lastPictureTime_ = 0;
   int64_t lastPictureReadAt_ = 0;
   AVFrame* lastSound_ = nullptr;  // the microphone's last buffer
@@ -236,13 +238,14 @@ void EngineThread::closeDevices() {
     if (devices[i]) devices[i]->input.reset();
   }
   pictures_.clear();
+  i420Pictures_.clear();
   lastPicture_ = ComPtr<IMFSample>();
+  lastI420_ = ComPtr<IMFSample>();
   av_frame_unref(lastSound_);
-  sws_freeContext(previewScaler_);
-  previewScaler_ = nullptr;
-  sws_freeContext(unpacker_);
-  unpacker_ = nullptr;
-  av_frame_free(&planar_);
+  sws_freeContext(toI420_);
+  toI420_ = nullptr;
+  sws_freeContext(toBgra_);
+  toBgra_ = nullptr;
 }
 
 std::vector<Recording*> EngineThread::recordings() {
@@ -290,7 +293,8 @@ HRESULT EngineThread::startRecording(const Order& order) {
                             static_cast<UINT32>(delivered->extradata_size));
       recording->videoPassthrough = true;
     } else if (stream.video) {
-      // The encoder is given top-down BGRA rows at the device's size, made even (see evenpicture.h).
+      // The encoder is given the engine's I420 pictures, or top-down BGRA rows made even (see
+      // evenpicture.h) for an odd-sized device.
       const int width = evenpicture::evenSize(f.width);
       const int height = evenpicture::evenSize(f.height);
       recording->padded = width != f.width || height != f.height;
@@ -304,10 +308,12 @@ HRESULT EngineThread::startRecording(const Order& order) {
         if (SUCCEEDED(hr) && slow) hr = output->SetUINT32(MF_MT_AVG_BITRATE, lowestBitRate);
       }
       if (SUCCEEDED(hr)) hr = input->SetGUID(MF_MT_MAJOR_TYPE, MFMediaType_Video);
-      if (SUCCEEDED(hr)) hr = input->SetGUID(MF_MT_SUBTYPE, MFVideoFormat_RGB32);
+      if (SUCCEEDED(hr))
+        hr = input->SetGUID(MF_MT_SUBTYPE, recording->padded ? MFVideoFormat_RGB32 : MFVideoFormat_I420);
       if (SUCCEEDED(hr)) hr = MFSetAttributeSize(input.Get(), MF_MT_FRAME_SIZE, width, height);
       if (SUCCEEDED(hr)) hr = MFSetAttributeRatio(input.Get(), MF_MT_FRAME_RATE, f.rate.num, f.rate.den);
-      if (SUCCEEDED(hr)) hr = input->SetUINT32(MF_MT_DEFAULT_STRIDE, static_cast<UINT32>(width * 4));
+      if (SUCCEEDED(hr))
+        hr = input->SetUINT32(MF_MT_DEFAULT_STRIDE, static_cast<UINT32>(recording->padded ? width * 4 : width));
       if (SUCCEEDED(hr)) hr = input->SetUINT32(MF_MT_INTERLACE_MODE, MFVideoInterlace_Progressive);
     } else {
       UINT32 rate = 0, channels = 0;
@@ -346,7 +352,7 @@ HRESULT EngineThread::startRecording(const Order& order) {
     requestKeyFrame(*state_->video);
   } else if (recording->hasVideo && lastPicture_) {
     // The picture current at the start opens the clip.
-    recording->held = lastPicture_;
+    recording->held = recording->padded ? lastPicture_ : lastI420_;
     recording->firstDeviceTime = lastPictureTime_;
     recording->firstReadAt = lastPictureReadAt_;
   }
@@ -435,35 +441,10 @@ void EngineThread::fail(HRESULT status) {
   send(MF_CAPTURE_ENGINE_ERROR, status);
 }
 
-// swscale has no fast way from packed 4:2:2 (YUY2, UYVY) to BGRA; unpacked into planes first,
-// the pictures take its SIMD YUV to RGB converter, in about a third of the time. Other pictures
-// are returned as they are; null if unpacking failed.
-const AVFrame* EngineThread::unpacked(const AVFrame* frame) {
-  const auto format = static_cast<AVPixelFormat>(frame->format);
-  if (format != AV_PIX_FMT_YUYV422 && format != AV_PIX_FMT_UYVY422) return frame;
-  if (planar_ && (planar_->width != frame->width || planar_->height != frame->height)) av_frame_free(&planar_);
-  if (!planar_) {
-    planar_ = av_frame_alloc();
-    if (!planar_) return nullptr;
-    planar_->format = AV_PIX_FMT_YUV422P;
-    planar_->width = frame->width;
-    planar_->height = frame->height;
-    if (av_frame_get_buffer(planar_, 0) < 0) {
-      av_frame_free(&planar_);
-      return nullptr;
-    }
-  }
-  unpacker_ = sws_getCachedContext(unpacker_, frame->width, frame->height, format, frame->width, frame->height,
-                                   AV_PIX_FMT_YUV422P, SWS_POINT, nullptr, nullptr, nullptr);
-  if (!unpacker_) return nullptr;
-  sws_scale(unpacker_, frame->data, frame->linesize, 0, frame->height, planar_->data, planar_->linesize);
-  return planar_;
-}
-
-// A picture buffer that nothing else holds any more and that is large enough, else a new one;
+// A buffer of the pool that nothing else holds any more and that is large enough, else a new one;
 // null if none could be made.
-IMFMediaBuffer* EngineThread::pictureBuffer(DWORD length) {
-  for (auto& buffer : pictures_) {
+IMFMediaBuffer* EngineThread::pooledBuffer(std::vector<ComPtr<IMFMediaBuffer>>& pool, DWORD length) {
+  for (auto& buffer : pool) {
     buffer->AddRef();
     DWORD room = 0;
     if (buffer->Release() == 1 && SUCCEEDED(buffer->GetMaxLength(&room)) && room >= length) return buffer.Get();
@@ -471,46 +452,70 @@ IMFMediaBuffer* EngineThread::pictureBuffer(DWORD length) {
   ComPtr<IMFMediaBuffer> made;
   if (FAILED(MFCreateMemoryBuffer(length, made.GetAddressOf()))) return nullptr;
   // A clip holds a picture until the next, the engine the current one, a preview one more.
-  if (pictures_.size() < 4)
-    pictures_.push_back(made);
+  if (pool.size() < 4)
+    pool.push_back(made);
   else
-    pictures_[pictures_.size() - 1] = made;
+    pool[pool.size() - 1] = made;
   return made.Get();
 }
 
 // Pictures go to the preview and into the clips at the size the device was found with: a device
-// that changes its size mid-stream is scaled back to it.
+// that changes its size mid-stream is scaled back to it. Each picture is converted once, into
+// I420, which the encoder takes as it is (as it would take the device's own pictures); the
+// preview's BGRA is made from that. swscale turns packed 4:2:2 (YUY2) into I420 with a fast
+// unscaled path, and I420 into BGRA with its SIMD converter.
 void EngineThread::deliverVideo(AVFrame* frame, int64_t pts, AVRational timeBase, int64_t readAt) {
   const DeviceFormat& f = state_->video->current;
   const int width = f.width;
   const int height = f.height;
   if (width <= 0 || height <= 0 || frame->width <= 0 || frame->height <= 0) return;
-  const DWORD length = static_cast<DWORD>(width * height * 4);
-  const AVFrame* picture = unpacked(frame);
-  if (!picture) return;
+  // I420 rows of the even width (what the encoder's stride is), chroma rows rounded up.
+  const int lumaStride = evenpicture::evenSize(width);
+  const int chromaStride = lumaStride / 2;
+  const size_t lumaSize = static_cast<size_t>(lumaStride) * height;
+  const size_t chromaSize = static_cast<size_t>(chromaStride) * ((height + 1) / 2);
+  const auto i420Length = static_cast<DWORD>(lumaSize + 2 * chromaSize);
+  const auto bgraLength = static_cast<DWORD>(width * height * 4);
   const bool sameSize = frame->width == width && frame->height == height;
-  previewScaler_ = sws_getCachedContext(previewScaler_, frame->width, frame->height,
-                                        static_cast<AVPixelFormat>(picture->format), width, height, AV_PIX_FMT_BGRA,
-                                        sameSize ? SWS_POINT : SWS_BILINEAR, nullptr, nullptr, nullptr);
-  if (!previewScaler_) return;
+  toI420_ =
+      sws_getCachedContext(toI420_, frame->width, frame->height, static_cast<AVPixelFormat>(frame->format), width,
+                           height, AV_PIX_FMT_YUV420P, sameSize ? SWS_POINT : SWS_BILINEAR, nullptr, nullptr, nullptr);
+  toBgra_ = sws_getCachedContext(toBgra_, width, height, AV_PIX_FMT_YUV420P, width, height, AV_PIX_FMT_BGRA, SWS_POINT,
+                                 nullptr, nullptr, nullptr);
+  if (!toI420_ || !toBgra_) return;
   const AVRational rate = f.rate;
   const LONGLONG duration = av_rescale(ticksPerSecond, rate.den, rate.num);
   const LONGLONG time = pts != AV_NOPTS_VALUE
                             ? av_rescale_q(pts, timeBase, AVRational{1, static_cast<int>(ticksPerSecond)})
                             : (readAt * 10);
 
-  IMFMediaBuffer* buffer = pictureBuffer(length);
-  if (!buffer) return;
-  ComPtr<IMFSample> sample;
+  IMFMediaBuffer* i420Buffer = pooledBuffer(i420Pictures_, i420Length);
+  IMFMediaBuffer* bgraBuffer = pooledBuffer(pictures_, bgraLength);
+  if (!i420Buffer || !bgraBuffer) return;
+  const uint8_t* planes[3] = {};
+  const int strides[3] = {lumaStride, chromaStride, chromaStride};
+  ComPtr<IMFSample> i420;
   HRESULT hr = fillSample(
-      buffer, length, time, duration,
+      i420Buffer, i420Length, time, duration,
       [&](BYTE* data) {
-        uint8_t* planes[1] = {data};
-        int strides[1] = {width * 4};
-        sws_scale(previewScaler_, picture->data, picture->linesize, 0, frame->height, planes, strides);
+        uint8_t* to[3] = {data, data + lumaSize, data + lumaSize + chromaSize};
+        sws_scale(toI420_, frame->data, frame->linesize, 0, frame->height, to, strides);
+        std::copy(to, to + 3, planes);
+      },
+      i420.GetAddressOf());
+  if (FAILED(hr)) return;
+  // A memory buffer keeps its place while a sample holds it: the planes are still there after the unlock.
+  ComPtr<IMFSample> sample;
+  hr = fillSample(
+      bgraBuffer, bgraLength, time, duration,
+      [&](BYTE* data) {
+        uint8_t* to[1] = {data};
+        const int toStrides[1] = {width * 4};
+        sws_scale(toBgra_, planes, strides, 0, height, to, toStrides);
       },
       sample.GetAddressOf());
   if (FAILED(hr)) return;
+  lastI420_ = i420;
   lastPicture_ = sample;
   lastPictureTime_ = time;
   lastPictureReadAt_ = readAt;
@@ -525,7 +530,7 @@ void EngineThread::deliverVideo(AVFrame* frame, int64_t pts, AVRational timeBase
   }
   if (previewing)
     for (auto& callback : callbacks) callback->OnSample(sample.Get());
-  for (Recording* recording : recordings()) recordPicture(*recording, sample.Get(), time, readAt);
+  for (Recording* recording : recordings()) recordPicture(*recording, sample.Get(), i420.Get(), time, readAt);
 }
 
 // Where a picture goes in its clip: its device time, which is steadier than the moments reads
@@ -539,7 +544,9 @@ LONGLONG clipTime(const Recording& recording, LONGLONG deviceTime, int64_t readA
 
 // A picture read before the clip's start (it waited behind a command) replaces the opening one;
 // from then on each picture writes the one before it, now that its length is known.
-void EngineThread::recordPicture(Recording& recording, IMFSample* picture, LONGLONG deviceTime, int64_t readAt) {
+void EngineThread::recordPicture(Recording& recording, IMFSample* bgra, IMFSample* i420, LONGLONG deviceTime,
+                                 int64_t readAt) {
+  IMFSample* picture = recording.padded ? bgra : i420;
   if (!recording.hasVideo || recording.videoPassthrough || recording.videoDone || FAILED(recording.failure)) return;
   if (recording.stopAt && readAt >= recording.stopAt) {
     // A clip stopped before the device's first picture came shows that picture all along.
