@@ -6,6 +6,7 @@
 #include <algorithm>
 #include <cerrno>
 #include <cmath>
+#include <cstring>
 
 extern "C" {
 #include <libavutil/error.h>
@@ -120,17 +121,27 @@ void Mp4File::stampDurations() {
   if (fd_ < 0 || end_ < 16) return;
   double movieSeconds = 0;
   for (double seconds : trackEnds_) movieSeconds = std::max(movieSeconds, seconds);
-  // The header is small and at the start: ftyp, then moov.
-  std::vector<uint8_t> head(static_cast<size_t>(std::min<int64_t>(end_, 1 << 20)));
-  const ssize_t got = ::pread(fd_, head.data(), head.size(), 0);
-  if (got <= 0) return;
-  head.resize(static_cast<size_t>(got));
-
-  size_t moov = 0, moovSize = 0;
-  forEachBox(head, 0, head.size(), [&](const std::string& type, size_t offset, size_t size) {
-    if (type == "moov" && !moovSize) moov = offset, moovSize = size;
-  });
+  // The header is small and at the start (ftyp, then moov): only moov is read back, found by the
+  // boxes' sizes, since this runs at every fragment of a file that keeps growing.
+  int64_t moov = 0;
+  size_t moovSize = 0;
+  for (int64_t at = 0; at + 8 <= end_ && !moovSize;) {
+    uint8_t box[16];
+    if (::pread(fd_, box, 8, at) != 8) return;
+    uint64_t size = read32(box);
+    if (size == 1) {  // a 64-bit size follows the type (a large mdat)
+      if (::pread(fd_, box + 8, 8, at + 8) != 8) return;
+      size = static_cast<uint64_t>(read32(box + 8)) << 32 | read32(box + 12);
+    }
+    if (size < 8 || size > static_cast<uint64_t>(end_ - at)) return;
+    if (std::memcmp(box + 4, "moov", 4) == 0)
+      moov = at, moovSize = static_cast<size_t>(size);
+    else
+      at += static_cast<int64_t>(size);
+  }
   if (!moovSize) return;
+  std::vector<uint8_t> head(moovSize);
+  if (::pread(fd_, head.data(), moovSize, moov) != static_cast<ssize_t>(moovSize)) return;
 
   uint32_t timescale = 0;
   auto stamp = [&](size_t field, bool wide, double seconds) {
@@ -141,7 +152,7 @@ void Mp4File::stampDurations() {
       write32(&head[field], static_cast<uint32_t>(std::min<uint64_t>(units, UINT32_MAX)));
   };
   size_t track = 0;
-  forEachBox(head, moov + 8, moov + moovSize, [&](const std::string& type, size_t offset, size_t size) {
+  forEachBox(head, 8, moovSize, [&](const std::string& type, size_t offset, size_t size) {
     if (type == "mvhd" && size >= 32) {
       const bool wide = head[offset + 8] == 1;
       if (wide && size < 44) return;
@@ -158,7 +169,7 @@ void Mp4File::stampDurations() {
       });
     }
   });
-  if (timescale) (void)!::pwrite(fd_, head.data() + moov, moovSize, static_cast<off_t>(moov));
+  if (timescale) (void)!::pwrite(fd_, head.data(), moovSize, static_cast<off_t>(moov));
 }
 
 int Mp4File::close() {
