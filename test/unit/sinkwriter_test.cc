@@ -253,56 +253,71 @@ TEST(SinkWriter, H264IsReallyMainWithTheTypesSizeRateAndBitRate) {
   EXPECT_EQ(decoded.frames, frames);
 }
 
-TEST(SinkWriter, BaselineProfileWhenAsked) {
+// Red above blue in I420 (BT.709, limited range), as the camera engine hands its pictures on.
+std::vector<uint8_t> i420Bands(int width, int height) {
+  std::vector<uint8_t> planes(static_cast<size_t>(width) * height * 3 / 2);
+  uint8_t* u = &planes[static_cast<size_t>(width) * height];
+  uint8_t* v = u + static_cast<size_t>(width / 2) * (height / 2);
+  for (int y = 0; y < height; ++y) {
+    const bool top = y < height / 2;
+    std::fill_n(&planes[static_cast<size_t>(y) * width], width, top ? 63 : 32);
+    if (y % 2) continue;
+    std::fill_n(u + static_cast<size_t>(y / 2) * (width / 2), width / 2, top ? 102 : 240);
+    std::fill_n(v + static_cast<size_t>(y / 2) * (width / 2), width / 2, top ? 240 : 118);
+  }
+  return planes;
+}
+
+// How the input pictures lie in memory, and the profile asked for.
+struct PictureCase {
+  const char* name;
+  GUID subtype;
+  UINT32 stride;  // MF_MT_DEFAULT_STRIDE; 0: not set
+  UINT32 profile;
+  int expectedProfile;  // without the constrained flag
+};
+void PrintTo(const PictureCase& c, std::ostream* out) { *out << c.name; }
+
+class PictureLayout : public testing::TestWithParam<PictureCase> {};
+
+TEST_P(PictureLayout, DecodesUprightWithTheProfileAskedFor) {
+  const PictureCase c = GetParam();
   MediaFoundation started;
   media::TempFolder folder;
-  const std::string path = folder.file("base.mp4");
+  const std::string path = folder.file("layout.mp4");
   DWORD stream = 0;
-  IMFSinkWriter* writer = videoWriter(path, 128, 96, &stream, eAVEncH264VProfile_Base);
+  IMFSinkWriter* writer = videoWriterWith(
+      path, 160, 120, &stream,
+      [&](IMFMediaType* in) {
+        in->SetGUID(MF_MT_SUBTYPE, c.subtype);
+        if (c.stride) in->SetUINT32(MF_MT_DEFAULT_STRIDE, c.stride);
+      },
+      c.profile);
   ASSERT_NE(writer, nullptr);
-  const auto pixels = bands(128, 96, true);
-  for (int i = 0; i < 5; ++i) ASSERT_EQ(writeBytes(writer, stream, pixels, i * 333333LL, 333333), S_OK);
-  EXPECT_EQ(writer->Finalize(), S_OK);
+  // RGB32 without a stride is bottom-up.
+  const auto pixels = c.subtype == MFVideoFormat_I420 ? i420Bands(160, 120) : bands(160, 120, c.stride == 0);
+  for (int i = 0; i < 3; ++i) ASSERT_EQ(writeBytes(writer, stream, pixels, i * 333333LL, 333333), S_OK);
+  ASSERT_EQ(writer->Finalize(), S_OK);
   writer->Release();
   const media::File file = media::probe(path);
   ASSERT_TRUE(file.opened);
-  EXPECT_EQ(file.streams[0].profile & ~FF_PROFILE_H264_CONSTRAINED, FF_PROFILE_H264_BASELINE);
-}
-
-TEST(SinkWriter, RGB32WithoutStrideIsBottomUp) {
-  MediaFoundation started;
-  media::TempFolder folder;
-  const std::string path = folder.file("bottomup.mp4");
-  DWORD stream = 0;
-  IMFSinkWriter* writer = videoWriter(path, 160, 120, &stream);
-  ASSERT_NE(writer, nullptr);
-  const auto pixels = bands(160, 120, true);
-  for (int i = 0; i < 3; ++i) ASSERT_EQ(writeBytes(writer, stream, pixels, i * 333333LL, 333333), S_OK);
-  ASSERT_EQ(writer->Finalize(), S_OK);
-  writer->Release();
+  EXPECT_EQ(file.streams[0].profile & ~FF_PROFILE_H264_CONSTRAINED, c.expectedProfile);
   const media::Decoded decoded = media::decode(path, AVMEDIA_TYPE_VIDEO);
   ASSERT_EQ(decoded.width, 160);
   EXPECT_EQ(colourAt(decoded, 80, 10), 'r');
   EXPECT_EQ(colourAt(decoded, 80, 110), 'b');
 }
 
-TEST(SinkWriter, PositiveDefaultStrideIsTopDown) {
-  MediaFoundation started;
-  media::TempFolder folder;
-  const std::string path = folder.file("topdown.mp4");
-  DWORD stream = 0;
-  IMFSinkWriter* writer =
-      videoWriterWith(path, 160, 120, &stream, [](IMFMediaType* in) { in->SetUINT32(MF_MT_DEFAULT_STRIDE, 160 * 4); });
-  ASSERT_NE(writer, nullptr);
-  const auto pixels = bands(160, 120, false);
-  for (int i = 0; i < 3; ++i) ASSERT_EQ(writeBytes(writer, stream, pixels, i * 333333LL, 333333), S_OK);
-  ASSERT_EQ(writer->Finalize(), S_OK);
-  writer->Release();
-  const media::Decoded decoded = media::decode(path, AVMEDIA_TYPE_VIDEO);
-  ASSERT_EQ(decoded.width, 160);
-  EXPECT_EQ(colourAt(decoded, 80, 10), 'r');
-  EXPECT_EQ(colourAt(decoded, 80, 110), 'b');
-}
+INSTANTIATE_TEST_SUITE_P(Inputs, PictureLayout,
+                         testing::Values(PictureCase{"Rgb32WithoutStrideIsBottomUp", MFVideoFormat_RGB32, 0,
+                                                     eAVEncH264VProfile_Main, FF_PROFILE_H264_MAIN},
+                                         PictureCase{"Rgb32PositiveStrideIsTopDown", MFVideoFormat_RGB32, 160 * 4,
+                                                     eAVEncH264VProfile_Main, FF_PROFILE_H264_MAIN},
+                                         PictureCase{"BaselineWhenAsked", MFVideoFormat_RGB32, 0,
+                                                     eAVEncH264VProfile_Base, FF_PROFILE_H264_BASELINE},
+                                         PictureCase{"I420AsItIs", MFVideoFormat_I420, 160, eAVEncH264VProfile_Base,
+                                                     FF_PROFILE_H264_BASELINE}),
+                         [](const testing::TestParamInfo<PictureCase>& info) { return std::string(info.param.name); });
 
 TEST(SinkWriter, SampleTimesAndDurationsBecomePacketTimes) {
   MediaFoundation started;
