@@ -36,6 +36,15 @@ function probe(file) {
   return { packets: Number(s.nb_read_packets), duration: Number(info.format.duration), bitRate: Number(s.bit_rate) };
 }
 
+// Pictures that differ from the one before (mpdecimate's defaults). Packet counts alone do not
+// show a dropped picture: x11grab writes whatever the screen holds at each tick of its 30 fps
+// clock, the same picture again when the screen has not changed since.
+function distinct(file) {
+  const r = spawnSync('ffmpeg', ['-v', 'error', '-i', file, '-vf', 'mpdecimate', '-f', 'framecrc', '-'],
+    { encoding: 'utf8', maxBuffer: 64 << 20 });
+  return r.stdout.split('\n').filter((line) => line && !line.startsWith('#')).length;
+}
+
 async function main() {
   const dir = fs.mkdtempSync(path.join(os.tmpdir(), 'tavio-bench-all-'));
   const xpattern = path.join(dir, 'xpattern');
@@ -136,6 +145,11 @@ async function main() {
       const count = (f) => video ? `${f.packets} frames (${(f.packets / f.duration).toFixed(1)}/s)` : `${f.packets} AAC packets`;
       console.log(`  ${kind.padEnd(10)} ours ${count(a)}, ${a.duration.toFixed(2)} s; ffmpeg ${count(b)}, ${b.duration.toFixed(2)} s` +
         (video ? `; frames ours - ffmpeg: ${a.packets - b.packets}` : ''));
+      if (video) {
+        const [mine, other] = [distinct(ours[kind]), distinct(theirs[kind])];
+        console.log(`  ${''.padEnd(10)} pictures that differ from the one before: ours ${mine}, ffmpeg ${other} ` +
+          `(ours - ffmpeg: ${mine - other})`);
+      }
     }
     console.log(`CPU: ours ${cpu.toFixed(1)} s (${(100 * cpu / wall).toFixed(0)} % of a core, previews included), ` +
       `ffmpeg's four ${theirCpu.toFixed(1)} s (${(100 * theirCpu / seconds).toFixed(0)} %)`);
