@@ -339,6 +339,29 @@ TEST_F(DisplayGrab, ThreeGrabsLeaveTheLastTwoFrames) {
   EXPECT_EQ(source.queue->frames[1]->data[0], 102);
 }
 
+TEST_F(DisplayGrab, WhileAClipRecordsThePicturesItHasNotTakenStayAndTheirMemoryIsUsedAgain) {
+  Source source(&output, &device, false);
+  source.queue->stopped = false;
+  for (int i = 0; i < 40; ++i) {
+    desktop.pixels[0] = static_cast<uint8_t>(i);
+    acquireFrame();
+    source.capture();
+  }
+  // Up to a bound (30 waiting besides the newest): an encoder that cannot keep up loses the oldest.
+  ASSERT_EQ(source.queue->frames.size(), 31u);
+  EXPECT_EQ(source.queue->frames.front()->data[0], 9);
+  EXPECT_EQ(source.queue->frames.back()->data[0], 39);
+
+  const uint8_t* taken = source.queue->frames.front()->data.get();
+  source.queue->frames.pop_front();  // the recording thread is done with it
+  source.queue->stopped = true;
+  acquireFrame();
+  source.capture();
+  EXPECT_EQ(source.queue->frames.back()->data.get(), taken);
+  EXPECT_EQ(source.queue->frames.back()->data.get_deleter().pool, source.pixels);
+  EXPECT_EQ(source.queue->frames.size(), 2u);
+}
+
 TEST_F(DisplayGrab, OtherAcquisitionResultsAreTakenAsFrames) {
   first.steps.push_back({S_FALSE, {}});
   Source source(&output, &device, false);

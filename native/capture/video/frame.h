@@ -9,34 +9,87 @@
 #include <memory>
 #include <mutex>
 #include <string>
+#include <vector>
 
 namespace capture::video {
+
+class PixelPool;
+
+// Gives a frame's pixels back to the pool they came from, if any.
+struct PixelsDeleter {
+  std::shared_ptr<PixelPool> pool;
+  void operator()(uint8_t* pixels) const;
+};
+using Pixels = std::unique_ptr<uint8_t[], PixelsDeleter>;
+
+// Pixel blocks of one size, used again once their frame is gone: a new block of 8 MB for every
+// picture of a 60 Hz desktop costs the kernel a zeroed page per 4 KB, the more so while a busy
+// encoder keeps several pictures alive. Frames may outlive their source: they hold the pool.
+class PixelPool : public std::enable_shared_from_this<PixelPool> {
+ public:
+  explicit PixelPool(uint64_t size) : size_(size) {}
+  uint64_t size() const { return size_; }
+
+  Pixels take() {
+    std::unique_ptr<uint8_t[]> block;
+    {
+      std::lock_guard<std::mutex> lock(mutex_);
+      if (!free_.empty()) {
+        block = std::move(free_.back());
+        free_.pop_back();
+      }
+    }
+    if (!block) block.reset(new uint8_t[size_]);
+    return Pixels(block.release(), PixelsDeleter{shared_from_this()});
+  }
+
+  void give(uint8_t* pixels) {
+    std::unique_ptr<uint8_t[]> block(pixels);
+    std::lock_guard<std::mutex> lock(mutex_);
+    if (free_.size() < maxFree) free_.push_back(std::move(block));
+  }
+
+ private:
+  static constexpr size_t maxFree = 4;  // what a burst leaves beyond that is freed
+  const uint64_t size_;
+  std::mutex mutex_;
+  std::vector<std::unique_ptr<uint8_t[]>> free_;
+};
+
+inline void PixelsDeleter::operator()(uint8_t* pixels) const {
+  if (pool)
+    pool->give(pixels);
+  else
+    delete[] pixels;
+}
 
 struct Frame {
   uint64_t size = 0;  // width * height * 4
   uint64_t bytesPerPixel = 4;
   uint64_t width = 0;
   uint64_t height = 0;
-  uint64_t rowPixels = 0;           // equal to width: rows are packed
-  uint32_t channelOrder = 0;        // 0 display, 1 camera
-  std::unique_ptr<uint8_t[]> data;  // top-down rows, bytes B, G, R, A
-  int64_t timestamp = 0;            // ms since 1970 when the frame was built
+  uint64_t rowPixels = 0;     // equal to width: rows are packed
+  uint32_t channelOrder = 0;  // 0 display, 1 camera
+  Pixels data;                // top-down rows, bytes B, G, R, A
+  int64_t timestamp = 0;      // ms since 1970 when the frame was built
 
-  // A frame of width x height pixels with uninitialised pixel bytes.
-  static std::unique_ptr<Frame> make(uint64_t width, uint64_t height, uint32_t channelOrder, int64_t timestamp) {
+  // A frame of width x height pixels with uninitialised pixel bytes, from pool when it is given
+  // and of that size.
+  static std::unique_ptr<Frame> make(uint64_t width, uint64_t height, uint32_t channelOrder, int64_t timestamp,
+                                     const std::shared_ptr<PixelPool>& pool = nullptr) {
     auto frame = std::make_unique<Frame>();
     frame->size = width * height * 4;
     frame->width = width;
     frame->height = height;
     frame->rowPixels = width;
     frame->channelOrder = channelOrder;
-    frame->data.reset(new uint8_t[frame->size]);
+    frame->data = pool && pool->size() == frame->size ? pool->take() : Pixels(new uint8_t[frame->size]);
     frame->timestamp = timestamp;
     return frame;
   }
 
   std::unique_ptr<Frame> clone() const {
-    auto copy = make(width, height, channelOrder, timestamp);
+    auto copy = make(width, height, channelOrder, timestamp, data.get_deleter().pool);
     std::memcpy(copy->data.get(), data.get(), size);
     return copy;
   }

@@ -40,6 +40,8 @@ class MFTEncoder : public Encoder {
   LONGLONG lastTime = -1;       // its sample time, 100 ns since the clip's start
   int64_t lastTimestamp = 0;    // its capture time, ms since 1970
   uint64_t frameCount = 0;
+  // The last picture's buffer, used again once the sink writer holds no reference to it.
+  ComPtr<IMFMediaBuffer> spareBuffer;
 };
 
 }  // namespace capture::video::encoder

@@ -1,5 +1,6 @@
 #include "capture/video/screen/dxgi/source.h"
 
+#include <algorithm>
 #include <chrono>
 #include <cstring>
 #include <thread>
@@ -17,6 +18,12 @@
 
 namespace capture::video::screen::dxgi {
 
+namespace {
+// Pictures a recording may have waiting: half a second of a 60 Hz desktop, a dozen at 1080p.
+constexpr uint64_t recordingBacklogBytes = 96 << 20;
+constexpr uint64_t recordingBacklogPictures = 30;
+}  // namespace
+
 Source::Source(IDXGIOutput1* output, ID3D11Device* device, bool selected) : output(output), device(device) {
   acquireTimeout = 5;
   captureMouse = true;
@@ -30,6 +37,7 @@ Source::Source(IDXGIOutput1* output, ID3D11Device* device, bool selected) : outp
   stagingTexture = adopt(createStagingTexture(device, outputWidth, outputHeight));
   duplication = adopt(duplicateOutput(output, device));
   queue = std::make_shared<capture::video::FrameQueue>(capture::toWide(name()), outputWidth, outputHeight, 0);
+  pixels = std::make_shared<capture::video::PixelPool>(static_cast<uint64_t>(outputWidth) * outputHeight * 4);
 }
 
 Source::~Source() = default;
@@ -99,14 +107,19 @@ void Source::capture() {
   hr = context->Map(stagingTexture.Get(), 0, D3D11_MAP_READ, 0, &mapped);
   capture::checkResult("native/capture/video/screen/dxgi/source", 94, hr, "Could not map device context for image.");
 
-  auto frame = capture::video::Frame::make(outputWidth, outputHeight, 0, capture::currentTimeMillis());
+  auto frame = capture::video::Frame::make(outputWidth, outputHeight, 0, capture::currentTimeMillis(), pixels);
   // Rows are taken as packed at outputWidth * 4 bytes; RowPitch is not consulted.
   capture::video::copyPicture(frame->data.get(), mapped.pData, frame->size);
   if (captureMouse) drawPointer(pointer, *frame);
 
   {
+    // While a clip records, pictures its thread has not taken yet stay, so that a busy machine
+    // delays the encoder instead of losing them (up to a bound: an encoder that cannot keep up
+    // loses the oldest). Otherwise the newest alone is kept, for the preview.
+    const size_t keep =
+        queue->stopped ? 1 : std::clamp<uint64_t>(recordingBacklogBytes / frame->size, 2, recordingBacklogPictures);
     std::lock_guard<std::mutex> lock(queue->mutex);
-    while (queue->frames.size() > 1) queue->frames.pop_front();
+    while (queue->frames.size() > keep) queue->frames.pop_front();
     queue->frames.push_back(std::move(frame));
   }
   queue->changed.notify_all();
