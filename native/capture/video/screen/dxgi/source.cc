@@ -19,7 +19,7 @@
 namespace capture::video::screen::dxgi {
 
 namespace {
-// Pictures a recording may have waiting: half a second of a 60 Hz desktop, a dozen at 1080p.
+// Pictures a recording may have waiting: half a second of a 60 Hz desktop, or eleven at 1080p.
 constexpr uint64_t recordingBacklogBytes = 96 << 20;
 constexpr uint64_t recordingBacklogPictures = 30;
 }  // namespace
