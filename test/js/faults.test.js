@@ -102,6 +102,8 @@ async function threadLoads(pid, ms) {
 }
 
 
+const spinning = 0.15;  // share of a core
+
 function pulseArguments(dir) {
   return ['--daemonize=yes', '--exit-idle-time=-1', '--system=false', '-n', '-F', path.join(dir, 'conf.pa'),
     '--use-pid-file=yes', '--log-target=stderr'];
@@ -137,7 +139,10 @@ async function faultCase({ folder, broken, fault, repair }) {
     await fault({ env, dir: desktop.dir, helpers, desktop });
     await sleep(1500);
     const loads = await threadLoads(host.child.pid, 1000);
-    const busy = loads.filter((t) => t.load > 0.05 && !t.name.startsWith('node'));
+    // A spinning thread takes a whole core. Threads of the sources the fault leaves alone keep
+    // recording meanwhile (an endpoint's AAC alone is 3 to 4 % of a core here, more on a slower
+    // machine), so the bound sits well above their work and far below a spin.
+    const busy = loads.filter((t) => t.load > spinning && !t.name.startsWith('node'));
     const stop = await host.ask('stop');
     await sleep(1500);
     const warnedAfterFault = host.output();
@@ -275,7 +280,7 @@ test('with no display server at all, nothing spins', async () => {
     const { sources } = await host.next();
     assert.ok(!sources.some((s) => s.type === 'dxgi'));
     await sleep(1500);
-    const busy = (await threadLoads(host.child.pid, 1000)).filter((t) => t.load > 0.05 && !t.name.startsWith('node'));
+    const busy = (await threadLoads(host.child.pid, 1000)).filter((t) => t.load > spinning && !t.name.startsWith('node'));
     assert.deepStrictEqual(busy, []);
   } finally {
     host.child.kill('SIGKILL');
