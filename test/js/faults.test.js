@@ -140,7 +140,7 @@ async function faultCase({ folder, broken, fault, repair }) {
     await sleep(1500);
     const loads = await threadLoads(host.child.pid, 1000);
     // A spinning thread takes a whole core. Threads of the sources the fault leaves alone keep
-    // recording meanwhile (an endpoint's AAC alone is 3 to 4 % of a core here, more on a slower
+    // recording meanwhile (an endpoint's capture thread takes 3 to 4 % of a core here, more on a slower
     // machine), so the bound sits well above their work and far below a spin.
     const busy = loads.filter((t) => t.load > spinning && !t.name.startsWith('node'));
     const stop = await host.ask('stop');
