@@ -18,6 +18,7 @@ const fs = require('fs');
 const os = require('os');
 const path = require('path');
 const { startDesktop, playTone } = require('../scripts/desktop');
+const { distinct } = require('./pictures');
 const { runAddon, root } = require('../test/js/addon');
 
 const seconds = Number(process.argv[2] || 60);
@@ -34,15 +35,6 @@ function probe(file) {
   const info = JSON.parse(r.stdout);
   const s = info.streams[0];
   return { packets: Number(s.nb_read_packets), duration: Number(info.format.duration), bitRate: Number(s.bit_rate) };
-}
-
-// Pictures that differ from the one before (mpdecimate's defaults). Packet counts alone do not
-// show a dropped picture: x11grab writes whatever the screen holds at each tick of its 30 fps
-// clock, the same picture again when the screen has not changed since.
-function distinct(file) {
-  const r = spawnSync('ffmpeg', ['-v', 'error', '-i', file, '-vf', 'mpdecimate', '-f', 'framecrc', '-'],
-    { encoding: 'utf8', maxBuffer: 64 << 20 });
-  return r.stdout.split('\n').filter((line) => line && !line.startsWith('#')).length;
 }
 
 async function main() {

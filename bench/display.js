@@ -15,19 +15,11 @@ const fs = require('fs');
 const os = require('os');
 const path = require('path');
 const { startDesktop } = require('../scripts/desktop');
+const { distinct } = require('./pictures');
 const { runAddon, root } = require('../test/js/addon');
 
 const seconds = Number(process.argv.slice(2).find((a) => /^\d+$/.test(a)) || 20);
 const load = process.argv.includes('--load');
-
-// Pictures that differ from the one before (mpdecimate's defaults): the add-on writes a picture
-// in every slot of its 30 fps grid, repeating the last one when none came, so its packet count
-// alone cannot show a dropped picture.
-function distinct(file) {
-  const r = spawnSync('ffmpeg', ['-v', 'error', '-i', file, '-vf', 'mpdecimate', '-f', 'framecrc', '-'],
-    { encoding: 'utf8', maxBuffer: 64 << 20 });
-  return r.stdout.split('\n').filter((line) => line && !line.startsWith('#')).length;
-}
 
 function frames(file) {
   const r = spawnSync('ffprobe', ['-v', 'error', '-select_streams', 'v:0', '-count_packets', '-show_entries',

@@ -24,3 +24,11 @@ ComPtr<T> adopt(T* counted) {
   *held.GetAddressOf() = counted;
   return held;
 }
+
+// Whether the holder's reference is the only one left, so that what it holds may be written into
+// again (read from the count a balanced AddRef and Release report).
+template <class T>
+bool heldOnlyBy(const ComPtr<T>& holder) {
+  holder->AddRef();
+  return holder->Release() == 1;
+}

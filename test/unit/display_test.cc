@@ -358,7 +358,7 @@ TEST_F(DisplayGrab, WhileAClipRecordsThePicturesItHasNotTakenStayAndTheirMemoryI
   acquireFrame();
   source.capture();
   EXPECT_EQ(source.queue->frames.back()->data.get(), taken);
-  EXPECT_EQ(source.queue->frames.back()->data.get_deleter().pool, source.pixels);
+  EXPECT_EQ(source.queue->frames.back()->data.get_deleter().pool, source.queue->pixels);
   EXPECT_EQ(source.queue->frames.size(), 2u);
 }
 

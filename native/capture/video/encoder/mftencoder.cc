@@ -212,10 +212,7 @@ void MFTEncoder::writeFrame(const Frame& frame, LONGLONG time) {
   const DWORD length = static_cast<DWORD>(queue->width) * static_cast<DWORD>(queue->height) * 4;
   // A new 8 MB buffer for every picture would cost the system a fresh zeroed page per 4 KB.
   ComPtr<IMFMediaBuffer> buffer;
-  if (spareBuffer) {
-    spareBuffer->AddRef();
-    if (spareBuffer->Release() == 1) buffer = spareBuffer;
-  }
+  if (spareBuffer && heldOnlyBy(spareBuffer)) buffer = spareBuffer;
   if (!buffer) {
     checkResult(file, 88, MFCreateMemoryBuffer(length, buffer.GetAddressOf()), "Could not create memory buffer");
     spareBuffer = buffer;

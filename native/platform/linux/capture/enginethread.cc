@@ -26,6 +26,7 @@ extern "C" {
 #include <thread>
 #include <vector>
 
+#include "platform/com.h"
 #include "platform/linux/capture/devicereader.h"
 #include "platform/linux/capture/enginestate.h"
 #include "platform/linux/ffmpeg/evenpicture.h"
@@ -445,9 +446,8 @@ void EngineThread::fail(HRESULT status) {
 // null if none could be made.
 IMFMediaBuffer* EngineThread::pooledBuffer(std::vector<ComPtr<IMFMediaBuffer>>& pool, DWORD length) {
   for (auto& buffer : pool) {
-    buffer->AddRef();
     DWORD room = 0;
-    if (buffer->Release() == 1 && SUCCEEDED(buffer->GetMaxLength(&room)) && room >= length) return buffer.Get();
+    if (heldOnlyBy(buffer) && SUCCEEDED(buffer->GetMaxLength(&room)) && room >= length) return buffer.Get();
   }
   ComPtr<IMFMediaBuffer> made;
   if (FAILED(MFCreateMemoryBuffer(length, made.GetAddressOf()))) return nullptr;

@@ -44,7 +44,6 @@ class CaptureManager {
 
     std::atomic<uint32_t> references{1};
     CaptureManager* manager = nullptr;
-    std::unique_ptr<capture::video::Frame> spare;  // the picture written into next (engine's thread only)
 
    protected:
     virtual ~CaptureEngineVideoPreviewCB() = default;

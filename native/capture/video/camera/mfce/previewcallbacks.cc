@@ -9,21 +9,13 @@
 
 namespace capture::video::camera::mfce {
 
-void replaceFrame(capture::video::FrameQueue& queue, const uint8_t* pixels, int64_t timestamp,
-                  std::unique_ptr<Frame>& spare) {
-  // Copy before taking the lock: preview() holds it while it scales. Nothing reads the spare:
-  // it left the queue under the lock.
-  if (!spare || spare->width != queue.width || spare->height != queue.height ||
-      spare->channelOrder != queue.channelOrder)
-    spare = Frame::make(queue.width, queue.height, queue.channelOrder, timestamp);
-  spare->timestamp = timestamp;
-  std::memcpy(spare->data.get(), pixels, spare->size);
+void replaceFrame(capture::video::FrameQueue& queue, const uint8_t* pixels, int64_t timestamp) {
+  // Copy before taking the lock: preview() holds it while it scales.
+  std::unique_ptr<Frame> frame = Frame::make(queue.width, queue.height, queue.channelOrder, timestamp, queue.pixels);
+  std::memcpy(frame->data.get(), pixels, frame->size);
   std::lock_guard<std::mutex> lock(queue.mutex);
-  std::unique_ptr<Frame> replaced;
-  if (!queue.frames.empty()) replaced = std::move(queue.frames.back());
   queue.frames.clear();
-  queue.frames.push_back(std::move(spare));
-  spare = std::move(replaced);
+  queue.frames.push_back(std::move(frame));
 }
 
 namespace {
@@ -117,7 +109,7 @@ HRESULT CaptureManager::CaptureEngineVideoPreviewCB::OnSample(IMFSample* sample)
   DWORD length = 0;
   if (lockSample(sample, buffer, &data, &length) != S_OK) return S_FALSE;
   // The engine delivers whole ARGB32 pictures of the queue's size; the length is not compared.
-  replaceFrame(*manager->frameQueue, data, capture::currentTimeMillis(), spare);
+  replaceFrame(*manager->frameQueue, data, capture::currentTimeMillis());
   return unlockSample(buffer.Get());
 }
 

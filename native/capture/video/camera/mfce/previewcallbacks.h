@@ -3,17 +3,14 @@
 #pragma once
 
 #include <cstdint>
-#include <memory>
 
 #include "capture/video/frame.h"
 
 namespace capture::video::camera::mfce {
 
-// Copies width x height x 4 bytes of pixels into a frame that becomes the queue's only one. The
-// frame is spare when it has the queue's size, else a new one; spare is then the frame it replaced,
-// so that a picture every 33 ms does not cost a fresh block of memory (a page fault per 4 KB).
-void replaceFrame(capture::video::FrameQueue& queue, const uint8_t* pixels, int64_t timestamp,
-                  std::unique_ptr<capture::video::Frame>& spare);
+// Copies width x height x 4 bytes of pixels into a frame of the queue's pool (the memory of the
+// frame it replaces, so a picture every 33 ms costs no fresh block) that becomes its only one.
+void replaceFrame(capture::video::FrameQueue& queue, const uint8_t* pixels, int64_t timestamp);
 
 struct Peaks {
   double left = 0.0;

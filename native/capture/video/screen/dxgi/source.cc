@@ -37,7 +37,6 @@ Source::Source(IDXGIOutput1* output, ID3D11Device* device, bool selected) : outp
   stagingTexture = adopt(createStagingTexture(device, outputWidth, outputHeight));
   duplication = adopt(duplicateOutput(output, device));
   queue = std::make_shared<capture::video::FrameQueue>(capture::toWide(name()), outputWidth, outputHeight, 0);
-  pixels = std::make_shared<capture::video::PixelPool>(static_cast<uint64_t>(outputWidth) * outputHeight * 4);
 }
 
 Source::~Source() = default;
@@ -107,7 +106,7 @@ void Source::capture() {
   hr = context->Map(stagingTexture.Get(), 0, D3D11_MAP_READ, 0, &mapped);
   capture::checkResult("native/capture/video/screen/dxgi/source", 94, hr, "Could not map device context for image.");
 
-  auto frame = capture::video::Frame::make(outputWidth, outputHeight, 0, capture::currentTimeMillis(), pixels);
+  auto frame = capture::video::Frame::make(outputWidth, outputHeight, 0, capture::currentTimeMillis(), queue->pixels);
   // Rows are taken as packed at outputWidth * 4 bytes; RowPitch is not consulted.
   capture::video::copyPicture(frame->data.get(), mapped.pData, frame->size);
   if (captureMouse) drawPointer(pointer, *frame);

@@ -38,8 +38,7 @@ class Source : public capture::video::Source {
 
   // Shared with the recording thread, which may outlive the source.
   std::shared_ptr<capture::video::FrameQueue> queue;
-  std::shared_ptr<capture::video::PixelPool> pixels;  // the pictures' memory, used again
-  std::shared_ptr<capture::video::Clip> clip;         // the latest clip, guarded by queue->mutex
+  std::shared_ptr<capture::video::Clip> clip;  // the latest clip, guarded by queue->mutex
   ComPtr<IDXGIOutput1> output;
   ComPtr<ID3D11Device> device;
   ComPtr<ID3D11DeviceContext> context;
