@@ -15,10 +15,10 @@
 // The capture thread's CPU is also measured for a few seconds with preview on and recording
 // off, so the encoder's share shows. Voluntary context switches count the wake-ups per thread.
 // A floor is printed as well: FFmpeg's AAC encoder on the same tone from a file (the encoder both
-// sides use) plus a bare loop of 5 ms sleeps (test/tools/sleeploop.cc, the capture loop's wait
+// sides use) plus a bare loop of 5 ms sleeps (bench/tools/sleeploop.cc, the capture loop's wait
 // while its buffer is empty); a recording that polls cannot cost less than the two together.
 //
-// Latency: test/tools/tonestart.cc (built here with g++) plays silence into the sink through a
+// Latency: bench/tools/tonestart.cc (built here with g++) plays silence into the sink through a
 // 5 ms stream, then tones separated by silence. For each tone it prints the monotonic time at
 // which it wrote the first tone bytes and the time the sink plays them (write time plus the
 // stream's latency from timing information fetched just before the write). The add-on's child
@@ -54,9 +54,9 @@ async function main() {
     const tone = path.join(dir, 'tone.wav');
     execFileSync('sox', ['-n', '-r', '48000', '-c', '2', '-b', '16', tone, 'synth', String(seconds + 15), 'sine', '440', 'vol', '0.5']);
     const tonestart = path.join(dir, 'tonestart');
-    execFileSync('g++', ['-O2', '-o', tonestart, path.join(root, 'test/tools/tonestart.cc'), '-lpulse']);
+    execFileSync('g++', ['-O2', '-o', tonestart, path.join(root, 'bench/tools/tonestart.cc'), '-lpulse']);
     const sleeploop = path.join(dir, 'sleeploop');
-    execFileSync('g++', ['-O2', '-o', sleeploop, path.join(root, 'test/tools/sleeploop.cc')]);
+    execFileSync('g++', ['-O2', '-o', sleeploop, path.join(root, 'bench/tools/sleeploop.cc')]);
 
     const clip = path.join(dir, 'addon.mp4');
     const { reports, code, stdout, stderr } = await runAddon(`

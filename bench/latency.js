@@ -3,7 +3,7 @@
 // change on a 1920x1080 display, against how long after a test camera's picture leaves its source
 // the host sees it (bench/clockcamera.js), in the same run.
 //
-// test/tools/xflip (built here with g++) fills the whole screen with red, green or blue when told
+// bench/tools/xflip (built here with g++) fills the whole screen with red, green or blue when told
 // and prints the monotonic clock just before its drawing request; the add-on's process polls a
 // 64x36 preview of the display as fast as its event loop turns (process.hrtime is the same clock)
 // until the centre pixel has the new colour. The changes come 20-50 ms apart, at random, so they
@@ -29,7 +29,7 @@ function summary(values, what) {
 async function main() {
   const dir = fs.mkdtempSync(path.join(os.tmpdir(), 'tavio-bench-latency-'));
   const xflip = path.join(dir, 'xflip');
-  execFileSync('g++', ['-O2', '-o', xflip, path.join(root, 'test/tools/xflip.cc'), '-lxcb']);
+  execFileSync('g++', ['-O2', '-o', xflip, path.join(root, 'bench/tools/xflip.cc'), '-lxcb']);
   const desktop = await startDesktop({ width: 1920, height: 1080, microphone: null });
   try {
     const run = await runAddon(`${CLOCK_READER}
