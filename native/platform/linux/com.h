@@ -71,11 +71,9 @@ constexpr HRESULT E_ABORT = hresult(0x80004004);
 constexpr HRESULT E_FAIL = hresult(0x80004005);
 constexpr HRESULT E_UNEXPECTED = hresult(0x8000FFFF);
 constexpr HRESULT E_ACCESSDENIED = hresult(0x80070005);
-constexpr HRESULT E_HANDLE = hresult(0x80070006);
 constexpr HRESULT E_OUTOFMEMORY = hresult(0x8007000E);
 constexpr HRESULT E_INVALIDARG = hresult(0x80070057);
 constexpr HRESULT RPC_E_CHANGED_MODE = hresult(0x80010106);
-constexpr HRESULT CO_E_NOTINITIALIZED = hresult(0x800401F0);
 constexpr HRESULT REGDB_E_CLASSNOTREG = hresult(0x80040154);
 constexpr HRESULT CLASS_E_NOAGGREGATION = hresult(0x80040110);
 constexpr HRESULT CLASS_E_CLASSNOTAVAILABLE = hresult(0x80040111);
@@ -89,7 +87,6 @@ constexpr HRESULT HRESULT_FROM_WIN32(uint32_t error) {
 
 // Win32 error codes the layer returns (through HRESULT_FROM_WIN32 or GetLastError).
 constexpr DWORD ERROR_SUCCESS = 0;
-constexpr DWORD ERROR_FILE_NOT_FOUND = 2;
 constexpr DWORD ERROR_PATH_NOT_FOUND = 3;
 constexpr DWORD ERROR_ACCESS_DENIED = 5;
 constexpr DWORD ERROR_INVALID_HANDLE = 6;
@@ -101,7 +98,6 @@ constexpr DWORD ERROR_FILE_EXISTS = 80;
 constexpr DWORD ERROR_INVALID_PARAMETER = 87;
 constexpr DWORD ERROR_DISK_FULL = 112;
 constexpr DWORD ERROR_INVALID_NAME = 123;
-constexpr DWORD ERROR_ALREADY_EXISTS = 183;
 constexpr DWORD ERROR_FILENAME_EXCED_RANGE = 206;
 constexpr DWORD ERROR_INVALID_WINDOW_HANDLE = 1400;
 
@@ -119,7 +115,6 @@ using REFCLSID = const GUID&;
 
 inline bool operator==(const GUID& a, const GUID& b) { return std::memcmp(&a, &b, sizeof(GUID)) == 0; }
 inline bool operator!=(const GUID& a, const GUID& b) { return !(a == b); }
-inline bool IsEqualGUID(REFGUID a, REFGUID b) { return a == b; }
 
 inline constexpr GUID GUID_NULL = {0, 0, 0, {0, 0, 0, 0, 0, 0, 0, 0}};
 inline constexpr GUID IID_IUnknown = {0x00000000, 0x0000, 0x0000, {0xC0, 0, 0, 0, 0, 0, 0, 0x46}};
@@ -240,8 +235,6 @@ HRESULT PropVariantCopy(PROPVARIANT* destination, const PROPVARIANT* source);
 // System message texts.
 constexpr DWORD FORMAT_MESSAGE_ALLOCATE_BUFFER = 0x100;
 constexpr DWORD FORMAT_MESSAGE_IGNORE_INSERTS = 0x200;
-constexpr DWORD FORMAT_MESSAGE_FROM_STRING = 0x400;
-constexpr DWORD FORMAT_MESSAGE_FROM_HMODULE = 0x800;
 constexpr DWORD FORMAT_MESSAGE_FROM_SYSTEM = 0x1000;
 constexpr DWORD LMEM_FIXED = 0;
 constexpr DWORD LMEM_ZEROINIT = 0x40;

@@ -24,54 +24,20 @@ constexpr HRESULT MF_E_BUFFERTOOSMALL = hresult(0xC00D36B1);
 constexpr HRESULT MF_E_INVALIDREQUEST = hresult(0xC00D36B2);
 constexpr HRESULT MF_E_INVALIDSTREAMNUMBER = hresult(0xC00D36B3);
 constexpr HRESULT MF_E_INVALIDMEDIATYPE = hresult(0xC00D36B4);
-constexpr HRESULT MF_E_NOTACCEPTING = hresult(0xC00D36B5);
 constexpr HRESULT MF_E_NOT_INITIALIZED = hresult(0xC00D36B6);
-constexpr HRESULT MF_E_NO_MORE_TYPES = hresult(0xC00D36B9);
 constexpr HRESULT MF_E_UNSUPPORTED_SERVICE = hresult(0xC00D36BA);
-constexpr HRESULT MF_E_UNEXPECTED = hresult(0xC00D36BB);
-constexpr HRESULT MF_E_INVALIDNAME = hresult(0xC00D36BC);
 constexpr HRESULT MF_E_INVALIDTYPE = hresult(0xC00D36BD);
-constexpr HRESULT MF_E_INVALID_FILE_FORMAT = hresult(0xC00D36BE);
-constexpr HRESULT MF_E_INVALIDINDEX = hresult(0xC00D36BF);
-constexpr HRESULT MF_E_INVALID_TIMESTAMP = hresult(0xC00D36C0);
-constexpr HRESULT MF_E_UNSUPPORTED_SCHEME = hresult(0xC00D36C3);
 constexpr HRESULT MF_E_UNSUPPORTED_BYTESTREAM_TYPE = hresult(0xC00D36C4);
 constexpr HRESULT MF_E_NO_SAMPLE_TIMESTAMP = hresult(0xC00D36C8);
 constexpr HRESULT MF_E_NO_SAMPLE_DURATION = hresult(0xC00D36C9);
 constexpr HRESULT MF_E_INVALID_STREAM_DATA = hresult(0xC00D36CB);
-constexpr HRESULT MF_E_NOT_FOUND = hresult(0xC00D36D5);
-constexpr HRESULT MF_E_MULTIPLE_BEGIN = hresult(0xC00D36D9);
 constexpr HRESULT MF_E_BAD_STARTUP_VERSION = hresult(0xC00D36E3);
 constexpr HRESULT MF_E_ATTRIBUTENOTFOUND = hresult(0xC00D36E6);
-constexpr HRESULT MF_E_CANNOT_CREATE_SINK = hresult(0xC00D36FA);
-constexpr HRESULT MF_E_END_OF_STREAM = hresult(0xC00D3E84);
-constexpr HRESULT MF_E_SHUTDOWN = hresult(0xC00D3E85);
-constexpr HRESULT MF_E_INVALID_FORMAT = hresult(0xC00D3E8C);
-constexpr HRESULT MF_E_UNSUPPORTED_FORMAT = hresult(0xC00D3E98);
-constexpr HRESULT MF_E_SINK_NO_STREAMS = hresult(0xC00D4A41);
 constexpr HRESULT MF_E_SINK_NO_SAMPLES_PROCESSED = hresult(0xC00D4A44);
 constexpr HRESULT MF_E_TOPO_CODEC_NOT_FOUND = hresult(0xC00D5212);
 constexpr HRESULT MF_E_TRANSFORM_TYPE_NOT_SET = hresult(0xC00D6D60);
 
-// Attribute values.
-enum MF_ATTRIBUTE_TYPE : DWORD {
-  MF_ATTRIBUTE_UINT32 = VT_UI4,
-  MF_ATTRIBUTE_UINT64 = VT_UI8,
-  MF_ATTRIBUTE_DOUBLE = VT_R8,
-  MF_ATTRIBUTE_GUID = VT_CLSID,
-  MF_ATTRIBUTE_STRING = VT_LPWSTR,
-  MF_ATTRIBUTE_BLOB = VT_VECTOR | VT_UI1,
-  MF_ATTRIBUTE_IUNKNOWN = VT_UNKNOWN,
-};
-enum MF_ATTRIBUTES_MATCH_TYPE : DWORD {
-  MF_ATTRIBUTES_MATCH_OUR_ITEMS = 0,
-  MF_ATTRIBUTES_MATCH_THEIR_ITEMS = 1,
-  MF_ATTRIBUTES_MATCH_ALL_ITEMS = 2,
-  MF_ATTRIBUTES_MATCH_INTERSECTION = 3,
-  MF_ATTRIBUTES_MATCH_SMALLER = 4,
-};
 using REFPROPVARIANT = const PROPVARIANT&;
-using QWORD = uint64_t;
 using UINT8 = uint8_t;
 
 enum MFVideoInterlaceMode : DWORD {
@@ -92,36 +58,6 @@ enum eAVEncH264VProfile : DWORD {
   eAVEncH264VProfile_ConstrainedBase = 256,
 };
 
-// IMFMediaType::IsEqual flags.
-constexpr DWORD MF_MEDIATYPE_EQUAL_MAJOR_TYPES = 0x1;
-constexpr DWORD MF_MEDIATYPE_EQUAL_FORMAT_TYPES = 0x2;
-constexpr DWORD MF_MEDIATYPE_EQUAL_FORMAT_DATA = 0x4;
-constexpr DWORD MF_MEDIATYPE_EQUAL_FORMAT_USER_DATA = 0x8;
-
-// Sink writer stream selectors.
-constexpr DWORD MF_SINK_WRITER_INVALID_STREAM_INDEX = 0xFFFFFFFF;
-constexpr DWORD MF_SINK_WRITER_ALL_STREAMS = 0xFFFFFFFE;
-constexpr DWORD MF_SINK_WRITER_MEDIASINK = 0xFFFFFFFF;
-
-struct MF_SINK_WRITER_STATISTICS {
-  DWORD cb;
-  LONGLONG llLastTimestampReceived;
-  LONGLONG llLastTimestampEncoded;
-  LONGLONG llLastTimestampProcessed;
-  LONGLONG llLastStreamTickReceived;
-  LONGLONG llLastSinkSampleRequest;
-  QWORD qwNumSamplesReceived;
-  QWORD qwNumSamplesEncoded;
-  QWORD qwNumSamplesProcessed;
-  QWORD qwNumStreamTicksReceived;
-  DWORD dwByteCountQueued;
-  QWORD qwByteCountProcessed;
-  DWORD dwNumOutstandingSinkSampleRequests;
-  DWORD dwAverageSampleRateReceived;
-  DWORD dwAverageSampleRateEncoded;
-  DWORD dwAverageSampleRateProcessed;
-};
-
 // Interface ids.
 inline constexpr GUID IID_IMFAttributes = {
     0x2cd2d921, 0xc447, 0x44a7, {0xa1, 0x3c, 0x4a, 0xda, 0xbf, 0xc2, 0x47, 0xe3}};
@@ -138,39 +74,27 @@ inline constexpr GUID IID_IMFSinkWriter = {
     0x3137f1cd, 0xfe5e, 0x4805, {0xa5, 0xd8, 0xfb, 0x47, 0x74, 0x48, 0xcb, 0x3d}};
 
 struct IMFAttributes : IUnknown {
-  virtual HRESULT GetItem(REFGUID key, PROPVARIANT* value) = 0;
-  virtual HRESULT GetItemType(REFGUID key, MF_ATTRIBUTE_TYPE* type) = 0;
-  virtual HRESULT CompareItem(REFGUID key, REFPROPVARIANT value, BOOL* result) = 0;
-  virtual HRESULT Compare(IMFAttributes* theirs, MF_ATTRIBUTES_MATCH_TYPE matchType, BOOL* result) = 0;
   virtual HRESULT GetUINT32(REFGUID key, UINT32* value) = 0;
   virtual HRESULT GetUINT64(REFGUID key, UINT64* value) = 0;
   virtual HRESULT GetGUID(REFGUID key, GUID* value) = 0;
-  virtual HRESULT GetStringLength(REFGUID key, UINT32* length) = 0;
-  virtual HRESULT GetString(REFGUID key, LPWSTR value, UINT32 bufferSize, UINT32* length) = 0;
   virtual HRESULT GetAllocatedString(REFGUID key, LPWSTR* value, UINT32* length) = 0;
   virtual HRESULT GetBlobSize(REFGUID key, UINT32* size) = 0;
   virtual HRESULT GetBlob(REFGUID key, UINT8* buffer, UINT32 bufferSize, UINT32* size) = 0;
-  virtual HRESULT GetAllocatedBlob(REFGUID key, UINT8** buffer, UINT32* size) = 0;
-  virtual HRESULT GetUnknown(REFGUID key, REFIID riid, LPVOID* object) = 0;
   virtual HRESULT SetItem(REFGUID key, REFPROPVARIANT value) = 0;
   virtual HRESULT DeleteItem(REFGUID key) = 0;
   virtual HRESULT DeleteAllItems() = 0;
   virtual HRESULT SetUINT32(REFGUID key, UINT32 value) = 0;
   virtual HRESULT SetUINT64(REFGUID key, UINT64 value) = 0;
-  virtual HRESULT SetDouble(REFGUID key, double value) = 0;
   virtual HRESULT SetGUID(REFGUID key, REFGUID value) = 0;
   virtual HRESULT SetString(REFGUID key, LPCWSTR value) = 0;
   virtual HRESULT SetBlob(REFGUID key, const UINT8* buffer, UINT32 size) = 0;
   virtual HRESULT SetUnknown(REFGUID key, IUnknown* value) = 0;
   virtual HRESULT GetCount(UINT32* count) = 0;
-  virtual HRESULT GetItemByIndex(UINT32 index, GUID* key, PROPVARIANT* value) = 0;
   virtual HRESULT CopyAllItems(IMFAttributes* destination) = 0;
 };
 
 struct IMFMediaType : IMFAttributes {
   virtual HRESULT GetMajorType(GUID* majorType) = 0;
-  virtual HRESULT IsCompressedFormat(BOOL* compressed) = 0;
-  virtual HRESULT IsEqual(IMFMediaType* other, DWORD* flags) = 0;
 };
 
 struct IMFMediaBuffer : IUnknown {
@@ -190,16 +114,11 @@ struct IMFSample : IMFAttributes {
   virtual HRESULT GetBufferByIndex(DWORD index, IMFMediaBuffer** buffer) = 0;
   virtual HRESULT ConvertToContiguousBuffer(IMFMediaBuffer** buffer) = 0;
   virtual HRESULT AddBuffer(IMFMediaBuffer* buffer) = 0;
-  virtual HRESULT GetTotalLength(DWORD* length) = 0;
-  virtual HRESULT CopyToBuffer(IMFMediaBuffer* buffer) = 0;
 };
 
 struct IMFCollection : IUnknown {
-  virtual HRESULT GetElementCount(DWORD* count) = 0;
   virtual HRESULT GetElement(DWORD index, IUnknown** element) = 0;
   virtual HRESULT AddElement(IUnknown* element) = 0;
-  virtual HRESULT RemoveElement(DWORD index, IUnknown** element) = 0;
-  virtual HRESULT InsertElementAt(DWORD index, IUnknown* element) = 0;
 };
 
 // Declared here as the SDK's mfobjects.h does; the capture family makes the objects.
@@ -219,10 +138,7 @@ struct IMFSinkWriter : IUnknown {
                                     IMFAttributes* encodingParameters) = 0;
   virtual HRESULT BeginWriting() = 0;
   virtual HRESULT WriteSample(DWORD streamIndex, IMFSample* sample) = 0;
-  virtual HRESULT SendStreamTick(DWORD streamIndex, LONGLONG timestamp) = 0;
-  virtual HRESULT PlaceMarker(DWORD streamIndex, LPVOID context) = 0;
   virtual HRESULT Finalize() = 0;
-  virtual HRESULT GetStatistics(DWORD streamIndex, MF_SINK_WRITER_STATISTICS* stats) = 0;
 };
 
 HRESULT MFCreateAttributes(IMFAttributes** attributes, UINT32 initialSize);
@@ -250,9 +166,6 @@ inline HRESULT MFGetAttributeSize(IMFAttributes* attributes, REFGUID key, UINT32
   }
   return hr;
 }
-inline HRESULT MFGetAttributeRatio(IMFAttributes* attributes, REFGUID key, UINT32* numerator, UINT32* denominator) {
-  return MFGetAttributeSize(attributes, key, numerator, denominator);
-}
 
 namespace platform {
 // The GUID of a wave format tag or FOURCC in the base {xxxxxxxx-0000-0010-8000-00AA00389B71},
@@ -272,42 +185,25 @@ inline constexpr GUID MF_MT_MAJOR_TYPE = {0x48eba18e, 0xf8c9, 0x4687, {0xbf, 0x1
 inline constexpr GUID MF_MT_SUBTYPE = {0xf7e34c9a, 0x42e8, 0x4714, {0xb7, 0x4b, 0xcb, 0x29, 0xd7, 0x2c, 0x35, 0xe5}};
 inline constexpr GUID MF_MT_ALL_SAMPLES_INDEPENDENT = {
     0xc9173739, 0x5e56, 0x461c, {0xb7, 0x13, 0x46, 0xfb, 0x99, 0x5c, 0xb9, 0x5f}};
-inline constexpr GUID MF_MT_FIXED_SIZE_SAMPLES = {
-    0xb8ebefaf, 0xb718, 0x4e04, {0xb0, 0xa9, 0x11, 0x67, 0x75, 0xe3, 0x32, 0x1b}};
-inline constexpr GUID MF_MT_COMPRESSED = {0x3afd0cee, 0x18f2, 0x4ba5, {0xa1, 0x10, 0x8b, 0xea, 0x50, 0x2e, 0x1f, 0x92}};
-inline constexpr GUID MF_MT_SAMPLE_SIZE = {
-    0xdad3ab78, 0x1990, 0x408b, {0xbc, 0xe2, 0xeb, 0xa6, 0x73, 0xda, 0xcc, 0x10}};
 inline constexpr GUID MF_MT_USER_DATA = {0xb6bc765f, 0x4c3b, 0x40a4, {0xbd, 0x51, 0x25, 0x35, 0xb6, 0x6f, 0xe0, 0x9d}};
 inline constexpr GUID MF_MT_AVG_BITRATE = {
     0x20332624, 0xfb0d, 0x4d9e, {0xbd, 0x0d, 0xcb, 0xf6, 0x78, 0x6c, 0x10, 0x2e}};
-inline constexpr GUID MF_MT_AVG_BIT_ERROR_RATE = {
-    0x799cabd6, 0x3508, 0x4db4, {0xa3, 0xc7, 0x56, 0x9c, 0xd5, 0x33, 0xde, 0xb1}};
 inline constexpr GUID MF_MT_INTERLACE_MODE = {
     0xe2724bb8, 0xe676, 0x4806, {0xb4, 0xb2, 0xa8, 0xd6, 0xef, 0xb4, 0x4c, 0xcd}};
 inline constexpr GUID MF_MT_FRAME_SIZE = {0x1652c33d, 0xd6b2, 0x4012, {0xb8, 0x34, 0x72, 0x03, 0x08, 0x49, 0xa3, 0x7d}};
 inline constexpr GUID MF_MT_FRAME_RATE = {0xc459a2e8, 0x3d2c, 0x4e44, {0xb1, 0x32, 0xfe, 0xe5, 0x15, 0x6c, 0x7b, 0xb0}};
-inline constexpr GUID MF_MT_FRAME_RATE_RANGE_MAX = {
-    0xe3371d41, 0xb4cf, 0x4a05, {0xbd, 0x4e, 0x20, 0xb8, 0x8b, 0xb2, 0xc4, 0xd6}};
-inline constexpr GUID MF_MT_FRAME_RATE_RANGE_MIN = {
-    0xd2e7558c, 0xdc1f, 0x403f, {0x9a, 0x72, 0xd2, 0x8b, 0xb1, 0xeb, 0x3b, 0x5e}};
 inline constexpr GUID MF_MT_PIXEL_ASPECT_RATIO = {
     0xc6376a1e, 0x8d0a, 0x4027, {0xbe, 0x45, 0x6d, 0x9a, 0x0a, 0xd3, 0x9b, 0xb6}};
 inline constexpr GUID MF_MT_MPEG2_PROFILE = {
     0xad76a80b, 0x2d5c, 0x4e0b, {0xb3, 0x75, 0x64, 0xe5, 0x20, 0x13, 0x70, 0x36}};
-inline constexpr GUID MF_MT_MPEG2_LEVEL = {
-    0x96f66574, 0x11c5, 0x4015, {0x86, 0x66, 0xbf, 0xf5, 0x16, 0x43, 0x6d, 0xa7}};
 inline constexpr GUID MF_MT_MPEG_SEQUENCE_HEADER = {
     0x3c036de7, 0x3ad0, 0x4c9e, {0x92, 0x16, 0xee, 0x6d, 0x6a, 0xc2, 0x1c, 0xb3}};
 inline constexpr GUID MF_MT_DEFAULT_STRIDE = {
     0x644b4e48, 0x1e02, 0x4516, {0xb0, 0xeb, 0xc0, 0x1c, 0xa9, 0xd4, 0x9a, 0xc6}};
-inline constexpr GUID MF_MT_VIDEO_ROTATION = {
-    0xc380465d, 0x2271, 0x428c, {0x9b, 0x83, 0xec, 0xea, 0x3b, 0x4a, 0x85, 0xc1}};
 inline constexpr GUID MF_MT_AUDIO_BITS_PER_SAMPLE = {
     0xf2deb57f, 0x40fa, 0x4764, {0xaa, 0x33, 0xed, 0x4f, 0x2d, 0x1f, 0xf6, 0x69}};
 inline constexpr GUID MF_MT_AUDIO_SAMPLES_PER_SECOND = {
     0x5faeeae7, 0x0290, 0x4c31, {0x9e, 0x8a, 0xc5, 0x34, 0xf6, 0x8d, 0x9d, 0xba}};
-inline constexpr GUID MF_MT_AUDIO_FLOAT_SAMPLES_PER_SECOND = {
-    0xfb3b724a, 0xcfb5, 0x4319, {0xae, 0xfe, 0x6e, 0x42, 0xb2, 0x40, 0x61, 0x32}};
 inline constexpr GUID MF_MT_AUDIO_NUM_CHANNELS = {
     0x37e48bf5, 0x645e, 0x4c5b, {0x89, 0xde, 0xad, 0xa9, 0xe2, 0x9b, 0x69, 0x6a}};
 inline constexpr GUID MF_MT_AUDIO_AVG_BYTES_PER_SECOND = {
@@ -333,14 +229,8 @@ inline constexpr GUID MFSampleExtension_CleanPoint = {
 inline constexpr GUID MF_LOW_LATENCY = {0x9c27891a, 0xed7a, 0x40e1, {0x88, 0xe8, 0xb2, 0x27, 0x27, 0xa0, 0x24, 0xee}};
 inline constexpr GUID MF_READWRITE_ENABLE_HARDWARE_TRANSFORMS = {
     0xa634a91c, 0x822b, 0x41b9, {0xa4, 0x94, 0x4d, 0xe4, 0x64, 0x36, 0x12, 0xb0}};
-inline constexpr GUID MF_READWRITE_DISABLE_CONVERTERS = {
-    0x98d5b065, 0x1374, 0x4847, {0x8d, 0x5d, 0x31, 0x52, 0x0f, 0xee, 0x71, 0x56}};
-inline constexpr GUID MF_READWRITE_D3D_OPTIONAL = {
-    0x216479d9, 0x3071, 0x42ca, {0xbb, 0x6c, 0x4c, 0x22, 0x10, 0x2e, 0x1d, 0x18}};
 inline constexpr GUID MF_SINK_WRITER_DISABLE_THROTTLING = {
     0x08b845d8, 0x2b74, 0x4afe, {0x9d, 0x53, 0xbe, 0x16, 0xd2, 0xd5, 0xae, 0x4f}};
-inline constexpr GUID MF_SINK_WRITER_ASYNC_CALLBACK = {
-    0x48cb183e, 0x7b0b, 0x46f4, {0x82, 0x2e, 0x5e, 0x1d, 0x2d, 0xda, 0x43, 0x54}};
 inline constexpr GUID MF_TRANSCODE_CONTAINERTYPE = {
     0x150ff23f, 0x4abc, 0x478b, {0xac, 0x4f, 0xe1, 0x91, 0x6f, 0xba, 0x1c, 0xca}};
 inline constexpr GUID MFTranscodeContainerType_ASF = {
@@ -375,7 +265,6 @@ inline constexpr GUID MFVideoFormat_RGB24 = platform::mediaSubtype(20);   // D3D
 inline constexpr GUID MFVideoFormat_H264 = platform::mediaSubtype(platform::fourcc('H', '2', '6', '4'));
 inline constexpr GUID MFVideoFormat_H264_ES = {
     0x3f40f4f0, 0x5622, 0x4ff8, {0xb6, 0xd8, 0xa1, 0x7a, 0x58, 0x4b, 0xee, 0x5e}};
-inline constexpr GUID MFVideoFormat_HEVC = platform::mediaSubtype(platform::fourcc('H', 'E', 'V', 'C'));
 inline constexpr GUID MFVideoFormat_NV12 = platform::mediaSubtype(platform::fourcc('N', 'V', '1', '2'));
 inline constexpr GUID MFVideoFormat_YUY2 = platform::mediaSubtype(platform::fourcc('Y', 'U', 'Y', '2'));
 inline constexpr GUID MFVideoFormat_I420 = platform::mediaSubtype(platform::fourcc('I', '4', '2', '0'));

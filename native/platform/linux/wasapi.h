@@ -15,9 +15,6 @@ enum EDataFlow { eRender = 0, eCapture = 1, eAll = 2, EDataFlow_enum_count = 3 }
 enum ERole { eConsole = 0, eMultimedia = 1, eCommunications = 2, ERole_enum_count = 3 };
 
 constexpr DWORD DEVICE_STATE_ACTIVE = 0x1;
-constexpr DWORD DEVICE_STATE_DISABLED = 0x2;
-constexpr DWORD DEVICE_STATE_NOTPRESENT = 0x4;
-constexpr DWORD DEVICE_STATE_UNPLUGGED = 0x8;
 constexpr DWORD DEVICE_STATEMASK_ALL = 0xF;
 
 constexpr DWORD STGM_READ = 0x0;
@@ -47,10 +44,8 @@ constexpr HRESULT AUDCLNT_E_BUFFER_TOO_LARGE = audclntError(0x6);
 constexpr HRESULT AUDCLNT_E_OUT_OF_ORDER = audclntError(0x7);
 constexpr HRESULT AUDCLNT_E_UNSUPPORTED_FORMAT = audclntError(0x8);
 constexpr HRESULT AUDCLNT_E_INVALID_SIZE = audclntError(0x9);
-constexpr HRESULT AUDCLNT_E_DEVICE_IN_USE = audclntError(0xA);
 constexpr HRESULT AUDCLNT_E_BUFFER_OPERATION_PENDING = audclntError(0xB);
 constexpr HRESULT AUDCLNT_E_EXCLUSIVE_MODE_NOT_ALLOWED = audclntError(0xE);
-constexpr HRESULT AUDCLNT_E_ENDPOINT_CREATE_FAILED = audclntError(0xF);
 constexpr HRESULT AUDCLNT_E_SERVICE_NOT_RUNNING = audclntError(0x10);
 constexpr HRESULT AUDCLNT_S_BUFFER_EMPTY = audclntSuccess(0x1);
 

@@ -34,7 +34,6 @@ struct StreamSlot {
   ComPtr<IMFMediaType> input;
   AVStream* stream = nullptr;
   std::unique_ptr<StreamEncoder> encoder;
-  MF_SINK_WRITER_STATISTICS statistics{};
 };
 
 const char* muxerOf(REFGUID container) {
@@ -152,31 +151,7 @@ class SinkWriter : public ComObject<IMFSinkWriter, IID_IMFSinkWriter> {
     hr = slot.encoder->write(data, length, time, hasTime, duration, hasDuration,
                              get32(sample, MFSampleExtension_CleanPoint, FALSE) != FALSE);
     if (buffer) buffer->Unlock();
-    MF_SINK_WRITER_STATISTICS& s = slot.statistics;
-    ++s.qwNumSamplesReceived;
-    if (hasTime) s.llLastTimestampReceived = s.llLastTimestampEncoded = s.llLastTimestampProcessed = time;
-    if (SUCCEEDED(hr)) {
-      ++s.qwNumSamplesEncoded;
-      ++s.qwNumSamplesProcessed;
-      s.qwByteCountProcessed += length;
-    }
     return hr;
-  }
-
-  HRESULT SendStreamTick(DWORD streamIndex, LONGLONG timestamp) override {
-    std::lock_guard<std::mutex> lock(mutex_);
-    if (streamIndex >= streams_.size()) return MF_E_INVALIDSTREAMNUMBER;
-    if (state_ != State::writing) return MF_E_INVALIDREQUEST;
-    ++streams_[streamIndex].statistics.qwNumStreamTicksReceived;
-    streams_[streamIndex].statistics.llLastStreamTickReceived = timestamp;
-    return S_OK;  // a gap needs no marker here: the next sample's time opens it
-  }
-
-  // Markers are answered through the asynchronous callback, which this writer does not offer.
-  HRESULT PlaceMarker(DWORD streamIndex, LPVOID) override {
-    std::lock_guard<std::mutex> lock(mutex_);
-    if (streamIndex >= streams_.size()) return MF_E_INVALIDSTREAMNUMBER;
-    return MF_E_INVALIDREQUEST;
   }
 
   HRESULT Finalize() override {
@@ -203,16 +178,6 @@ class SinkWriter : public ComObject<IMFSinkWriter, IID_IMFSinkWriter> {
     if (SUCCEEDED(hr)) hr = fromAv(trailer < 0 ? trailer : closed);
     if (SUCCEEDED(hr) && !anyPackets) hr = MF_E_SINK_NO_SAMPLES_PROCESSED;
     return hr;
-  }
-
-  HRESULT GetStatistics(DWORD streamIndex, MF_SINK_WRITER_STATISTICS* stats) override {
-    if (!stats) return E_INVALIDARG;
-    std::lock_guard<std::mutex> lock(mutex_);
-    if (stats->cb != sizeof(MF_SINK_WRITER_STATISTICS)) return E_INVALIDARG;
-    if (streamIndex == MF_SINK_WRITER_ALL_STREAMS || streamIndex >= streams_.size()) return MF_E_INVALIDSTREAMNUMBER;
-    *stats = streams_[streamIndex].statistics;
-    stats->cb = sizeof(MF_SINK_WRITER_STATISTICS);
-    return S_OK;
   }
 
  private:

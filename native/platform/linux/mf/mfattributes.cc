@@ -13,8 +13,8 @@ namespace {
 constexpr HRESULT insufficientBuffer = HRESULT_FROM_WIN32(122);  // ERROR_INSUFFICIENT_BUFFER
 
 bool storable(VARTYPE vt) {
-  return vt == VT_UI4 || vt == VT_UI8 || vt == VT_R8 || vt == VT_CLSID || vt == VT_LPWSTR ||
-         vt == (VT_VECTOR | VT_UI1) || vt == VT_UNKNOWN;
+  return vt == VT_UI4 || vt == VT_UI8 || vt == VT_CLSID || vt == VT_LPWSTR || vt == (VT_VECTOR | VT_UI1) ||
+         vt == VT_UNKNOWN;
 }
 
 size_t units(const wchar_t* text) {
@@ -24,24 +24,6 @@ size_t units(const wchar_t* text) {
 }
 
 }  // namespace
-
-bool equalValues(const PROPVARIANT& a, const PROPVARIANT& b) {
-  if (a.vt != b.vt) return false;
-  switch (a.vt) {
-    case VT_EMPTY: return true;
-    case VT_I4:
-    case VT_UI4: return a.ulVal == b.ulVal;
-    case VT_UI8: return a.uhVal == b.uhVal;
-    case VT_R8: return a.dblVal == b.dblVal;
-    case VT_CLSID: return a.puuid && b.puuid && *a.puuid == *b.puuid;
-    case VT_LPWSTR: return a.pwszVal && b.pwszVal && std::wcscmp(a.pwszVal, b.pwszVal) == 0;
-    case VT_UNKNOWN: return a.punkVal == b.punkVal;
-    case VT_VECTOR | VT_UI1:
-      return a.caub.cElems == b.caub.cElems &&
-             (a.caub.cElems == 0 || std::memcmp(a.caub.pElems, b.caub.pElems, a.caub.cElems) == 0);
-    default: return false;
-  }
-}
 
 AttributeStore::~AttributeStore() { deleteAllItems(); }
 
@@ -77,72 +59,6 @@ HRESULT AttributeStore::store(REFGUID key, const PROPVARIANT& value) {
   return S_OK;
 }
 
-HRESULT AttributeStore::getItem(REFGUID key, PROPVARIANT* value) {
-  std::lock_guard<std::recursive_mutex> lock(mutex_);
-  const PROPVARIANT* found = find(key);
-  if (!found) return MF_E_ATTRIBUTENOTFOUND;
-  if (!value) return S_OK;  // a null value only asks whether the key is there
-  return PropVariantCopy(value, found);
-}
-
-HRESULT AttributeStore::getItemType(REFGUID key, MF_ATTRIBUTE_TYPE* type) {
-  if (!type) return E_POINTER;
-  std::lock_guard<std::recursive_mutex> lock(mutex_);
-  const PROPVARIANT* found = find(key);
-  if (!found) return MF_E_ATTRIBUTENOTFOUND;
-  *type = static_cast<MF_ATTRIBUTE_TYPE>(found->vt);
-  return S_OK;
-}
-
-HRESULT AttributeStore::compareItem(REFGUID key, REFPROPVARIANT value, BOOL* result) {
-  if (!result) return E_POINTER;
-  std::lock_guard<std::recursive_mutex> lock(mutex_);
-  const PROPVARIANT* found = find(key);
-  *result = found && equalValues(*found, value);
-  return S_OK;
-}
-
-HRESULT AttributeStore::compare(IMFAttributes* self, IMFAttributes* theirs, MF_ATTRIBUTES_MATCH_TYPE matchType,
-                                BOOL* result) {
-  if (!theirs || !result) return E_POINTER;
-  if (matchType > MF_ATTRIBUTES_MATCH_SMALLER) return E_INVALIDARG;
-  *result = FALSE;
-  if (theirs == self) {
-    *result = TRUE;
-    return S_OK;
-  }
-  // Every item of `from` must be in `to` with an equal value.
-  auto contained = [](IMFAttributes* from, IMFAttributes* to, bool onlyShared) {
-    UINT32 count = 0;
-    from->GetCount(&count);
-    for (UINT32 i = 0; i < count; ++i) {
-      GUID key;
-      PROPVARIANT value;
-      PropVariantInit(&value);
-      if (FAILED(from->GetItemByIndex(i, &key, &value))) return false;
-      BOOL same = FALSE;
-      bool present = SUCCEEDED(to->GetItem(key, nullptr));
-      if (present) to->CompareItem(key, value, &same);
-      PropVariantClear(&value);
-      if (onlyShared ? (present && !same) : !same) return false;
-    }
-    return true;
-  };
-  std::lock_guard<std::recursive_mutex> lock(mutex_);
-  UINT32 ours = static_cast<UINT32>(items_.size()), theirCount = 0;
-  theirs->GetCount(&theirCount);
-  switch (matchType) {
-    case MF_ATTRIBUTES_MATCH_OUR_ITEMS: *result = contained(self, theirs, false); break;
-    case MF_ATTRIBUTES_MATCH_THEIR_ITEMS: *result = contained(theirs, self, false); break;
-    case MF_ATTRIBUTES_MATCH_ALL_ITEMS: *result = ours == theirCount && contained(self, theirs, false); break;
-    case MF_ATTRIBUTES_MATCH_INTERSECTION: *result = contained(self, theirs, true); break;
-    case MF_ATTRIBUTES_MATCH_SMALLER:
-      *result = ours <= theirCount ? contained(self, theirs, false) : contained(theirs, self, false);
-      break;
-  }
-  return S_OK;
-}
-
 HRESULT AttributeStore::getUINT32(REFGUID key, UINT32* value) {
   return read(key, VT_UI4, value, [](const PROPVARIANT& v) { return v.ulVal; });
 }
@@ -151,29 +67,8 @@ HRESULT AttributeStore::getUINT64(REFGUID key, UINT64* value) {
   return read(key, VT_UI8, value, [](const PROPVARIANT& v) { return v.uhVal; });
 }
 
-HRESULT AttributeStore::getDouble(REFGUID key, double* value) {
-  return read(key, VT_R8, value, [](const PROPVARIANT& v) { return v.dblVal; });
-}
-
 HRESULT AttributeStore::getGUID(REFGUID key, GUID* value) {
   return read(key, VT_CLSID, value, [](const PROPVARIANT& v) { return *v.puuid; });
-}
-
-HRESULT AttributeStore::getStringLength(REFGUID key, UINT32* length) {
-  return read(key, VT_LPWSTR, length, [](const PROPVARIANT& v) { return static_cast<UINT32>(units(v.pwszVal)); });
-}
-
-HRESULT AttributeStore::getString(REFGUID key, LPWSTR value, UINT32 bufferSize, UINT32* length) {
-  if (!value) return E_POINTER;
-  std::lock_guard<std::recursive_mutex> lock(mutex_);
-  const PROPVARIANT* found;
-  HRESULT hr = typed(key, VT_LPWSTR, &found);
-  if (FAILED(hr)) return hr;
-  const size_t n = units(found->pwszVal);
-  if (n + 1 > bufferSize) return insufficientBuffer;
-  std::memcpy(value, found->pwszVal, (n + 1) * sizeof(wchar_t));
-  if (length) *length = static_cast<UINT32>(n);
-  return S_OK;
 }
 
 HRESULT AttributeStore::getAllocatedString(REFGUID key, LPWSTR* value, UINT32* length) {
@@ -209,29 +104,6 @@ HRESULT AttributeStore::getBlob(REFGUID key, UINT8* buffer, UINT32 bufferSize, U
   return S_OK;
 }
 
-HRESULT AttributeStore::getAllocatedBlob(REFGUID key, UINT8** buffer, UINT32* size) {
-  if (!buffer || !size) return E_POINTER;
-  std::lock_guard<std::recursive_mutex> lock(mutex_);
-  const PROPVARIANT* found;
-  HRESULT hr = typed(key, VT_VECTOR | VT_UI1, &found);
-  if (FAILED(hr)) return hr;
-  *buffer = static_cast<UINT8*>(CoTaskMemAlloc(found->caub.cElems));
-  if (found->caub.cElems) std::memcpy(*buffer, found->caub.pElems, found->caub.cElems);
-  *size = found->caub.cElems;
-  return S_OK;
-}
-
-HRESULT AttributeStore::getUnknown(REFGUID key, REFIID riid, LPVOID* object) {
-  if (!object) return E_POINTER;
-  *object = nullptr;
-  std::lock_guard<std::recursive_mutex> lock(mutex_);
-  const PROPVARIANT* found;
-  HRESULT hr = typed(key, VT_UNKNOWN, &found);
-  if (FAILED(hr)) return hr;
-  if (!found->punkVal) return E_NOINTERFACE;
-  return found->punkVal->QueryInterface(riid, object);
-}
-
 HRESULT AttributeStore::setItem(REFGUID key, REFPROPVARIANT value) { return store(key, value); }
 
 HRESULT AttributeStore::deleteItem(REFGUID key) {
@@ -264,14 +136,6 @@ HRESULT AttributeStore::setUINT64(REFGUID key, UINT64 value) {
   PropVariantInit(&v);
   v.vt = VT_UI8;
   v.uhVal = value;
-  return store(key, v);
-}
-
-HRESULT AttributeStore::setDouble(REFGUID key, double value) {
-  PROPVARIANT v;
-  PropVariantInit(&v);
-  v.vt = VT_R8;
-  v.dblVal = value;
   return store(key, v);
 }
 
@@ -311,29 +175,11 @@ HRESULT AttributeStore::setUnknown(REFGUID key, IUnknown* value) {
   return store(key, v);
 }
 
-HRESULT AttributeStore::lockStore() {
-  mutex_.lock();
-  return S_OK;
-}
-
-HRESULT AttributeStore::unlockStore() {
-  mutex_.unlock();
-  return S_OK;
-}
-
 HRESULT AttributeStore::getCount(UINT32* count) {
   if (!count) return E_POINTER;
   std::lock_guard<std::recursive_mutex> lock(mutex_);
   *count = static_cast<UINT32>(items_.size());
   return S_OK;
-}
-
-HRESULT AttributeStore::getItemByIndex(UINT32 index, GUID* key, PROPVARIANT* value) {
-  if (!key) return E_POINTER;
-  std::lock_guard<std::recursive_mutex> lock(mutex_);
-  if (index >= items_.size()) return E_INVALIDARG;
-  *key = items_[index].first;
-  return value ? PropVariantCopy(value, &items_[index].second) : S_OK;
 }
 
 HRESULT AttributeStore::copyAllItems(IMFAttributes* destination) {
@@ -354,47 +200,6 @@ class MediaType : public Attributes<IMFMediaType, IID_IMFMediaType> {
   HRESULT GetMajorType(GUID* majorType) override {
     if (!majorType) return E_POINTER;
     return GetGUID(MF_MT_MAJOR_TYPE, majorType);
-  }
-
-  // Media Foundation calls a type compressed unless it says all its samples are independent.
-  HRESULT IsCompressedFormat(BOOL* compressed) override {
-    if (!compressed) return E_POINTER;
-    UINT32 independent = 0;
-    if (FAILED(GetUINT32(MF_MT_ALL_SAMPLES_INDEPENDENT, &independent))) independent = 0;
-    *compressed = independent ? FALSE : TRUE;
-    return S_OK;
-  }
-
-  HRESULT IsEqual(IMFMediaType* other, DWORD* flags) override {
-    if (!other || !flags) return E_INVALIDARG;
-    *flags = 0;
-    GUID ours, theirs;
-    if (FAILED(GetMajorType(&ours)) || FAILED(other->GetMajorType(&theirs))) return E_INVALIDARG;
-    if (ours == theirs) *flags |= MF_MEDIATYPE_EQUAL_MAJOR_TYPES;
-    GUID ourSubtype = GUID_NULL, theirSubtype = GUID_NULL;
-    GetGUID(MF_MT_SUBTYPE, &ourSubtype);
-    other->GetGUID(MF_MT_SUBTYPE, &theirSubtype);
-    if (ourSubtype == theirSubtype) *flags |= MF_MEDIATYPE_EQUAL_FORMAT_TYPES;
-    // Format data: every item but the user data is the same in both.
-    ComPtr<IMFAttributes> a, b;
-    MFCreateAttributes(a.GetAddressOf(), 0);
-    MFCreateAttributes(b.GetAddressOf(), 0);
-    CopyAllItems(a.Get());
-    other->CopyAllItems(b.Get());
-    a->DeleteItem(MF_MT_USER_DATA);
-    b->DeleteItem(MF_MT_USER_DATA);
-    BOOL same = FALSE;
-    a->Compare(b.Get(), MF_ATTRIBUTES_MATCH_ALL_ITEMS, &same);
-    if (same) *flags |= MF_MEDIATYPE_EQUAL_FORMAT_DATA;
-    PROPVARIANT ourData, theirData;
-    PropVariantInit(&ourData);
-    PropVariantInit(&theirData);
-    GetItem(MF_MT_USER_DATA, &ourData);
-    other->GetItem(MF_MT_USER_DATA, &theirData);
-    if (equalValues(ourData, theirData)) *flags |= MF_MEDIATYPE_EQUAL_FORMAT_USER_DATA;
-    PropVariantClear(&ourData);
-    PropVariantClear(&theirData);
-    return *flags == 0xF ? S_OK : S_FALSE;
   }
 };
 

@@ -12,7 +12,7 @@
 namespace platform {
 
 // Items keyed by GUID in insertion order, each holding its own copy of the value. Safe to use from
-// several threads, as Media Foundation's stores are; LockStore holds the lock across calls.
+// several threads, as Media Foundation's stores are.
 class AttributeStore {
  public:
   AttributeStore() = default;
@@ -20,35 +20,22 @@ class AttributeStore {
   AttributeStore& operator=(const AttributeStore&) = delete;
   ~AttributeStore();
 
-  HRESULT getItem(REFGUID key, PROPVARIANT* value);
-  HRESULT getItemType(REFGUID key, MF_ATTRIBUTE_TYPE* type);
-  HRESULT compareItem(REFGUID key, REFPROPVARIANT value, BOOL* result);
-  HRESULT compare(IMFAttributes* self, IMFAttributes* theirs, MF_ATTRIBUTES_MATCH_TYPE matchType, BOOL* result);
   HRESULT getUINT32(REFGUID key, UINT32* value);
   HRESULT getUINT64(REFGUID key, UINT64* value);
-  HRESULT getDouble(REFGUID key, double* value);
   HRESULT getGUID(REFGUID key, GUID* value);
-  HRESULT getStringLength(REFGUID key, UINT32* length);
-  HRESULT getString(REFGUID key, LPWSTR value, UINT32 bufferSize, UINT32* length);
   HRESULT getAllocatedString(REFGUID key, LPWSTR* value, UINT32* length);
   HRESULT getBlobSize(REFGUID key, UINT32* size);
   HRESULT getBlob(REFGUID key, UINT8* buffer, UINT32 bufferSize, UINT32* size);
-  HRESULT getAllocatedBlob(REFGUID key, UINT8** buffer, UINT32* size);
-  HRESULT getUnknown(REFGUID key, REFIID riid, LPVOID* object);
   HRESULT setItem(REFGUID key, REFPROPVARIANT value);
   HRESULT deleteItem(REFGUID key);
   HRESULT deleteAllItems();
   HRESULT setUINT32(REFGUID key, UINT32 value);
   HRESULT setUINT64(REFGUID key, UINT64 value);
-  HRESULT setDouble(REFGUID key, double value);
   HRESULT setGUID(REFGUID key, REFGUID value);
   HRESULT setString(REFGUID key, LPCWSTR value);
   HRESULT setBlob(REFGUID key, const UINT8* buffer, UINT32 size);
   HRESULT setUnknown(REFGUID key, IUnknown* value);
-  HRESULT lockStore();
-  HRESULT unlockStore();
   HRESULT getCount(UINT32* count);
-  HRESULT getItemByIndex(UINT32 index, GUID* key, PROPVARIANT* value);
   HRESULT copyAllItems(IMFAttributes* destination);
 
  private:
@@ -73,28 +60,13 @@ class AttributeStore {
   std::vector<std::pair<GUID, PROPVARIANT>> items_;
 };
 
-// True when both values have the same type and the same content.
-bool equalValues(const PROPVARIANT& a, const PROPVARIANT& b);
-
 // IMFAttributes for the interface I (IMFAttributes itself or an interface derived from it).
 template <class I, const GUID&... Iids>
 class Attributes : public ComObject<I, IID_IMFAttributes, Iids...> {
  public:
-  HRESULT GetItem(REFGUID key, PROPVARIANT* value) override { return attributes_.getItem(key, value); }
-  HRESULT GetItemType(REFGUID key, MF_ATTRIBUTE_TYPE* type) override { return attributes_.getItemType(key, type); }
-  HRESULT CompareItem(REFGUID key, REFPROPVARIANT value, BOOL* result) override {
-    return attributes_.compareItem(key, value, result);
-  }
-  HRESULT Compare(IMFAttributes* theirs, MF_ATTRIBUTES_MATCH_TYPE matchType, BOOL* result) override {
-    return attributes_.compare(this, theirs, matchType, result);
-  }
   HRESULT GetUINT32(REFGUID key, UINT32* value) override { return attributes_.getUINT32(key, value); }
   HRESULT GetUINT64(REFGUID key, UINT64* value) override { return attributes_.getUINT64(key, value); }
   HRESULT GetGUID(REFGUID key, GUID* value) override { return attributes_.getGUID(key, value); }
-  HRESULT GetStringLength(REFGUID key, UINT32* length) override { return attributes_.getStringLength(key, length); }
-  HRESULT GetString(REFGUID key, LPWSTR value, UINT32 bufferSize, UINT32* length) override {
-    return attributes_.getString(key, value, bufferSize, length);
-  }
   HRESULT GetAllocatedString(REFGUID key, LPWSTR* value, UINT32* length) override {
     return attributes_.getAllocatedString(key, value, length);
   }
@@ -102,18 +74,11 @@ class Attributes : public ComObject<I, IID_IMFAttributes, Iids...> {
   HRESULT GetBlob(REFGUID key, UINT8* buffer, UINT32 bufferSize, UINT32* size) override {
     return attributes_.getBlob(key, buffer, bufferSize, size);
   }
-  HRESULT GetAllocatedBlob(REFGUID key, UINT8** buffer, UINT32* size) override {
-    return attributes_.getAllocatedBlob(key, buffer, size);
-  }
-  HRESULT GetUnknown(REFGUID key, REFIID riid, LPVOID* object) override {
-    return attributes_.getUnknown(key, riid, object);
-  }
   HRESULT SetItem(REFGUID key, REFPROPVARIANT value) override { return attributes_.setItem(key, value); }
   HRESULT DeleteItem(REFGUID key) override { return attributes_.deleteItem(key); }
   HRESULT DeleteAllItems() override { return attributes_.deleteAllItems(); }
   HRESULT SetUINT32(REFGUID key, UINT32 value) override { return attributes_.setUINT32(key, value); }
   HRESULT SetUINT64(REFGUID key, UINT64 value) override { return attributes_.setUINT64(key, value); }
-  HRESULT SetDouble(REFGUID key, double value) override { return attributes_.setDouble(key, value); }
   HRESULT SetGUID(REFGUID key, REFGUID value) override { return attributes_.setGUID(key, value); }
   HRESULT SetString(REFGUID key, LPCWSTR value) override { return attributes_.setString(key, value); }
   HRESULT SetBlob(REFGUID key, const UINT8* buffer, UINT32 size) override {
@@ -121,9 +86,6 @@ class Attributes : public ComObject<I, IID_IMFAttributes, Iids...> {
   }
   HRESULT SetUnknown(REFGUID key, IUnknown* value) override { return attributes_.setUnknown(key, value); }
   HRESULT GetCount(UINT32* count) override { return attributes_.getCount(count); }
-  HRESULT GetItemByIndex(UINT32 index, GUID* key, PROPVARIANT* value) override {
-    return attributes_.getItemByIndex(index, key, value);
-  }
   HRESULT CopyAllItems(IMFAttributes* destination) override { return attributes_.copyAllItems(destination); }
 
  protected:

@@ -91,12 +91,28 @@ class Sample : public Attributes<IMFSample, IID_IMFSample> {
     if (buffers_.empty()) return E_UNEXPECTED;
     if (buffers_.size() == 1) return buffers_[0].CopyTo(buffer);
     DWORD total = 0;
-    GetTotalLength(&total);
+    for (const ComPtr<IMFMediaBuffer>& part : buffers_) {
+      DWORD current = 0;
+      part->GetCurrentLength(&current);
+      total += current;
+    }
     ComPtr<IMFMediaBuffer> joined;
     HRESULT hr = MFCreateMemoryBuffer(total, joined.GetAddressOf());
     if (FAILED(hr)) return hr;
-    hr = CopyToBuffer(joined.Get());
-    if (FAILED(hr)) return hr;
+    BYTE* out = nullptr;
+    joined->Lock(&out, nullptr, nullptr);
+    DWORD offset = 0;
+    for (const ComPtr<IMFMediaBuffer>& part : buffers_) {
+      BYTE* in = nullptr;
+      DWORD current = 0;
+      if (SUCCEEDED(part->Lock(&in, nullptr, &current))) {
+        if (current) std::memcpy(out + offset, in, current);
+        offset += current;
+        part->Unlock();
+      }
+    }
+    joined->Unlock();
+    joined->SetCurrentLength(offset);
     buffers_.assign(1, joined);
     return joined.CopyTo(buffer);
   }
@@ -104,41 +120,6 @@ class Sample : public Attributes<IMFSample, IID_IMFSample> {
     if (!buffer) return E_INVALIDARG;
     buffers_.emplace_back(buffer);
     return S_OK;
-  }
-  HRESULT GetTotalLength(DWORD* length) override {
-    if (!length) return E_POINTER;
-    DWORD total = 0;
-    for (const ComPtr<IMFMediaBuffer>& buffer : buffers_) {
-      DWORD current = 0;
-      buffer->GetCurrentLength(&current);
-      total += current;
-    }
-    *length = total;
-    return S_OK;
-  }
-  HRESULT CopyToBuffer(IMFMediaBuffer* destination) override {
-    if (!destination) return E_POINTER;
-    DWORD total = 0, maxLength = 0;
-    GetTotalLength(&total);
-    BYTE* out = nullptr;
-    HRESULT hr = destination->Lock(&out, &maxLength, nullptr);
-    if (FAILED(hr)) return hr;
-    if (maxLength < total) {
-      destination->Unlock();
-      return MF_E_BUFFERTOOSMALL;
-    }
-    DWORD offset = 0;
-    for (const ComPtr<IMFMediaBuffer>& buffer : buffers_) {
-      BYTE* in = nullptr;
-      DWORD current = 0;
-      if (SUCCEEDED(buffer->Lock(&in, nullptr, &current))) {
-        if (current) std::memcpy(out + offset, in, current);
-        offset += current;
-        buffer->Unlock();
-      }
-    }
-    destination->Unlock();
-    return destination->SetCurrentLength(offset);
   }
 
  private:
@@ -151,11 +132,6 @@ class Sample : public Attributes<IMFSample, IID_IMFSample> {
 
 class Collection : public ComObject<IMFCollection, IID_IMFCollection> {
  public:
-  HRESULT GetElementCount(DWORD* count) override {
-    if (!count) return E_POINTER;
-    *count = static_cast<DWORD>(elements_.size());
-    return S_OK;
-  }
   HRESULT GetElement(DWORD index, IUnknown** element) override {
     if (!element) return E_POINTER;
     if (index >= elements_.size()) return E_INVALIDARG;
@@ -163,18 +139,7 @@ class Collection : public ComObject<IMFCollection, IID_IMFCollection> {
     return elements_[index] ? elements_[index].CopyTo(element) : S_OK;
   }
   HRESULT AddElement(IUnknown* element) override {
-    return InsertElementAt(static_cast<DWORD>(elements_.size()), element);
-  }
-  HRESULT RemoveElement(DWORD index, IUnknown** element) override {
-    if (!element) return E_POINTER;
-    if (index >= elements_.size()) return E_INVALIDARG;
-    *element = elements_[index].Detach();  // the collection's reference passes to the caller
-    elements_.erase(elements_.begin() + index);
-    return S_OK;
-  }
-  HRESULT InsertElementAt(DWORD index, IUnknown* element) override {
-    if (index > elements_.size()) return E_INVALIDARG;
-    elements_.insert(elements_.begin() + index, ComPtr<IUnknown>(element));
+    elements_.emplace_back(element);
     return S_OK;
   }
 
