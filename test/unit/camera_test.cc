@@ -21,14 +21,14 @@ namespace mfce = capture::video::camera::mfce;
 
 namespace {
 
-IMFMediaType* videoType(const GUID& subtype, UINT32 width, UINT32 height, UINT32 num, UINT32 den) {
-  IMFMediaType* type = nullptr;
+ComPtr<IMFMediaType> videoType(const GUID& subtype, UINT32 width, UINT32 height, UINT32 num, UINT32 den) {
+  ComPtr<IMFMediaType> type;
   EXPECT_EQ(S_OK, MFCreateMediaType(&type));
   type->SetGUID(MF_MT_MAJOR_TYPE, MFMediaType_Video);
   type->SetGUID(MF_MT_SUBTYPE, subtype);
-  MFSetAttributeSize(type, MF_MT_FRAME_SIZE, width, height);
-  MFSetAttributeRatio(type, MF_MT_FRAME_RATE, num, den);
-  MFSetAttributeRatio(type, MF_MT_PIXEL_ASPECT_RATIO, 1, 1);
+  MFSetAttributeSize(type.Get(), MF_MT_FRAME_SIZE, width, height);
+  MFSetAttributeRatio(type.Get(), MF_MT_FRAME_RATE, num, den);
+  MFSetAttributeRatio(type.Get(), MF_MT_PIXEL_ASPECT_RATIO, 1, 1);
   type->SetUINT32(MF_MT_INTERLACE_MODE, MFVideoInterlace_Progressive);
   return type;
 }
@@ -77,15 +77,14 @@ TEST(CameraMediaTypes, EstimateBitrateInSinglePrecision) {
   EXPECT_EQ(9216000u, mfce::EstimateBitrate(1280, 720, 30, 1));
   EXPECT_EQ(9206793u, mfce::EstimateBitrate(1280, 720, 30000, 1001));
   EXPECT_EQ(20736000u, mfce::EstimateBitrate(1920, 1080, 30, 1));
-  IMFMediaType* type = videoType(MFVideoFormat_MJPG, 1280, 720, 30000, 1001);
-  EXPECT_EQ(9206793u, mfce::EstimateBitrate(type));
-  type->Release();
+  ComPtr<IMFMediaType> type = videoType(MFVideoFormat_MJPG, 1280, 720, 30000, 1001);
+  EXPECT_EQ(9206793u, mfce::EstimateBitrate(type.Get()));
 }
 
 TEST(CameraMediaTypes, MakeVideoTypeCopiesGeometryAndNeedsEveryItem) {
-  IMFMediaType* source = videoType(MFVideoFormat_YUY2, 640, 480, 30, 1);
+  ComPtr<IMFMediaType> source = videoType(MFVideoFormat_YUY2, 640, 480, 30, 1);
   IMFMediaType* made = nullptr;
-  ASSERT_EQ(S_OK, mfce::MakeVideoType(source, MFVideoFormat_ARGB32, &made));
+  ASSERT_EQ(S_OK, mfce::MakeVideoType(source.Get(), MFVideoFormat_ARGB32, &made));
   GUID subtype{};
   made->GetGUID(MF_MT_SUBTYPE, &subtype);
   EXPECT_EQ(MFVideoFormat_ARGB32, subtype);
@@ -96,9 +95,8 @@ TEST(CameraMediaTypes, MakeVideoTypeCopiesGeometryAndNeedsEveryItem) {
 
   source->DeleteItem(MF_MT_INTERLACE_MODE);
   made = nullptr;
-  EXPECT_EQ(MF_E_ATTRIBUTENOTFOUND, mfce::MakeVideoType(source, MFVideoFormat_H264, &made));
+  EXPECT_EQ(MF_E_ATTRIBUTENOTFOUND, mfce::MakeVideoType(source.Get(), MFVideoFormat_H264, &made));
   EXPECT_EQ(nullptr, made);
-  source->Release();
 }
 
 TEST(CameraMediaTypes, MakePcmType) {
@@ -196,10 +194,23 @@ TEST(CameraPreviewCallbacks, VideoSampleReplacesTheQueue) {
   EXPECT_EQ(300, queue.frames.back()->timestamp);
 }
 
-TEST(CameraCaptureManager, RecordsOnlyToDotMp4SpeltExactly) {
-  mfce::CaptureManager manager;
+// A fake engine held by `manager`. An answering one answers each command at once, as its event
+// handled by the manager, which then needs the event it signals.
+fakes::FakeCaptureEngine* fakeEngine(mfce::CaptureManager& manager, bool answering = false) {
   auto* engine = new fakes::FakeCaptureEngine;
   manager.engine.Attach(engine);
+  if (answering) {
+    manager.engineEvent = CreateEventA(nullptr, FALSE, FALSE, nullptr);
+    engine->answer = [&manager](const GUID& type, HRESULT status) {
+      manager.HandleEngineEvent(new FakeEvent(type, status));
+    };
+  }
+  return engine;
+}
+
+TEST(CameraCaptureManager, RecordsOnlyToDotMp4SpeltExactly) {
+  mfce::CaptureManager manager;
+  auto* engine = fakeEngine(manager);
   manager.hasVideo = 1;
   engine->AddRef();
   for (const wchar_t* path : {L"/tmp/clip.MP4", L"/tmp/clip.mp4x", L"/tmp/clip", L"/tmp/a.mp4/clip"})
@@ -213,22 +224,12 @@ TEST(CameraCaptureManager, RecordsOnlyToDotMp4SpeltExactly) {
   engine->Release();
 }
 
-// The fake engine answers each command at once, as its event handled by the manager.
-void answerThrough(mfce::CaptureManager& manager, fakes::FakeCaptureEngine* engine) {
-  engine->answer = [&manager](const GUID& type, HRESULT status) {
-    manager.HandleEngineEvent(new FakeEvent(type, status));
-  };
-}
-
 TEST(CameraCaptureManager, VideoRecordStreamAsksForH264) {
   mfce::CaptureManager manager;
-  manager.engineEvent = CreateEventA(nullptr, FALSE, FALSE, nullptr);
-  auto* engine = new fakes::FakeCaptureEngine;
-  manager.engine.Attach(engine);
-  answerThrough(manager, engine);
+  auto* engine = fakeEngine(manager, true);
   manager.hasVideo = 1;
-  IMFMediaType* mjpg = videoType(MFVideoFormat_MJPG, 640, 480, 30, 1);
-  engine->source->videoType = mjpg;
+  ComPtr<IMFMediaType> mjpg = videoType(MFVideoFormat_MJPG, 640, 480, 30, 1);
+  engine->source->videoType = mjpg.Get();
   ASSERT_EQ(S_OK, manager.StartRecord(L"/tmp/clip.mp4"));
   EXPECT_EQ(L"/tmp/clip.mp4", engine->sink->fileName);
   EXPECT_EQ(1, engine->sink->removeAllCalls);
@@ -243,8 +244,8 @@ TEST(CameraCaptureManager, VideoRecordStreamAsksForH264) {
   EXPECT_EQ(3072000u, bitrate);
 
   // A camera that sends H.264 passes its stream through: no bit rate is asked for.
-  IMFMediaType* h264 = videoType(MFVideoFormat_H264_ES, 1280, 720, 30, 1);
-  engine->source->videoType = h264;
+  ComPtr<IMFMediaType> h264 = videoType(MFVideoFormat_H264_ES, 1280, 720, 30, 1);
+  engine->source->videoType = h264.Get();
   ASSERT_EQ(S_OK, manager.StopRecord());
   ASSERT_EQ(S_OK, manager.StartRecord(L"/tmp/clip.mp4"));
   ASSERT_EQ(2u, engine->sink->added.size());
@@ -252,17 +253,12 @@ TEST(CameraCaptureManager, VideoRecordStreamAsksForH264) {
   EXPECT_EQ(MFVideoFormat_H264, subtype);
   EXPECT_EQ(MF_E_ATTRIBUTENOTFOUND, engine->sink->added[1]->GetUINT32(MF_MT_AVG_BITRATE, &bitrate));
   engine->source->videoType = nullptr;
-  mjpg->Release();
-  h264->Release();
   manager.DestroyEngine();
 }
 
 TEST(CameraCaptureManager, AudioRecordStreamIsTheFirstAacType) {
   mfce::CaptureManager manager;
-  manager.engineEvent = CreateEventA(nullptr, FALSE, FALSE, nullptr);
-  auto* engine = new fakes::FakeCaptureEngine;
-  manager.engine.Attach(engine);
-  answerThrough(manager, engine);
+  auto* engine = fakeEngine(manager, true);
   manager.hasAudio = 1;
   ASSERT_EQ(S_OK, manager.StartRecord(L"/tmp/clip.mp4"));
   ASSERT_EQ(1u, engine->sink->added.size());
@@ -323,8 +319,7 @@ TEST(CameraCaptureManager, EngineEventsSetFlagsAndSignalEveryTime) {
   EXPECT_TRUE(signalled(manager.engineEvent));
 
   // The error event tears the engine down; later operations find none.
-  auto* engine = new fakes::FakeCaptureEngine;
-  manager.engine.Attach(engine);
+  auto* engine = fakeEngine(manager);
   manager.recording = true;
   handle(MF_CAPTURE_ENGINE_ERROR, E_FAIL);
   EXPECT_FALSE(manager.engine);
@@ -341,11 +336,10 @@ TEST(CameraCaptureManager, EngineEventsSetFlagsAndSignalEveryTime) {
 
 TEST(CameraCaptureManager, PreviewIsConfiguredOnceAndLaterCallsKeepTheCallersSize) {
   mfce::CaptureManager manager;
-  auto* engine = new fakes::FakeCaptureEngine;
-  manager.engine.Attach(engine);
+  auto* engine = fakeEngine(manager);
   manager.hasVideo = 1;
-  IMFMediaType* yuy2 = videoType(MFVideoFormat_YUY2, 1280, 720, 30, 1);
-  engine->source->videoType = yuy2;
+  ComPtr<IMFMediaType> yuy2 = videoType(MFVideoFormat_YUY2, 1280, 720, 30, 1);
+  engine->source->videoType = yuy2.Get();
 
   UINT32 width = 640, height = 480;
   ASSERT_EQ(S_OK, manager.ConfigurePreview(width, height));
@@ -374,18 +368,16 @@ TEST(CameraCaptureManager, PreviewIsConfiguredOnceAndLaterCallsKeepTheCallersSiz
   EXPECT_EQ(1u, engine->preview->added.size());
 
   engine->source->videoType = nullptr;
-  yuy2->Release();
   manager.DestroyEngine();
 }
 
 TEST(CameraCaptureManager, APreviewThatFailedAfterGettingItsSinkIsNotConfiguredAgain) {
   mfce::CaptureManager manager;
-  auto* engine = new fakes::FakeCaptureEngine;
-  manager.engine.Attach(engine);
+  auto* engine = fakeEngine(manager);
   manager.hasVideo = 1;
   manager.hasAudio = 1;  // the fake source has no audio stream: the audio part fails
-  IMFMediaType* yuy2 = videoType(MFVideoFormat_YUY2, 1280, 720, 30, 1);
-  engine->source->videoType = yuy2;
+  ComPtr<IMFMediaType> yuy2 = videoType(MFVideoFormat_YUY2, 1280, 720, 30, 1);
+  engine->source->videoType = yuy2.Get();
 
   UINT32 width = 640, height = 480;
   EXPECT_EQ(MF_E_INVALIDSTREAMNUMBER, manager.ConfigurePreview(width, height));
@@ -399,10 +391,9 @@ TEST(CameraCaptureManager, APreviewThatFailedAfterGettingItsSinkIsNotConfiguredA
 
   // While previewing nothing is configured either.
   mfce::CaptureManager previewing;
-  auto* other = new fakes::FakeCaptureEngine;
-  previewing.engine.Attach(other);
+  auto* other = fakeEngine(previewing);
   previewing.hasVideo = 1;
-  other->source->videoType = yuy2;
+  other->source->videoType = yuy2.Get();
   previewing.previewing = true;
   EXPECT_EQ(S_OK, previewing.ConfigurePreview(width, height));
   EXPECT_EQ(640u, width);
@@ -410,7 +401,6 @@ TEST(CameraCaptureManager, APreviewThatFailedAfterGettingItsSinkIsNotConfiguredA
   previewing.previewing = false;
   other->source->videoType = nullptr;
   engine->source->videoType = nullptr;
-  yuy2->Release();
   previewing.DestroyEngine();
   manager.DestroyEngine();
 }
@@ -420,8 +410,7 @@ TEST(CameraCaptureManager, APreviewThatFailedAfterGettingItsSinkIsNotConfiguredA
 TEST(CameraCaptureManager, WaitsForTheEventOfItsOwnCommand) {
   mfce::CaptureManager manager;
   manager.engineEvent = CreateEventA(nullptr, FALSE, TRUE, nullptr);  // the initialised event's signal
-  auto* engine = new fakes::FakeCaptureEngine;
-  manager.engine.Attach(engine);
+  auto* engine = fakeEngine(manager);
   manager.hasAudio = 1;
   std::vector<std::thread> answers;
   engine->answer = [&](const GUID& type, HRESULT status) {
@@ -449,13 +438,10 @@ TEST(CameraCaptureManager, WaitsForTheEventOfItsOwnCommand) {
 
 TEST(CameraCaptureManager, AStartTheEngineRefusesOrAnEngineErrorEndsTheWait) {
   mfce::CaptureManager manager;
-  manager.engineEvent = CreateEventA(nullptr, FALSE, FALSE, nullptr);
-  auto* engine = new fakes::FakeCaptureEngine;
-  manager.engine.Attach(engine);
+  auto* engine = fakeEngine(manager, true);
   manager.hasVideo = 1;
-  IMFMediaType* yuy2 = videoType(MFVideoFormat_YUY2, 64, 48, 30, 1);
-  engine->source->videoType = yuy2;
-  answerThrough(manager, engine);
+  ComPtr<IMFMediaType> yuy2 = videoType(MFVideoFormat_YUY2, 64, 48, 30, 1);
+  engine->source->videoType = yuy2.Get();
   // The file could not be made: the start's answer carries the system's code.
   engine->recordStartStatus = HRESULT_FROM_WIN32(ERROR_PATH_NOT_FOUND);
   EXPECT_EQ(HRESULT_FROM_WIN32(ERROR_PATH_NOT_FOUND), manager.StartRecord(L"/missing/clip.mp4"));
@@ -463,7 +449,6 @@ TEST(CameraCaptureManager, AStartTheEngineRefusesOrAnEngineErrorEndsTheWait) {
 
   // A device lost before the engine answered: the wait ends with the engine.
   engine->source->videoType = nullptr;
-  yuy2->Release();
   std::thread lost;
   engine->answer = [&](const GUID&, HRESULT) {
     lost = std::thread([&manager] {

@@ -74,14 +74,4 @@ TEST(Descriptor, CamerasAreVideoMicrophonesAndEndpointsAreNot) {
   EXPECT_STREQ(capture::typeName(42), "wasapi");
 }
 
-TEST(SourceKinds, AudioAndVideoFollowTheKind) {
-  FakeAudio source;
-  const bool audio[] = {false, true, true, false};
-  for (int32_t kind = 0; kind < 4; ++kind) {
-    source.kind = kind;
-    EXPECT_EQ(source.isAudio(), audio[kind]) << kind;
-    EXPECT_EQ(source.isVideo(), !audio[kind]) << kind;
-  }
-}
-
 }  // namespace

@@ -76,78 +76,67 @@ void writeRawStream(const std::string& path, const media::CameraStream& camera, 
     file.write(reinterpret_cast<const char*>(camera.packets[i].data()), camera.packets[i].size());
 }
 
-// Records the camera file with an engine whose record stream asks for H.264 of the camera's
-// size, with `bitRate` when it is not 0; returns once the engine has read the whole file (the
-// end of a device ends the recording and finishes the file).
-// An engine initialised for the camera behind `link`, with its event callback; released at the end.
+// An engine initialised for the camera behind `link`, with its event callback.
 struct InitializedEngine {
   explicit InitializedEngine(const std::wstring& link) {
-    IMFCaptureEngineClassFactory* factory = nullptr;
+    ComPtr<IMFCaptureEngineClassFactory> factory;
     EXPECT_EQ(
         platform::createCaptureEngineClassFactory(IID_IMFCaptureEngineClassFactory, reinterpret_cast<void**>(&factory)),
         S_OK);
     EXPECT_EQ(factory->CreateInstance(CLSID_MFCaptureEngine, IID_IMFCaptureEngine, reinterpret_cast<void**>(&engine)),
               S_OK);
-    factory->Release();
     EXPECT_EQ(platform::createDeviceActivate(MF_DEVSOURCE_ATTRIBUTE_SOURCE_TYPE_VIDCAP_GUID, L"Camera", link, &device),
               S_OK);
-    EXPECT_EQ(engine->Initialize(events, nullptr, nullptr, device), S_OK);
+    EXPECT_EQ(engine->Initialize(events.Get(), nullptr, nullptr, device.Get()), S_OK);
     EXPECT_EQ(events->waitFor(MF_CAPTURE_ENGINE_INITIALIZED), S_OK);
   }
-  ~InitializedEngine() {
-    engine->Release();
-    device->Release();
-    events->Release();
-  }
-  IMFCaptureEngine* engine = nullptr;
-  IMFActivate* device = nullptr;
-  Events* events = new Events;
+  ComPtr<IMFCaptureEngine> engine;
+  ComPtr<IMFActivate> device;
+  ComPtr<Events> events = adopt(new Events);
 };
+
+// The camera's current record stream type.
+ComPtr<IMFMediaType> deviceType(IMFCaptureEngine* engine) {
+  ComPtr<IMFCaptureSource> source;
+  ComPtr<IMFMediaType> type;
+  EXPECT_EQ(engine->GetSource(&source), S_OK);
+  EXPECT_EQ(source->GetCurrentDeviceMediaType(MF_CAPTURE_ENGINE_PREFERRED_SOURCE_STREAM_FOR_VIDEO_RECORD, &type), S_OK);
+  return type;
+}
 
 // Gives the engine's record sink one H.264 stream of the camera's size (with `bitRate` when it is
 // not 0) and the clip's name.
 void prepareRecord(IMFCaptureEngine* engine, const std::string& clip, UINT32 bitRate) {
-  IMFCaptureSource* source = nullptr;
-  IMFMediaType* deviceType = nullptr;
-  EXPECT_EQ(engine->GetSource(&source), S_OK);
-  EXPECT_EQ(source->GetCurrentDeviceMediaType(MF_CAPTURE_ENGINE_PREFERRED_SOURCE_STREAM_FOR_VIDEO_RECORD, &deviceType),
-            S_OK);
-  IMFMediaType* recordType = nullptr;
+  ComPtr<IMFMediaType> recordType;
   MFCreateMediaType(&recordType);
-  deviceType->CopyAllItems(recordType);
+  deviceType(engine)->CopyAllItems(recordType.Get());
   recordType->SetGUID(MF_MT_SUBTYPE, MFVideoFormat_H264);
   if (bitRate) recordType->SetUINT32(MF_MT_AVG_BITRATE, bitRate);
-  IMFCaptureSink* sink = nullptr;
-  IMFCaptureRecordSink* recordSink = nullptr;
+  ComPtr<IMFCaptureSink> sink;
+  ComPtr<IMFCaptureRecordSink> recordSink;
   EXPECT_EQ(engine->GetSink(MF_CAPTURE_ENGINE_SINK_TYPE_RECORD, &sink), S_OK);
   EXPECT_EQ(sink->QueryInterface(IID_IMFCaptureRecordSink, reinterpret_cast<void**>(&recordSink)), S_OK);
   DWORD index = 0;
   EXPECT_EQ(recordSink->RemoveAllStreams(), S_OK);
-  EXPECT_EQ(
-      recordSink->AddStream(MF_CAPTURE_ENGINE_PREFERRED_SOURCE_STREAM_FOR_VIDEO_RECORD, recordType, nullptr, &index),
-      S_OK);
+  EXPECT_EQ(recordSink->AddStream(MF_CAPTURE_ENGINE_PREFERRED_SOURCE_STREAM_FOR_VIDEO_RECORD, recordType.Get(), nullptr,
+                                  &index),
+            S_OK);
   EXPECT_EQ(recordSink->SetOutputFileName(platform::widen(clip).c_str()), S_OK);
-  for (IUnknown* object : std::initializer_list<IUnknown*>{recordSink, sink, recordType, deviceType, source})
-    object->Release();
 }
 
 GUID deviceSubtype(IMFCaptureEngine* engine) {
-  IMFCaptureSource* source = nullptr;
-  IMFMediaType* deviceType = nullptr;
   GUID subtype = GUID_NULL;
-  EXPECT_EQ(engine->GetSource(&source), S_OK);
-  EXPECT_EQ(source->GetCurrentDeviceMediaType(MF_CAPTURE_ENGINE_PREFERRED_SOURCE_STREAM_FOR_VIDEO_RECORD, &deviceType),
-            S_OK);
-  deviceType->GetGUID(MF_MT_SUBTYPE, &subtype);
-  deviceType->Release();
-  source->Release();
+  deviceType(engine)->GetGUID(MF_MT_SUBTYPE, &subtype);
   return subtype;
 }
 
+// Records the camera file with an engine whose record stream asks for H.264 of the camera's
+// size, with `bitRate` when it is not 0; returns once the engine has read the whole file (the
+// end of a device ends the recording and finishes the file).
 void record(const std::string& camera, const std::string& clip, UINT32 bitRate) {
   InitializedEngine initialized(platform::widen("h264:" + camera));
-  EXPECT_EQ(deviceSubtype(initialized.engine), MFVideoFormat_H264);
-  prepareRecord(initialized.engine, clip, bitRate);
+  EXPECT_EQ(deviceSubtype(initialized.engine.Get()), MFVideoFormat_H264);
+  prepareRecord(initialized.engine.Get(), clip, bitRate);
   EXPECT_EQ(initialized.engine->StartRecord(), S_OK);
   EXPECT_EQ(initialized.events->waitFor(MF_CAPTURE_ENGINE_RECORD_STARTED), S_OK);
   EXPECT_EQ(initialized.events->waitFor(MF_CAPTURE_ENGINE_ERROR), MF_E_VIDEO_RECORDING_DEVICE_INVALIDATED);
@@ -300,8 +289,8 @@ TEST(LinuxCaptureEngine, APictureACallbackKeepsIsNotOverwrittenByTheNextOnes) {
   MediaFoundation started;
   // Every picture differs from the one before: the pattern moves.
   InitializedEngine initialized(L"lavfi:testsrc2=size=64x48:rate=30");
-  IMFCaptureEngine* engine = initialized.engine;
-  Events* events = initialized.events;
+  IMFCaptureEngine* engine = initialized.engine.Get();
+  Events* events = initialized.events.Get();
 
   IMFCaptureSink* sink = nullptr;
   IMFCapturePreviewSink* previewSink = nullptr;
@@ -404,8 +393,8 @@ TEST(LinuxCaptureEngine, BackToBackClipsAreAnsweredInOrderAndEachIsAFile) {
   MediaFoundation started;
   media::TempFolder folder;
   InitializedEngine initialized(L"lavfi:testsrc2=size=64x48:rate=30");
-  IMFCaptureEngine* engine = initialized.engine;
-  Events* events = initialized.events;
+  IMFCaptureEngine* engine = initialized.engine.Get();
+  Events* events = initialized.events.Get();
   const std::string clips[] = {folder.file("first.mp4"), folder.file("second.mp4")};
 
   prepareRecord(engine, clips[0], 200000);

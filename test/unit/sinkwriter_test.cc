@@ -21,88 +21,82 @@ struct MediaFoundation {
 
 std::wstring wide(const std::string& path) { return platform::widen(path); }
 
-IMFSinkWriter* createWriter(const std::string& path, HRESULT* result = nullptr, bool mp4 = true) {
-  IMFAttributes* attributes = nullptr;
+ComPtr<IMFSinkWriter> createWriter(const std::string& path, HRESULT* result = nullptr, bool mp4 = true) {
+  ComPtr<IMFAttributes> attributes;
   MFCreateAttributes(&attributes, 0);
   attributes->SetUINT32(MF_LOW_LATENCY, TRUE);
   attributes->SetUINT32(MF_SINK_WRITER_DISABLE_THROTTLING, TRUE);
   if (mp4) attributes->SetGUID(MF_TRANSCODE_CONTAINERTYPE, MFTranscodeContainerType_MPEG4);
-  IMFSinkWriter* writer = nullptr;
-  HRESULT hr = MFCreateSinkWriterFromURL(wide(path).c_str(), nullptr, attributes, &writer);
-  attributes->Release();
+  ComPtr<IMFSinkWriter> writer;
+  HRESULT hr = MFCreateSinkWriterFromURL(wide(path).c_str(), nullptr, attributes.Get(), &writer);
   if (result) *result = hr;
   return writer;
 }
 
-IMFMediaType* h264Type(UINT32 width, UINT32 height, UINT32 profile = eAVEncH264VProfile_Main) {
-  IMFMediaType* type = nullptr;
+ComPtr<IMFMediaType> h264Type(UINT32 width, UINT32 height, UINT32 profile = eAVEncH264VProfile_Main) {
+  ComPtr<IMFMediaType> type;
   MFCreateMediaType(&type);
   type->SetGUID(MF_MT_MAJOR_TYPE, MFMediaType_Video);
   type->SetGUID(MF_MT_SUBTYPE, MFVideoFormat_H264);
   type->SetUINT32(MF_MT_AVG_BITRATE, 10485760);
   type->SetUINT32(MF_MT_INTERLACE_MODE, MFVideoInterlace_Progressive);
-  MFSetAttributeSize(type, MF_MT_FRAME_SIZE, width, height);
-  MFSetAttributeRatio(type, MF_MT_FRAME_RATE, 30, 1);
-  MFSetAttributeRatio(type, MF_MT_PIXEL_ASPECT_RATIO, 1, 1);
+  MFSetAttributeSize(type.Get(), MF_MT_FRAME_SIZE, width, height);
+  MFSetAttributeRatio(type.Get(), MF_MT_FRAME_RATE, 30, 1);
+  MFSetAttributeRatio(type.Get(), MF_MT_PIXEL_ASPECT_RATIO, 1, 1);
   type->SetUINT32(MF_MT_MPEG2_PROFILE, profile);
   return type;
 }
 
-IMFMediaType* rgb32Type(UINT32 width, UINT32 height) {
-  IMFMediaType* type = nullptr;
+ComPtr<IMFMediaType> rgb32Type(UINT32 width, UINT32 height) {
+  ComPtr<IMFMediaType> type;
   MFCreateMediaType(&type);
   type->SetGUID(MF_MT_MAJOR_TYPE, MFMediaType_Video);
   type->SetGUID(MF_MT_SUBTYPE, MFVideoFormat_RGB32);
-  MFSetAttributeSize(type, MF_MT_FRAME_SIZE, width, height);
-  MFSetAttributeRatio(type, MF_MT_FRAME_RATE, 30, 1);
+  MFSetAttributeSize(type.Get(), MF_MT_FRAME_SIZE, width, height);
+  MFSetAttributeRatio(type.Get(), MF_MT_FRAME_RATE, 30, 1);
   return type;
 }
 
 // A video writer of one H.264 stream fed with RGB32; input is adjusted by `adjust` if given.
 template <class Adjust>
-IMFSinkWriter* videoWriterWith(const std::string& path, UINT32 width, UINT32 height, DWORD* stream, Adjust adjust,
-                               UINT32 profile = eAVEncH264VProfile_Main) {
-  IMFSinkWriter* writer = createWriter(path);
+ComPtr<IMFSinkWriter> videoWriterWith(const std::string& path, UINT32 width, UINT32 height, DWORD* stream,
+                                      Adjust adjust, UINT32 profile = eAVEncH264VProfile_Main) {
+  ComPtr<IMFSinkWriter> writer = createWriter(path);
   if (!writer) return nullptr;
-  IMFMediaType* out = h264Type(width, height, profile);
-  EXPECT_EQ(writer->AddStream(out, stream), S_OK);
-  out->Release();
-  IMFMediaType* in = rgb32Type(width, height);
-  adjust(in);
-  EXPECT_EQ(writer->SetInputMediaType(*stream, in, nullptr), S_OK);
-  in->Release();
+  ComPtr<IMFMediaType> out = h264Type(width, height, profile);
+  EXPECT_EQ(writer->AddStream(out.Get(), stream), S_OK);
+  ComPtr<IMFMediaType> in = rgb32Type(width, height);
+  adjust(in.Get());
+  EXPECT_EQ(writer->SetInputMediaType(*stream, in.Get(), nullptr), S_OK);
   EXPECT_EQ(writer->BeginWriting(), S_OK);
   return writer;
 }
-IMFSinkWriter* videoWriter(const std::string& path, UINT32 width, UINT32 height, DWORD* stream,
-                           UINT32 profile = eAVEncH264VProfile_Main) {
+ComPtr<IMFSinkWriter> videoWriter(const std::string& path, UINT32 width, UINT32 height, DWORD* stream,
+                                  UINT32 profile = eAVEncH264VProfile_Main) {
   return videoWriterWith(
       path, width, height, stream, [](IMFMediaType*) {}, profile);
 }
 
-IMFSample* sampleOf(const void* bytes, DWORD length, LONGLONG time, LONGLONG duration, bool timed = true) {
-  IMFMediaBuffer* buffer = nullptr;
+ComPtr<IMFSample> sampleOf(const void* bytes, DWORD length, LONGLONG time, LONGLONG duration, bool timed = true) {
+  ComPtr<IMFMediaBuffer> buffer;
   MFCreateMemoryBuffer(length, &buffer);
   BYTE* data = nullptr;
   buffer->Lock(&data, nullptr, nullptr);
   if (length) std::memcpy(data, bytes, length);
   buffer->Unlock();
   buffer->SetCurrentLength(length);
-  IMFSample* sample = nullptr;
+  ComPtr<IMFSample> sample;
   MFCreateSample(&sample);
-  sample->AddBuffer(buffer);
-  buffer->Release();
+  sample->AddBuffer(buffer.Get());
   if (timed) sample->SetSampleTime(time);
   if (duration >= 0) sample->SetSampleDuration(duration);
   return sample;
 }
 
-HRESULT writeBytes(IMFSinkWriter* writer, DWORD stream, const std::vector<uint8_t>& bytes, LONGLONG time,
+HRESULT writeBytes(const ComPtr<IMFSinkWriter>& writer, DWORD stream, const std::vector<uint8_t>& bytes, LONGLONG time,
                    LONGLONG duration, bool timed = true) {
-  IMFSample* sample = sampleOf(bytes.data(), static_cast<DWORD>(bytes.size()), time, duration, timed);
-  HRESULT hr = writer->WriteSample(stream, sample);
-  sample->Release();
-  return hr;
+  return writer->WriteSample(stream,
+                             sampleOf(bytes.data(), static_cast<DWORD>(bytes.size()), time, duration, timed).Get());
 }
 
 // B, G, R, X rows in memory order; `bottomUp` stores the last picture row first.
@@ -148,24 +142,24 @@ TEST(SinkWriter, NeedsAStartedPlatform) {
   }
   media::TempFolder folder;
   HRESULT hr = S_OK;
-  IMFSinkWriter* writer = createWriter(folder.file("a.mp4"), &hr);
+  ComPtr<IMFSinkWriter> writer = createWriter(folder.file("a.mp4"), &hr);
   EXPECT_EQ(hr, MF_E_PLATFORM_NOT_INITIALIZED);
-  EXPECT_EQ(writer, nullptr);
+  EXPECT_FALSE(writer);
 }
 
 TEST(SinkWriter, UnopenablePathsFailWithTheWindowsCodes) {
   MediaFoundation started;
   media::TempFolder folder;
   HRESULT hr = S_OK;
-  EXPECT_EQ(createWriter(folder.file("missing/a.mp4"), &hr), nullptr);
+  EXPECT_FALSE(createWriter(folder.file("missing/a.mp4"), &hr));
   EXPECT_EQ(hr, HRESULT_FROM_WIN32(ERROR_PATH_NOT_FOUND));
   EXPECT_EQ(static_cast<uint32_t>(hr), 0x80070003u);
   { std::ofstream(folder.file("plain")) << "x"; }
-  EXPECT_EQ(createWriter(folder.file("plain/a.mp4"), &hr), nullptr);
+  EXPECT_FALSE(createWriter(folder.file("plain/a.mp4"), &hr));
   EXPECT_EQ(hr, HRESULT_FROM_WIN32(ERROR_PATH_NOT_FOUND));
-  EXPECT_EQ(createWriter(folder.path(), &hr), nullptr);  // a folder is no file
+  EXPECT_FALSE(createWriter(folder.path(), &hr));  // a folder is no file
   EXPECT_EQ(hr, HRESULT_FROM_WIN32(ERROR_ACCESS_DENIED));
-  EXPECT_EQ(createWriter(folder.file("no-container.xyz"), &hr, false), nullptr);
+  EXPECT_FALSE(createWriter(folder.file("no-container.xyz"), &hr, false));
   EXPECT_EQ(hr, MF_E_UNSUPPORTED_BYTESTREAM_TYPE);
 }
 
@@ -175,20 +169,17 @@ TEST(SinkWriter, CreatesTheFileAtOnceAndTakesTheContainerFromTheAttribute) {
   // The extension says nothing; the attribute chooses MP4.
   const std::string path = folder.file("clip.unknown");
   DWORD stream = 0;
-  IMFSinkWriter* writer = createWriter(path);
-  ASSERT_NE(writer, nullptr);
+  ComPtr<IMFSinkWriter> writer = createWriter(path);
+  ASSERT_TRUE(writer);
   EXPECT_TRUE(std::filesystem::exists(path));
-  IMFMediaType* out = h264Type(64, 64);
-  ASSERT_EQ(writer->AddStream(out, &stream), S_OK);
-  out->Release();
-  IMFMediaType* in = rgb32Type(64, 64);
-  ASSERT_EQ(writer->SetInputMediaType(stream, in, nullptr), S_OK);
-  in->Release();
+  ComPtr<IMFMediaType> out = h264Type(64, 64);
+  ASSERT_EQ(writer->AddStream(out.Get(), &stream), S_OK);
+  ComPtr<IMFMediaType> in = rgb32Type(64, 64);
+  ASSERT_EQ(writer->SetInputMediaType(stream, in.Get(), nullptr), S_OK);
   ASSERT_EQ(writer->BeginWriting(), S_OK);
   const auto pixels = bands(64, 64, true);
   for (int i = 0; i < 3; ++i) EXPECT_EQ(writeBytes(writer, stream, pixels, i * 333333LL, 333333), S_OK);
   EXPECT_EQ(writer->Finalize(), S_OK);
-  writer->Release();
   AVFormatContext* format = nullptr;
   ASSERT_EQ(avformat_open_input(&format, path.c_str(), nullptr, nullptr), 0);
   EXPECT_NE(std::string(format->iformat->name).find("mp4"), std::string::npos);
@@ -201,13 +192,11 @@ TEST(SinkWriter, FileNamesOutsideTheBasicPlaneArriveAsUtf8) {
   const std::string path = folder.file("clip-\xF0\x9F\x8E\xA5-\xC3\xA9.mp4");  // camera emoji, e acute
   const std::wstring units = wide(path);
   EXPECT_EQ(units.size(), folder.path().size() + 1 + 13);  // the emoji is a surrogate pair
-  IMFAttributes* attributes = nullptr;
+  ComPtr<IMFAttributes> attributes;
   MFCreateAttributes(&attributes, 0);
   attributes->SetGUID(MF_TRANSCODE_CONTAINERTYPE, MFTranscodeContainerType_MPEG4);
-  IMFSinkWriter* writer = nullptr;
-  ASSERT_EQ(MFCreateSinkWriterFromURL(units.c_str(), nullptr, attributes, &writer), S_OK);
-  attributes->Release();
-  writer->Release();
+  ComPtr<IMFSinkWriter> writer = nullptr;
+  ASSERT_EQ(MFCreateSinkWriterFromURL(units.c_str(), nullptr, attributes.Get(), &writer), S_OK);
   EXPECT_TRUE(std::filesystem::exists(std::filesystem::u8path(path)));
 }
 
@@ -217,8 +206,8 @@ TEST(SinkWriter, H264IsReallyMainWithTheTypesSizeRateAndBitRate) {
   const std::string path = folder.file("noise.mp4");
   const UINT32 width = 640, height = 360;
   DWORD stream = 99;
-  IMFSinkWriter* writer = videoWriter(path, width, height, &stream);
-  ASSERT_NE(writer, nullptr);
+  ComPtr<IMFSinkWriter> writer = videoWriter(path, width, height, &stream);
+  ASSERT_TRUE(writer);
   EXPECT_EQ(stream, 0u);
   // Noise needs far more than the bit rate, so the encoder has to hold it at its target.
   std::mt19937 random(7);
@@ -229,7 +218,6 @@ TEST(SinkWriter, H264IsReallyMainWithTheTypesSizeRateAndBitRate) {
     ASSERT_EQ(writeBytes(writer, stream, pixels, i * 10000000LL / 30, 333333), S_OK);
   }
   EXPECT_EQ(writer->Finalize(), S_OK);
-  writer->Release();
 
   const media::File file = media::probe(path);
   ASSERT_TRUE(file.opened);
@@ -286,19 +274,18 @@ TEST_P(PictureLayout, DecodesUprightWithTheProfileAskedFor) {
   media::TempFolder folder;
   const std::string path = folder.file("layout.mp4");
   DWORD stream = 0;
-  IMFSinkWriter* writer = videoWriterWith(
+  ComPtr<IMFSinkWriter> writer = videoWriterWith(
       path, 160, 120, &stream,
       [&](IMFMediaType* in) {
         in->SetGUID(MF_MT_SUBTYPE, c.subtype);
         if (c.stride) in->SetUINT32(MF_MT_DEFAULT_STRIDE, c.stride);
       },
       c.profile);
-  ASSERT_NE(writer, nullptr);
+  ASSERT_TRUE(writer);
   // RGB32 without a stride is bottom-up.
   const auto pixels = c.subtype == MFVideoFormat_I420 ? i420Bands(160, 120) : bands(160, 120, c.stride == 0);
   for (int i = 0; i < 3; ++i) ASSERT_EQ(writeBytes(writer, stream, pixels, i * 333333LL, 333333), S_OK);
   ASSERT_EQ(writer->Finalize(), S_OK);
-  writer->Release();
   const media::File file = media::probe(path);
   ASSERT_TRUE(file.opened);
   EXPECT_EQ(file.streams[0].profile & ~FF_PROFILE_H264_CONSTRAINED, c.expectedProfile);
@@ -324,8 +311,8 @@ TEST(SinkWriter, SampleTimesAndDurationsBecomePacketTimes) {
   media::TempFolder folder;
   const std::string path = folder.file("times.mp4");
   DWORD stream = 0;
-  IMFSinkWriter* writer = videoWriter(path, 64, 64, &stream);
-  ASSERT_NE(writer, nullptr);
+  ComPtr<IMFSinkWriter> writer = videoWriter(path, 64, 64, &stream);
+  ASSERT_TRUE(writer);
   const auto pixels = bands(64, 64, true);
   ASSERT_EQ(writeBytes(writer, stream, pixels, 0, 166666), S_OK);
   ASSERT_EQ(writeBytes(writer, stream, pixels, 330000, 166666), S_OK);
@@ -334,7 +321,6 @@ TEST(SinkWriter, SampleTimesAndDurationsBecomePacketTimes) {
   ASSERT_EQ(writeBytes(writer, stream, pixels, 0, -1, false), S_OK);
   ASSERT_EQ(writeBytes(writer, stream, pixels, 0, -1, false), S_OK);
   ASSERT_EQ(writer->Finalize(), S_OK);
-  writer->Release();
   const media::File file = media::probe(path);
   ASSERT_TRUE(file.opened);
   const auto& packets = file.streams[0].packets;
@@ -351,63 +337,57 @@ TEST(SinkWriter, SampleTimesAndDurationsBecomePacketTimes) {
 TEST(SinkWriter, RefusesCallsOutOfOrder) {
   MediaFoundation started;
   media::TempFolder folder;
-  IMFSinkWriter* writer = createWriter(folder.file("order.mp4"));
-  ASSERT_NE(writer, nullptr);
+  ComPtr<IMFSinkWriter> writer = createWriter(folder.file("order.mp4"));
+  ASSERT_TRUE(writer);
   std::vector<uint8_t> pixels(64 * 64 * 4);
   EXPECT_EQ(writer->BeginWriting(), MF_E_INVALIDREQUEST);  // no stream
   DWORD stream = 0;
-  IMFMediaType* out = h264Type(64, 64);
-  ASSERT_EQ(writer->AddStream(out, &stream), S_OK);
+  ComPtr<IMFMediaType> out = h264Type(64, 64);
+  ASSERT_EQ(writer->AddStream(out.Get(), &stream), S_OK);
   EXPECT_EQ(writeBytes(writer, stream, pixels, 0, 1), MF_E_INVALIDREQUEST);
   EXPECT_EQ(writer->BeginWriting(), MF_E_TRANSFORM_TYPE_NOT_SET);
-  IMFMediaType* in = rgb32Type(64, 64);
-  EXPECT_EQ(writer->SetInputMediaType(5, in, nullptr), MF_E_INVALIDSTREAMNUMBER);
-  ASSERT_EQ(writer->SetInputMediaType(stream, in, nullptr), S_OK);
+  ComPtr<IMFMediaType> in = rgb32Type(64, 64);
+  EXPECT_EQ(writer->SetInputMediaType(5, in.Get(), nullptr), MF_E_INVALIDSTREAMNUMBER);
+  ASSERT_EQ(writer->SetInputMediaType(stream, in.Get(), nullptr), S_OK);
   ASSERT_EQ(writer->BeginWriting(), S_OK);
-  EXPECT_EQ(writer->AddStream(out, &stream), MF_E_INVALIDREQUEST);
-  EXPECT_EQ(writer->SetInputMediaType(stream, in, nullptr), MF_E_INVALIDREQUEST);
+  EXPECT_EQ(writer->AddStream(out.Get(), &stream), MF_E_INVALIDREQUEST);
+  EXPECT_EQ(writer->SetInputMediaType(stream, in.Get(), nullptr), MF_E_INVALIDREQUEST);
   EXPECT_EQ(writeBytes(writer, 3, pixels, 0, 1), MF_E_INVALIDSTREAMNUMBER);
   EXPECT_EQ(writeBytes(writer, stream, std::vector<uint8_t>(100), 0, 1), MF_E_BUFFERTOOSMALL);
   EXPECT_EQ(writeBytes(writer, stream, pixels, 0, 333333), S_OK);
   EXPECT_EQ(writer->Finalize(), S_OK);
   EXPECT_EQ(writer->Finalize(), MF_E_INVALIDREQUEST);
   EXPECT_EQ(writeBytes(writer, stream, pixels, 0, 1), MF_E_INVALIDREQUEST);
-  out->Release();
-  in->Release();
-  writer->Release();
 }
 
 TEST(SinkWriter, RefusesTypesItCannotWrite) {
   MediaFoundation started;
   media::TempFolder folder;
-  IMFSinkWriter* writer = createWriter(folder.file("types.mp4"));
-  ASSERT_NE(writer, nullptr);
+  ComPtr<IMFSinkWriter> writer = createWriter(folder.file("types.mp4"));
+  ASSERT_TRUE(writer);
   DWORD stream = 0;
-  IMFMediaType* mjpg = h264Type(64, 64);
+  ComPtr<IMFMediaType> mjpg = h264Type(64, 64);
   mjpg->SetGUID(MF_MT_SUBTYPE, MFVideoFormat_MJPG);
-  EXPECT_EQ(writer->AddStream(mjpg, &stream), MF_E_INVALIDMEDIATYPE);
-  IMFMediaType* sizeless = h264Type(64, 64);
+  EXPECT_EQ(writer->AddStream(mjpg.Get(), &stream), MF_E_INVALIDMEDIATYPE);
+  ComPtr<IMFMediaType> sizeless = h264Type(64, 64);
   sizeless->DeleteItem(MF_MT_FRAME_SIZE);
-  EXPECT_EQ(writer->AddStream(sizeless, &stream), MF_E_INVALIDMEDIATYPE);
-  IMFMediaType* out = h264Type(64, 64);
-  ASSERT_EQ(writer->AddStream(out, &stream), S_OK);
-  IMFMediaType* in = rgb32Type(64, 64);
+  EXPECT_EQ(writer->AddStream(sizeless.Get(), &stream), MF_E_INVALIDMEDIATYPE);
+  ComPtr<IMFMediaType> out = h264Type(64, 64);
+  ASSERT_EQ(writer->AddStream(out.Get(), &stream), S_OK);
+  ComPtr<IMFMediaType> in = rgb32Type(64, 64);
   in->SetGUID(MF_MT_SUBTYPE, MFVideoFormat_MJPG);
-  EXPECT_EQ(writer->SetInputMediaType(stream, in, nullptr), MF_E_INVALIDMEDIATYPE);
+  EXPECT_EQ(writer->SetInputMediaType(stream, in.Get(), nullptr), MF_E_INVALIDMEDIATYPE);
   in->SetGUID(MF_MT_MAJOR_TYPE, MFMediaType_Audio);
-  EXPECT_EQ(writer->SetInputMediaType(stream, in, nullptr), MF_E_INVALIDMEDIATYPE);
-  for (IMFMediaType* type : {mjpg, sizeless, out, in}) type->Release();
-  writer->Release();  // dropped unfinished, as a failed recording leaves it
+  EXPECT_EQ(writer->SetInputMediaType(stream, in.Get(), nullptr), MF_E_INVALIDMEDIATYPE);
 }
 
 TEST(SinkWriter, FinalizeWithoutSamplesFails) {
   MediaFoundation started;
   media::TempFolder folder;
   DWORD stream = 0;
-  IMFSinkWriter* writer = videoWriter(folder.file("empty.mp4"), 64, 64, &stream);
-  ASSERT_NE(writer, nullptr);
+  ComPtr<IMFSinkWriter> writer = videoWriter(folder.file("empty.mp4"), 64, 64, &stream);
+  ASSERT_TRUE(writer);
   EXPECT_EQ(writer->Finalize(), MF_E_SINK_NO_SAMPLES_PROCESSED);
-  writer->Release();
 }
 
 // ---- H.264 input: copied, not encoded ----
@@ -415,28 +395,24 @@ TEST(SinkWriter, FinalizeWithoutSamplesFails) {
 // Writes a camera stream through a writer whose input type is H.264; the sequence header is
 // given on the input type when `withHeader`.
 HRESULT copyStream(const std::string& path, const media::CameraStream& camera, int width, int height, bool withHeader) {
-  IMFSinkWriter* writer = createWriter(path);
+  ComPtr<IMFSinkWriter> writer = createWriter(path);
   if (!writer) return E_FAIL;
   DWORD stream = 0;
-  IMFMediaType* out = h264Type(width, height);
-  HRESULT hr = writer->AddStream(out, &stream);
-  out->Release();
-  IMFMediaType* in = h264Type(width, height);
+  ComPtr<IMFMediaType> out = h264Type(width, height);
+  HRESULT hr = writer->AddStream(out.Get(), &stream);
+  ComPtr<IMFMediaType> in = h264Type(width, height);
   in->DeleteItem(MF_MT_AVG_BITRATE);
   if (withHeader)
     in->SetBlob(MF_MT_MPEG_SEQUENCE_HEADER, camera.header.data(), static_cast<UINT32>(camera.header.size()));
-  if (SUCCEEDED(hr)) hr = writer->SetInputMediaType(stream, in, nullptr);
-  in->Release();
+  if (SUCCEEDED(hr)) hr = writer->SetInputMediaType(stream, in.Get(), nullptr);
   if (SUCCEEDED(hr)) hr = writer->BeginWriting();
   for (size_t i = 0; SUCCEEDED(hr) && i < camera.packets.size(); ++i) {
     const auto& bytes = camera.packets[i];
-    IMFSample* sample = sampleOf(bytes.data(), static_cast<DWORD>(bytes.size()), i * 10000000LL / 30, 333333);
+    ComPtr<IMFSample> sample = sampleOf(bytes.data(), static_cast<DWORD>(bytes.size()), i * 10000000LL / 30, 333333);
     if (camera.keys[i]) sample->SetUINT32(MFSampleExtension_CleanPoint, TRUE);
-    hr = writer->WriteSample(stream, sample);
-    sample->Release();
+    hr = writer->WriteSample(stream, sample.Get());
   }
   if (SUCCEEDED(hr)) hr = writer->Finalize();
-  writer->Release();
   return hr;
 }
 
@@ -491,24 +467,21 @@ TEST(SinkWriter, H264InputWithoutSequenceHeaderUsesTheFirstKeyFramesParameterSet
 TEST(SinkWriter, H264InputMustHaveTheOutputsSize) {
   MediaFoundation started;
   media::TempFolder folder;
-  IMFSinkWriter* writer = createWriter(folder.file("sizes.mp4"));
-  ASSERT_NE(writer, nullptr);
+  ComPtr<IMFSinkWriter> writer = createWriter(folder.file("sizes.mp4"));
+  ASSERT_TRUE(writer);
   DWORD stream = 0;
-  IMFMediaType* out = h264Type(64, 64);
-  ASSERT_EQ(writer->AddStream(out, &stream), S_OK);
-  IMFMediaType* in = h264Type(32, 32);
-  EXPECT_EQ(writer->SetInputMediaType(stream, in, nullptr), MF_E_INVALIDMEDIATYPE);  // a copy cannot scale
-  MFSetAttributeSize(in, MF_MT_FRAME_SIZE, 64, 64);
-  EXPECT_EQ(writer->SetInputMediaType(stream, in, nullptr), S_OK);
-  out->Release();
-  in->Release();
-  writer->Release();
+  ComPtr<IMFMediaType> out = h264Type(64, 64);
+  ASSERT_EQ(writer->AddStream(out.Get(), &stream), S_OK);
+  ComPtr<IMFMediaType> in = h264Type(32, 32);
+  EXPECT_EQ(writer->SetInputMediaType(stream, in.Get(), nullptr), MF_E_INVALIDMEDIATYPE);  // a copy cannot scale
+  MFSetAttributeSize(in.Get(), MF_MT_FRAME_SIZE, 64, 64);
+  EXPECT_EQ(writer->SetInputMediaType(stream, in.Get(), nullptr), S_OK);
 }
 
 // ---- AAC ----
 
-IMFMediaType* aacType(UINT32 rate, UINT32 channels, UINT32 bytesPerSecond = 24000) {
-  IMFMediaType* type = nullptr;
+ComPtr<IMFMediaType> aacType(UINT32 rate, UINT32 channels, UINT32 bytesPerSecond = 24000) {
+  ComPtr<IMFMediaType> type;
   MFCreateMediaType(&type);
   type->SetGUID(MF_MT_MAJOR_TYPE, MFMediaType_Audio);
   type->SetGUID(MF_MT_SUBTYPE, MFAudioFormat_AAC);
@@ -519,13 +492,12 @@ IMFMediaType* aacType(UINT32 rate, UINT32 channels, UINT32 bytesPerSecond = 2400
   return type;
 }
 
-IMFSinkWriter* audioWriter(const std::string& path, UINT32 rate, UINT32 channels, WORD tag, WORD bits, DWORD mask,
-                           DWORD* stream) {
-  IMFSinkWriter* writer = createWriter(path);
+ComPtr<IMFSinkWriter> audioWriter(const std::string& path, UINT32 rate, UINT32 channels, WORD tag, WORD bits,
+                                  DWORD mask, DWORD* stream) {
+  ComPtr<IMFSinkWriter> writer = createWriter(path);
   if (!writer) return nullptr;
-  IMFMediaType* out = aacType(rate, channels);
-  EXPECT_EQ(writer->AddStream(out, stream), S_OK);
-  out->Release();
+  ComPtr<IMFMediaType> out = aacType(rate, channels);
+  EXPECT_EQ(writer->AddStream(out.Get(), stream), S_OK);
   WAVEFORMATEX format{};
   format.wFormatTag = tag;
   format.nChannels = static_cast<WORD>(channels);
@@ -533,12 +505,11 @@ IMFSinkWriter* audioWriter(const std::string& path, UINT32 rate, UINT32 channels
   format.wBitsPerSample = bits;
   format.nBlockAlign = static_cast<WORD>(channels * bits / 8);
   format.nAvgBytesPerSec = rate * format.nBlockAlign;
-  IMFMediaType* in = nullptr;
+  ComPtr<IMFMediaType> in;
   MFCreateMediaType(&in);
-  EXPECT_EQ(MFInitMediaTypeFromWaveFormatEx(in, &format, sizeof format), S_OK);
+  EXPECT_EQ(MFInitMediaTypeFromWaveFormatEx(in.Get(), &format, sizeof format), S_OK);
   if (mask) in->SetUINT32(MF_MT_AUDIO_CHANNEL_MASK, mask);
-  EXPECT_EQ(writer->SetInputMediaType(*stream, in, nullptr), S_OK);
-  in->Release();
+  EXPECT_EQ(writer->SetInputMediaType(*stream, in.Get(), nullptr), S_OK);
   EXPECT_EQ(writer->BeginWriting(), S_OK);
   return writer;
 }
@@ -582,8 +553,8 @@ TEST_P(AacFile, KeepsRateChannelsDurationAndTheTone) {
   media::TempFolder folder;
   const std::string path = folder.file("tone.mp4");
   DWORD stream = 0;
-  IMFSinkWriter* writer = audioWriter(path, c.rate, c.channels, c.tag, c.bits, c.mask, &stream);
-  ASSERT_NE(writer, nullptr);
+  ComPtr<IMFSinkWriter> writer = audioWriter(path, c.rate, c.channels, c.tag, c.bits, c.mask, &stream);
+  ASSERT_TRUE(writer);
   const int packet = static_cast<int>(c.rate / 100);  // 10 ms packets for 2 s
   for (int i = 0; i < 200; ++i) {
     const auto bytes = sine(440, c.rate, c.channels, c.tag, c.bits, int64_t(i) * packet, packet);
@@ -591,7 +562,6 @@ TEST_P(AacFile, KeepsRateChannelsDurationAndTheTone) {
     ASSERT_EQ(writeBytes(writer, stream, bytes, i * 100000LL, 0, i != 0), S_OK);
   }
   ASSERT_EQ(writer->Finalize(), S_OK);
-  writer->Release();
 
   const media::File file = media::probe(path);
   ASSERT_TRUE(file.opened);
@@ -634,8 +604,8 @@ TEST(SinkWriter, AudioGapsInSampleTimesBecomeSilence) {
   media::TempFolder folder;
   const std::string path = folder.file("gap.mp4");
   DWORD stream = 0;
-  IMFSinkWriter* writer = audioWriter(path, 48000, 2, WAVE_FORMAT_IEEE_FLOAT, 32, 3, &stream);
-  ASSERT_NE(writer, nullptr);
+  ComPtr<IMFSinkWriter> writer = audioWriter(path, 48000, 2, WAVE_FORMAT_IEEE_FLOAT, 32, 3, &stream);
+  ASSERT_TRUE(writer);
   // One second, then one more second stamped to start at 2 s.
   for (int i = 0; i < 200; ++i) {
     const LONGLONG time = (i < 100 ? i : i + 100) * 100000LL;
@@ -643,7 +613,6 @@ TEST(SinkWriter, AudioGapsInSampleTimesBecomeSilence) {
     ASSERT_EQ(writeBytes(writer, stream, bytes, time, 0, i != 0), S_OK);
   }
   ASSERT_EQ(writer->Finalize(), S_OK);
-  writer->Release();
   const media::File file = media::probe(path);
   EXPECT_NEAR(file.duration, 3.0, 0.05);
   const media::Decoded decoded = media::decode(path, AVMEDIA_TYPE_AUDIO);
@@ -658,7 +627,7 @@ TEST(SinkWriter, AudioGapsInSampleTimesBecomeSilence) {
 // ---- attribute stores, media types, buffers, samples, collections ----
 
 TEST(Attributes, StoreTypedValuesAndAnswerWithMediaFoundationCodes) {
-  IMFAttributes* attributes = nullptr;
+  ComPtr<IMFAttributes> attributes;
   ASSERT_EQ(MFCreateAttributes(&attributes, 4), S_OK);
   const GUID key = MF_MT_AVG_BITRATE;
   UINT32 u32 = 0;
@@ -675,10 +644,10 @@ TEST(Attributes, StoreTypedValuesAndAnswerWithMediaFoundationCodes) {
   EXPECT_EQ(attributes->GetBlob(MF_MT_MPEG_SEQUENCE_HEADER, small, 2, nullptr), HRESULT_FROM_WIN32(122));
   EXPECT_EQ(attributes->SetString(MF_MT_USER_DATA, L"name"), S_OK);
 
-  IMFAttributes* copied = nullptr;
+  ComPtr<IMFAttributes> copied;
   MFCreateAttributes(&copied, 0);
   copied->SetUINT32(MF_MT_INTERLACE_MODE, 2);  // replaced by the copy
-  EXPECT_EQ(attributes->CopyAllItems(copied), S_OK);
+  EXPECT_EQ(attributes->CopyAllItems(copied.Get()), S_OK);
   UINT32 count = 0;
   copied->GetCount(&count);
   EXPECT_EQ(count, 3u);
@@ -690,8 +659,6 @@ TEST(Attributes, StoreTypedValuesAndAnswerWithMediaFoundationCodes) {
   EXPECT_EQ(copied->GetAllocatedString(MF_MT_USER_DATA, &text, &count), S_OK);
   EXPECT_EQ(std::wstring(text), L"name");
   CoTaskMemFree(text);
-  copied->Release();
-  attributes->Release();
 }
 
 TEST(Attributes, MediaTypeFromWaveFormat) {
@@ -706,10 +673,10 @@ TEST(Attributes, MediaTypeFromWaveFormat) {
   format.Samples.wValidBitsPerSample = 32;
   format.dwChannelMask = 3;
   format.SubFormat = KSDATAFORMAT_SUBTYPE_IEEE_FLOAT;
-  IMFMediaType* type = nullptr;
+  ComPtr<IMFMediaType> type;
   MFCreateMediaType(&type);
-  EXPECT_EQ(MFInitMediaTypeFromWaveFormatEx(type, &format.Format, 18), E_INVALIDARG);
-  ASSERT_EQ(MFInitMediaTypeFromWaveFormatEx(type, &format.Format, sizeof format), S_OK);
+  EXPECT_EQ(MFInitMediaTypeFromWaveFormatEx(type.Get(), &format.Format, 18), E_INVALIDARG);
+  ASSERT_EQ(MFInitMediaTypeFromWaveFormatEx(type.Get(), &format.Format, sizeof format), S_OK);
   GUID subtype;
   type->GetGUID(MF_MT_SUBTYPE, &subtype);
   EXPECT_EQ(subtype, MFAudioFormat_Float);
@@ -723,19 +690,17 @@ TEST(Attributes, MediaTypeFromWaveFormat) {
   plain.wFormatTag = WAVE_FORMAT_PCM;
   plain.wBitsPerSample = 16;
   plain.cbSize = 0;
-  IMFMediaType* pcm = nullptr;
+  ComPtr<IMFMediaType> pcm;
   MFCreateMediaType(&pcm);
-  ASSERT_EQ(MFInitMediaTypeFromWaveFormatEx(pcm, &plain, sizeof plain), S_OK);
+  ASSERT_EQ(MFInitMediaTypeFromWaveFormatEx(pcm.Get(), &plain, sizeof plain), S_OK);
   pcm->GetGUID(MF_MT_SUBTYPE, &subtype);
   EXPECT_EQ(subtype, MFAudioFormat_PCM);
   EXPECT_EQ(pcm->GetUINT32(MF_MT_AUDIO_CHANNEL_MASK, &value), MF_E_ATTRIBUTENOTFOUND);
-  type->Release();
-  pcm->Release();
 }
 
 TEST(Samples, BuffersTimesAndContiguousCopies) {
-  IMFMediaBuffer* a = nullptr;
-  IMFMediaBuffer* b = nullptr;
+  ComPtr<IMFMediaBuffer> a;
+  ComPtr<IMFMediaBuffer> b;
   ASSERT_EQ(MFCreateMemoryBuffer(4, &a), S_OK);
   ASSERT_EQ(MFCreateMemoryBuffer(8, &b), S_OK);
   BYTE* data = nullptr;
@@ -753,7 +718,7 @@ TEST(Samples, BuffersTimesAndContiguousCopies) {
   b->Unlock();
   b->SetCurrentLength(2);
 
-  IMFSample* sample = nullptr;
+  ComPtr<IMFSample> sample;
   MFCreateSample(&sample);
   LONGLONG time = 0;
   EXPECT_EQ(sample->GetSampleTime(&time), MF_E_NO_SAMPLE_TIMESTAMP);
@@ -761,10 +726,10 @@ TEST(Samples, BuffersTimesAndContiguousCopies) {
   sample->SetSampleTime(5);
   EXPECT_EQ(sample->GetSampleTime(&time), S_OK);
   EXPECT_EQ(time, 5);
-  IMFMediaBuffer* joined = nullptr;
+  ComPtr<IMFMediaBuffer> joined;
   EXPECT_EQ(sample->ConvertToContiguousBuffer(&joined), E_UNEXPECTED);
-  sample->AddBuffer(a);
-  sample->AddBuffer(b);
+  sample->AddBuffer(a.Get());
+  sample->AddBuffer(b.Get());
   DWORD count = 0;
   ASSERT_EQ(sample->ConvertToContiguousBuffer(&joined), S_OK);
   joined->Lock(&data, nullptr, &current);
@@ -772,32 +737,25 @@ TEST(Samples, BuffersTimesAndContiguousCopies) {
   joined->Unlock();
   sample->GetBufferCount(&count);
   EXPECT_EQ(count, 1u);
-  joined->Release();
-  sample->Release();
-  a->Release();
-  b->Release();
 }
 
 TEST(Collections, HoldReferencesInOrder) {
-  IMFCollection* collection = nullptr;
+  ComPtr<IMFCollection> collection;
   ASSERT_EQ(MFCreateCollection(&collection), S_OK);
-  IMFMediaType* first = nullptr;
-  IMFMediaType* second = nullptr;
+  ComPtr<IMFMediaType> first, second;
   MFCreateMediaType(&first);
   MFCreateMediaType(&second);
-  collection->AddElement(first);
-  collection->AddElement(second);
-  first->Release();
-  IUnknown* element = nullptr;
-  ASSERT_EQ(collection->GetElement(0, &element), S_OK);  // the collection's reference kept it
-  EXPECT_EQ(element, static_cast<IUnknown*>(first));
-  element->Release();
-  ASSERT_EQ(collection->GetElement(1, &element), S_OK);
-  EXPECT_EQ(element, static_cast<IUnknown*>(second));
-  element->Release();
-  EXPECT_EQ(collection->GetElement(2, &element), E_INVALIDARG);
-  collection->Release();
-  second->Release();
+  collection->AddElement(first.Get());
+  collection->AddElement(second.Get());
+  IUnknown* const expected[] = {first.Get(), second.Get()};
+  first.Reset();  // the collection's reference keeps it
+  for (DWORD i = 0; i < 2; ++i) {
+    ComPtr<IUnknown> element;
+    ASSERT_EQ(collection->GetElement(i, &element), S_OK);
+    EXPECT_EQ(element.Get(), expected[i]);
+  }
+  ComPtr<IUnknown> none;
+  EXPECT_EQ(collection->GetElement(2, &none), E_INVALIDARG);
 }
 
 }  // namespace
