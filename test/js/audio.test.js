@@ -8,6 +8,7 @@ const fs = require('fs');
 const os = require('os');
 const path = require('path');
 const { runAddon } = require('./addon');
+const { probe } = require('./clips');
 const { startDesktop } = require('../../scripts/desktop');
 
 const SINKS = [
@@ -30,12 +31,6 @@ function tone(dir, { frequency = 440, seconds = 5, volume = 0.5, rate = 48000, c
 const play = (file, sink) => `require('child_process').spawn('paplay', ['--device=${sink}', ${JSON.stringify(file)}], { stdio: 'ignore' })`;
 
 const wasapi = (events) => events.filter((e) => e.source.type === 'wasapi').map((e) => e.source);
-
-function probe(file) {
-  const out = execFileSync('ffprobe', ['-v', 'error', '-show_entries',
-    'stream=codec_type,codec_name,sample_rate,channels:format=duration', '-of', 'json', file], { encoding: 'utf8' });
-  return JSON.parse(out);
-}
 
 // Relative power of one frequency in mono float samples (Goertzel).
 function power(samples, rate, frequency) {

@@ -6,24 +6,15 @@
 // sound comes two seconds at a time: its reads must hold up no command.
 const test = require('node:test');
 const assert = require('node:assert');
-const { execFileSync } = require('child_process');
 const fs = require('fs');
 const os = require('os');
 const path = require('path');
 const { runAddon } = require('./addon');
+const { duration, decodeErrors } = require('./clips');
 const { startDesktop } = require('../../scripts/desktop');
 
 const CAMERAS = 'YUY2 Camera=testsrc2=size=320x240:rate=30;H264 Camera=h264:testsrc2=size=320x240:rate=30';
 const FRAME = 1 / 30;
-
-function duration(file) {
-  return Number(execFileSync('ffprobe', ['-v', 'error', '-show_entries', 'format=duration', '-of', 'csv=p=0', file],
-    { encoding: 'utf8' }).trim());
-}
-
-function decodeErrors(file) {
-  return execFileSync('ffmpeg', ['-v', 'error', '-i', file, '-f', 'null', '-'], { encoding: 'utf8', stdio: ['ignore', 'pipe', 'pipe'] });
-}
 
 test('five 1 s clips per camera kind, gaps of 0 ms included', async (t) => {
   const desktop = await startDesktop({

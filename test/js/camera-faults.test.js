@@ -4,24 +4,16 @@
 // they are, and a test camera whose graph would read a file.
 const test = require('node:test');
 const assert = require('node:assert');
-const { execFileSync, spawnSync } = require('child_process');
+const { spawnSync } = require('child_process');
 const fs = require('fs');
 const os = require('os');
 const path = require('path');
 const { runAddon } = require('./addon');
+const { probe, decodeErrors } = require('./clips');
 const { startDesktop } = require('../../scripts/desktop');
 
 const CAMERAS = ['Odd One=color=c=red:size=1x1:rate=30', 'Odd Wide=testsrc2=size=33x17:rate=30',
   'Reader=movie=/etc/passwd', 'Plain=testsrc2=size=640x480:rate=30'].join(';');
-
-function probe(file) {
-  return JSON.parse(execFileSync('ffprobe', ['-v', 'error', '-show_entries', 'stream=width,height:format=duration',
-    '-of', 'json', file], { encoding: 'utf8' }));
-}
-
-function decodeErrors(file) {
-  return execFileSync('ffmpeg', ['-v', 'error', '-i', file, '-f', 'null', '-'], { encoding: 'utf8', stdio: ['ignore', 'pipe', 'pipe'] });
-}
 
 // The warning lines of a run: "<ms>: Warning: <date>" followed by "\t<file>(<line>): 0x<code>: <text>".
 function warnings(stdout) {

@@ -11,6 +11,7 @@ const fs = require('fs');
 const os = require('os');
 const path = require('path');
 const { runAddon } = require('./addon');
+const { probe, decodeErrors } = require('./clips');
 const { startDesktop } = require('../../scripts/desktop');
 
 // A red band across the top 60 rows of a blue 320x240 picture.
@@ -25,21 +26,12 @@ function colour([r, g, b]) {
   return `other ${r},${g},${b}`;
 }
 
-function probe(file) {
-  return JSON.parse(execFileSync('ffprobe', ['-v', 'error', '-show_entries',
-    'stream=codec_type,codec_name,profile,width,height,extradata_size:format=duration', '-of', 'json', file], { encoding: 'utf8' }));
-}
-
 // Indices of the packets the file itself marks as key frames (its sync samples): without
 // parsing, so that nothing is guessed from the bit stream.
 function keyPackets(file) {
   const flags = execFileSync('ffprobe', ['-v', 'error', '-fflags', '+noparse', '-select_streams', 'v:0',
     '-show_entries', 'packet=flags', '-of', 'csv=p=0', file], { encoding: 'utf8' }).trim().split('\n');
   return flags.flatMap((f, i) => (f.startsWith('K') ? [i] : []));
-}
-
-function decodeErrors(file) {
-  return execFileSync('ffmpeg', ['-v', 'error', '-i', file, '-f', 'null', '-'], { encoding: 'utf8', stdio: ['ignore', 'pipe', 'pipe'] });
 }
 
 // The first or last decoded picture of a file, as the colours at ROWS in its middle column.

@@ -8,19 +8,10 @@ const fs = require('fs');
 const os = require('os');
 const path = require('path');
 const { runAddon } = require('./addon');
+const { probe, decodeErrors } = require('./clips');
 const { startDesktop } = require('../../scripts/desktop');
 
 const CAMERAS = 'Test Camera A=testsrc2=size=640x480:rate=30;Test Camera B=color=c=red:size=1280x720:rate=30';
-
-function probe(file) {
-  return JSON.parse(execFileSync('ffprobe', ['-v', 'error', '-show_entries',
-    'stream=codec_type,codec_name,width,height,sample_rate:format=duration', '-of', 'json', file], { encoding: 'utf8' }));
-}
-
-// Decodes every frame; ffmpeg -v error prints nothing for a clean file.
-function decodeErrors(file) {
-  return execFileSync('ffmpeg', ['-v', 'error', '-i', file, '-f', 'null', '-'], { encoding: 'utf8', stdio: ['ignore', 'pipe', 'pipe'] });
-}
 
 test('cameras and capture-device microphones', async (t) => {
   const desktop = await startDesktop({ display: false, microphone: { name: 'tavio_mic', description: 'Tavio Microphone', frequency: 440 } });

@@ -1,6 +1,13 @@
 'use strict';
 // What a user's own tools say about a recorded file.
-const { spawnSync } = require('child_process');
+const { execFileSync, spawnSync } = require('child_process');
+
+// ffprobe's JSON of the streams and the duration, or of the given -show_entries and options.
+function probe(file, entries = 'stream=codec_type,codec_name,profile,width,height,sample_rate,channels,extradata_size' +
+  ':format=duration', ...options) {
+  return JSON.parse(execFileSync('ffprobe', ['-v', 'error', ...options, '-show_entries', entries, '-of', 'json', file],
+    { encoding: 'utf8' }));
+}
 
 // The container's duration in seconds, as ffprobe reads it; NaN for a file it cannot open.
 function duration(file) {
@@ -13,4 +20,4 @@ function decodeErrors(file) {
   return spawnSync('ffmpeg', ['-v', 'error', '-i', file, '-f', 'null', '-'], { encoding: 'utf8' }).stderr.trim();
 }
 
-module.exports = { duration, decodeErrors };
+module.exports = { probe, duration, decodeErrors };

@@ -10,6 +10,7 @@ const os = require('os');
 const path = require('path');
 const { startDesktop } = require('../../scripts/desktop');
 const { runAddon, root } = require('./addon');
+const clips = require('./clips');
 
 const MONITORS = ['*LEFT 960/254x1080/286+0+0 screen', 'RIGHT 960/254x1080/286+960+0 none'];
 let tools;
@@ -186,12 +187,7 @@ test('mouseCapture switches the pointer in and out of the frames', async () => {
   });
 });
 
-function probe(file) {
-  const r = spawnSync('ffprobe', ['-v', 'error', '-select_streams', 'v:0', '-show_entries',
-    'stream=codec_name,profile,width,height,bit_rate:packet=pts_time', '-of', 'json', file], { encoding: 'utf8' });
-  assert.strictEqual(r.status, 0, r.stderr);
-  return JSON.parse(r.stdout);
-}
+const probe = (file) => clips.probe(file, 'stream=codec_name,profile,width,height:packet=pts_time', '-select_streams', 'v:0');
 
 // The frame rate the H.264 stream declares in its timing information, as "num/den". ffprobe's
 // r_frame_rate is no test of it: for frames at capture times it is guessed from the times of the
@@ -212,8 +208,8 @@ function declaredFrameRate(file) {
 // Decoder errors of a full decode. The null muxer's complaints about two frames in one 1/30 s
 // tick are left out: capture times are variable by design while the stream declares 30/1.
 function decodeErrors(file) {
-  const r = spawnSync('ffmpeg', ['-v', 'error', '-i', file, '-f', 'null', '-'], { encoding: 'utf8' });
-  return r.stderr.split('\n').filter((line) => line && !/non monotonically increasing dts to muxer/.test(line)).join('\n');
+  const lines = clips.decodeErrors(file).split('\n');
+  return lines.filter((line) => line && !/non monotonically increasing dts to muxer/.test(line)).join('\n');
 }
 
 test('a recording is H.264 Main at the monitor size, 30/1, timed by capture times', async () => {

@@ -41,37 +41,21 @@ std::vector<std::string> keys(const Descriptor& d) {
   return out;
 }
 
-TEST(Descriptor, DisplaysCarryGeometryWithSizeTwice) {
+// Ids, kinds, selection and geometry reach the host as the integration tests check; what a
+// JavaScript object cannot show is the key order with "size" twice and the UTF-8 of names.
+TEST(Descriptor, VideoSourcesCarryGeometryWithSizeTwiceAudioSourcesDoNot) {
   FakeVideo display;
   const Descriptor d = capture::describeSource(3, display);
   EXPECT_EQ(keys(d), (std::vector<std::string>{"id", "name", "selected", "type", "pixelWidth", "width", "height",
                                                "size", "size"}));
-  EXPECT_EQ(d[0].second, DescriptorValue(3));
   EXPECT_EQ(d[1].second, DescriptorValue(std::string("Device \xC3\xA9")));
-  EXPECT_EQ(d[2].second, DescriptorValue(1));
-  EXPECT_EQ(d[3].second, DescriptorValue(std::string("dxgi")));
-  EXPECT_EQ(d[4].second, DescriptorValue(4));
-  EXPECT_EQ(d[5].second, DescriptorValue(1920));
-  EXPECT_EQ(d[6].second, DescriptorValue(1080));
   EXPECT_EQ(d[7].second, DescriptorValue(8294400));
-}
-
-TEST(Descriptor, CamerasAreVideoMicrophonesAndEndpointsAreNot) {
-  FakeVideo camera;
-  camera.kind = capture::CameraVideo;
-  EXPECT_EQ(keys(capture::describeSource(0, camera)).size(), 9u);
-  EXPECT_EQ(capture::describeSource(0, camera)[3].second, DescriptorValue(std::string("mfce_video")));
-  EXPECT_EQ(capture::describeSource(0, camera)[2].second, DescriptorValue(0));
+  EXPECT_EQ(d[8].second, d[7].second);
 
   FakeAudio microphone;
   microphone.kind = capture::CameraMicrophone;
   EXPECT_EQ(keys(capture::describeSource(1, microphone)), (std::vector<std::string>{"id", "name", "selected", "type"}));
-  EXPECT_EQ(capture::describeSource(1, microphone)[3].second, DescriptorValue(std::string("mfce_audio")));
-
-  FakeAudio endpoint;
-  endpoint.kind = capture::AudioEndpoint;
-  EXPECT_EQ(capture::describeSource(2, endpoint)[3].second, DescriptorValue(std::string("wasapi")));
-  EXPECT_STREQ(capture::typeName(42), "wasapi");
+  EXPECT_STREQ(capture::typeName(42), "wasapi");  // any kind it does not know
 }
 
 }  // namespace
