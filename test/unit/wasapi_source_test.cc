@@ -344,6 +344,61 @@ TEST_F(WasapiSource, AStoppedClipThatNoPacketReachesIsFinishedAnyway) {
   EXPECT_EQ(encoders[0]->writes.size(), 1u);
 }
 
+// A clip begun while the endpoint is away is silence until its first packet, or up to its stop
+// when none comes, so it covers its time like any other.
+TEST_F(WasapiSource, AClipBegunWhileTheEndpointIsAwayIsSilenceUntilItsFirstPacketOrItsStop) {
+  startCapture();
+  Output output;
+  const int before = answered();
+  audio->push(answer(AUDCLNT_E_DEVICE_INVALIDATED));
+  audio->push(answer(AUDCLNT_E_DEVICE_INVALIDATED));  // away for two tries, back at the third
+  ASSERT_TRUE(audio->waitAnswered(before + 1));
+  const UINT64 awayStart = clockNow();
+  source->startEncode("away.mp4");
+  std::this_thread::sleep_for(std::chrono::milliseconds(100));
+  source->stopEncode();
+  const UINT64 awayStop = clockNow();
+  source->startEncode("back.mp4");
+  const UINT64 backStart = clockNow();
+  ASSERT_TRUE(eventually([&] {
+    std::lock_guard<std::mutex> lock(audio->mutex);
+    return audio->activations >= 3 && audio->packets.empty();
+  }));
+  const UINT64 packetTime = clockNow();
+  feed(floats(tone(480), packetTime));
+  source->stopEncode();
+  feed(floats(tone(480), clockNow() + 100 * kMs));
+  endCapture();
+  output.lines();
+
+  // The frames of the silent writes before the first sound, each timed where the one before ended.
+  auto leadingSilence = [](const fakes::EncoderLog& log) {
+    uint64_t frames = 0;
+    for (const auto& write : log.writes) {
+      if (std::any_of(write.samples.begin(), write.samples.end(), [](float v) { return v != 0; })) break;
+      EXPECT_EQ(write.time, static_cast<int64_t>(frames * 10000000 / 48000));
+      frames += write.frames;
+    }
+    return frames;
+  };
+  const auto framesIn = [](UINT64 units) { return static_cast<double>(units) * 48000 / 10000000; };
+  ASSERT_EQ(encoders.size(), 2u);
+  std::lock_guard<std::mutex> lockAway(encoders[0]->mutex);
+  EXPECT_EQ(encoders[0]->finalized, 1);
+  uint64_t all = 0;
+  for (const auto& write : encoders[0]->writes) all += write.frames;
+  EXPECT_EQ(leadingSilence(*encoders[0]), all) << "silence only";
+  EXPECT_GE(all, 4800u - 1);
+  EXPECT_LE(all, framesIn(awayStop - awayStart));
+  std::lock_guard<std::mutex> lockBack(encoders[1]->mutex);
+  EXPECT_EQ(encoders[1]->finalized, 1);
+  const uint64_t silence = leadingSilence(*encoders[1]);
+  EXPECT_GE(silence + 1, framesIn(packetTime - backStart));
+  EXPECT_LE(silence, framesIn(packetTime - awayStop));
+  ASSERT_FALSE(encoders[1]->writes.back().samples.empty());
+  EXPECT_EQ(encoders[1]->writes.back().samples[0], 0.25f);  // then the packet
+}
+
 TEST_F(WasapiSource, SpecialAnswersOfGetBuffer) {
   startCapture();
   source->startEncode("clip.mp4");

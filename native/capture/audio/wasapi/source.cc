@@ -1,11 +1,13 @@
 #include "capture/audio/wasapi/source.h"
 
+#include <algorithm>
 #include <chrono>
 #include <cstring>
 #include <exception>
 #include <iostream>
 #include <stdexcept>
 #include <thread>
+#include <vector>
 
 #include "capture/audio/formats.h"
 #include "capture/audio/mfencoder.h"
@@ -87,6 +89,8 @@ constexpr uint64_t kUnitsPerSecond = 10000000;
 // A stopped clip whose stop no packet reaches within this time (the endpoint stalled or went
 // away) is finished with what it has.
 constexpr uint64_t kStopWait = 5000000;
+// A clip's first packet this long after its start (the endpoint was away) is preceded by silence.
+constexpr uint64_t kLateFirstPacket = 400000;
 
 // The performance counter in 100 ns units: the clock of the packets' positions.
 uint64_t counterNow() {
@@ -101,8 +105,10 @@ uint64_t counterNow() {
 
 struct Source::Clip {
   std::unique_ptr<Encoder> encoder;
-  uint64_t start = 0;             // capture clock, 100 ns
-  std::atomic<uint64_t> stop{0};  // 0 while recording
+  const WAVEFORMATEXTENSIBLE* format = nullptr;  // the capture format the encoder takes
+  uint64_t start = 0;                            // capture clock, 100 ns
+  std::atomic<uint64_t> stop{0};                 // 0 while recording
+  uint64_t written = 0;                          // the capture thread only: how far it is written
 };
 
 // The silence thread's share of the source: it never ends, so it must not depend on the source.
@@ -198,7 +204,7 @@ void Source::capture() {
     keepTrying([&] { self->runCapture(client, packets); }, [&] { return self->capturing.load(); },
                [&](bool failed) {
                  // What was recorded up to a failure is kept: the clips end there.
-                 self->finishAll();
+                 self->finishAll(failed);
                  if (!failed) return;
                  // The failed try's clients go before the next (unless a newer capture thread has
                  // put its own in their place), so a device that stays away costs no memory.
@@ -209,6 +215,8 @@ void Source::capture() {
                  client = nullptr;
                  packets = nullptr;
                });
+    // Capture stopped while the endpoint was away: the clips still waiting for it end now.
+    self->finishAll(false);
   }).detach();
 }
 
@@ -219,7 +227,8 @@ void Source::startEncode(std::string filename) {
   if (!format.load())
     capture::checkResult(kFile, 150, AUDCLNT_E_NOT_INITIALIZED, "Audio capture has not started on this endpoint.");
   auto clip = std::make_shared<Clip>();
-  clip->encoder.reset(makeEncoder(filename, format.load()));
+  clip->format = format.load();
+  clip->encoder.reset(makeEncoder(filename, clip->format));
   clip->start = counterNow();
   // A clip still recording ends where the new one begins.
   if (latest) latest->stop.store(clip->start);
@@ -253,12 +262,16 @@ void Source::record(const BYTE* data, UINT32 frames, uint64_t begin, const WAVEF
     const uint64_t to = stop ? std::min(end, stop) : end;
     if (to > from) {
       const UINT32 first = frameAt(from), last = frameAt(to);
-      if (last > first)
+      if (last > first) {
+        // A clip that began while its endpoint was away starts with silence up to its first packet.
+        if (!clip.written && from > clip.start + kLateFirstPacket) writeSilence(clip, from);
         clip.encoder->write(data + static_cast<size_t>(first) * blockAlign, last - first, &captureFormat->Format,
                             static_cast<int64_t>(from - clip.start));
+        clip.written = to;
+      }
     }
     if (stop && end >= stop) {
-      clip.encoder->finalize();
+      finish(clip, stop);
       it = writing.erase(it);
     } else {
       ++it;
@@ -270,7 +283,7 @@ void Source::finishOverdue(uint64_t now) {
   for (auto it = writing.begin(); it != writing.end();) {
     const uint64_t stop = (*it)->stop.load();
     if (stop && now > stop + kStopWait) {
-      (*it)->encoder->finalize();
+      finish(**it, stop);
       it = writing.erase(it);
     } else {
       ++it;
@@ -278,9 +291,10 @@ void Source::finishOverdue(uint64_t now) {
   }
 }
 
-// Finalises every clip this endpoint holds, as far as each got; a failure to finish one is
-// printed and does not keep the others from finishing.
-void Source::finishAll() {
+// Finalises the clips this endpoint holds, as far as each got; a failure to finish one is
+// printed and does not keep the others from finishing. After a failed try, a clip that nothing
+// has reached yet and that is still recording waits for the endpoint to come back.
+void Source::finishAll(bool failed) {
   {
     std::lock_guard<std::mutex> hold(clipsLock);
     while (!started.empty()) {
@@ -288,8 +302,41 @@ void Source::finishAll() {
       started.pop_front();
     }
   }
-  for (auto& clip : writing) guarded([&] { clip->encoder->finalize(); });
-  writing.clear();
+  const uint64_t now = counterNow();
+  for (auto it = writing.begin(); it != writing.end();) {
+    Clip& clip = **it;
+    const uint64_t stop = clip.stop.load();
+    if (failed && !clip.written && !stop) {
+      ++it;
+      continue;
+    }
+    guarded([&] { finish(clip, stop ? stop : now); });
+    it = writing.erase(it);
+  }
+}
+
+// A clip that no packet reached (its endpoint was away all along) is silence up to its end, so
+// that it is a file of its length all the same.
+void Source::finish(Clip& clip, uint64_t end) {
+  if (!clip.written) writeSilence(clip, end);
+  clip.encoder->finalize();
+}
+
+// Silence from where the clip is written up to `until` on the capture clock, a tenth of a second
+// at a time.
+void Source::writeSilence(Clip& clip, uint64_t until) {
+  const WAVEFORMATEX& f = clip.format->Format;
+  const bool unsigned8 = f.wBitsPerSample == 8 && clip.format->SubFormat == KSDATAFORMAT_SUBTYPE_PCM;
+  const uint32_t chunk = std::max<uint32_t>(f.nSamplesPerSec / 10, 1);
+  const std::vector<BYTE> zeros(static_cast<size_t>(chunk) * f.nBlockAlign, unsigned8 ? 0x80 : 0);
+  const uint64_t from = std::max(clip.written, clip.start);
+  const uint64_t frames = until > from ? (until - from) * f.nSamplesPerSec / kUnitsPerSecond : 0;
+  for (uint64_t done = 0; done < frames; done += chunk) {
+    const uint64_t time = from - clip.start + done * kUnitsPerSecond / f.nSamplesPerSec;
+    clip.encoder->write(zeros.data(), static_cast<uint32_t>(std::min<uint64_t>(chunk, frames - done)), &f,
+                        static_cast<int64_t>(time));
+  }
+  clip.written = std::max(until, from);
 }
 
 uint16_t Source::channels() {
