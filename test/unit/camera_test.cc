@@ -479,12 +479,16 @@ TEST(CameraCaptureManager, ARecordingThatCouldNotBeWrittenIsAWarningLine) {
   manager.engineEvent = nullptr;
 }
 
-TEST(CameraCaptureManager, CallbacksAnswerTheirOneInterface) {
+TEST(CameraCaptureManager, CallbacksAnswerTheirOneInterfaceAndKeepNoEventTheyCannotDeliver) {
   auto* callback = new mfce::CaptureManager::CaptureEngineCB(nullptr);
   void* object = nullptr;
   EXPECT_EQ(S_OK, callback->QueryInterface(IID_IMFCaptureEngineOnEventCallback, &object));
   EXPECT_EQ(E_NOINTERFACE, callback->QueryInterface(IID_IMFCaptureEngineOnSampleCallback, &object));
   EXPECT_EQ(nullptr, object);
+  // An event before the source handles them directly, with no window to post to, keeps no reference.
+  auto* event = new FakeEvent(MF_CAPTURE_ENGINE_INITIALIZED, S_OK);
+  EXPECT_EQ(S_OK, callback->OnEvent(event));
+  EXPECT_EQ(0u, event->Release());
   EXPECT_EQ(1u, callback->Release());
   EXPECT_EQ(0u, callback->Release());
 }

@@ -402,6 +402,10 @@ HRESULT CaptureManager::CaptureEngineCB::OnEvent(IMFMediaEvent* event) {
     manager->HandleEngineEvent(event);
     return S_OK;
   }
+  // Without a window the message would go to the engine thread's own queue, which nothing reads
+  // (an event that comes before the source has set `direct`): the event is dropped here instead
+  // of with its reference in that queue.
+  if (!eventWindow) return S_OK;
   // The receiver of the message owns the added reference; when nothing can receive it, give it back.
   event->AddRef();
   if (!PostMessageA(eventWindow, engineEventMessage, reinterpret_cast<WPARAM>(event), 0)) event->Release();

@@ -16,7 +16,7 @@ namespace capture::video::camera::mfce {
 class CaptureManager {
  public:
   // Engine events: handled on the engine's thread once `direct` is set, else posted to
-  // `eventWindow`.
+  // `eventWindow` (dropped while there is none).
   class CaptureEngineCB : public IMFCaptureEngineOnEventCallback {
    public:
     explicit CaptureEngineCB(HWND eventWindow) : eventWindow(eventWindow) {}
