@@ -54,9 +54,9 @@ constexpr auto kRetryPause = std::chrono::milliseconds(500);
 // The outermost frame of both threads: runs `body` until it returns, trying again after a
 // pause whenever it fails while `wanted()` holds, so an endpoint whose sound server or device
 // went away works again once it is back. The first failure of a row is printed; the same one
-// again is not. `after(failed)` runs once after every try.
-template <class Body, class Wanted, class After>
-void keepTrying(Body body, Wanted wanted, After after) {
+// again is not. `afterFailure()` runs after every failed try, before the pause.
+template <class Body, class Wanted, class AfterFailure>
+void keepTrying(Body body, Wanted wanted, AfterFailure afterFailure) {
   std::string lastFailure;
   while (wanted()) {
     std::string failure;
@@ -67,16 +67,13 @@ void keepTrying(Body body, Wanted wanted, After after) {
     } catch (...) {
       failure = "unknown exception";
     }
-    if (failure.empty()) {
-      after(false);
-      return;
-    }
+    if (failure.empty()) return;
     // Checked failures begin with their time; the rest tells whether it is the same again.
     const size_t tab = failure.find('\t');
     const std::string what = tab == std::string::npos ? failure : failure.substr(tab);
     if (what != lastFailure) capture::logWarning(failure.c_str());
     lastFailure = what;
-    after(true);
+    afterFailure();
     std::this_thread::sleep_for(kRetryPause);
   }
 }
@@ -108,7 +105,7 @@ struct Source::Clip {
   const WAVEFORMATEXTENSIBLE* format = nullptr;  // the capture format the encoder takes
   uint64_t start = 0;                            // capture clock, 100 ns
   std::atomic<uint64_t> stop{0};                 // 0 while recording
-  uint64_t written = 0;                          // the capture thread only: how far it is written
+  bool written = false;                          // the capture thread only: a packet has reached it
 };
 
 // The silence thread's share of the source: it never ends, so it must not depend on the source.
@@ -161,7 +158,7 @@ Source::Source(IMMDevice* endpoint, bool isSelected, EncoderFactory makeEncoder)
   silence->endpoint = endpoint;
   std::thread([state = silence] {
     capture::nameThread("tavio-silence");
-    keepTrying([&] { state->run(); }, [] { return true; }, [](bool) {});
+    keepTrying([&] { state->run(); }, [] { return true; }, [] {});
   }).detach();
 }
 
@@ -202,10 +199,9 @@ void Source::capture() {
     IAudioClient* client = nullptr;
     IAudioCaptureClient* packets = nullptr;
     keepTrying([&] { self->runCapture(client, packets); }, [&] { return self->capturing.load(); },
-               [&](bool failed) {
+               [&] {
                  // What was recorded up to a failure is kept: the clips end there.
-                 self->finishAll(failed);
-                 if (!failed) return;
+                 self->finishAll(true);
                  // The failed try's clients go before the next (unless a newer capture thread has
                  // put its own in their place), so a device that stays away costs no memory.
                  IAudioCaptureClient* ownPackets = packets;
@@ -215,7 +211,7 @@ void Source::capture() {
                  client = nullptr;
                  packets = nullptr;
                });
-    // Capture stopped while the endpoint was away: the clips still waiting for it end now.
+    // Capture stopped: every clip ends now, also one still waiting for an endpoint that is away.
     self->finishAll(false);
   }).detach();
 }
@@ -267,7 +263,7 @@ void Source::record(const BYTE* data, UINT32 frames, uint64_t begin, const WAVEF
         if (!clip.written && from > clip.start + kLateFirstPacket) writeSilence(clip, from);
         clip.encoder->write(data + static_cast<size_t>(first) * blockAlign, last - first, &captureFormat->Format,
                             static_cast<int64_t>(from - clip.start));
-        clip.written = to;
+        clip.written = true;
       }
     }
     if (stop && end >= stop) {
@@ -322,21 +318,16 @@ void Source::finish(Clip& clip, uint64_t end) {
   clip.encoder->finalize();
 }
 
-// Silence from where the clip is written up to `until` on the capture clock, a tenth of a second
-// at a time.
+// Silence from the clip's start up to `until` on the capture clock, a tenth of a second at a time.
 void Source::writeSilence(Clip& clip, uint64_t until) {
   const WAVEFORMATEX& f = clip.format->Format;
   const bool unsigned8 = f.wBitsPerSample == 8 && clip.format->SubFormat == KSDATAFORMAT_SUBTYPE_PCM;
   const uint32_t chunk = std::max<uint32_t>(f.nSamplesPerSec / 10, 1);
   const std::vector<BYTE> zeros(static_cast<size_t>(chunk) * f.nBlockAlign, unsigned8 ? 0x80 : 0);
-  const uint64_t from = std::max(clip.written, clip.start);
-  const uint64_t frames = until > from ? (until - from) * f.nSamplesPerSec / kUnitsPerSecond : 0;
-  for (uint64_t done = 0; done < frames; done += chunk) {
-    const uint64_t time = from - clip.start + done * kUnitsPerSecond / f.nSamplesPerSec;
+  const uint64_t frames = until > clip.start ? (until - clip.start) * f.nSamplesPerSec / kUnitsPerSecond : 0;
+  for (uint64_t done = 0; done < frames; done += chunk)
     clip.encoder->write(zeros.data(), static_cast<uint32_t>(std::min<uint64_t>(chunk, frames - done)), &f,
-                        static_cast<int64_t>(time));
-  }
-  clip.written = std::max(until, from);
+                        static_cast<int64_t>(done * kUnitsPerSecond / f.nSamplesPerSec));
 }
 
 uint16_t Source::channels() {
