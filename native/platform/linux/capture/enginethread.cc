@@ -427,10 +427,15 @@ void EngineThread::write(Recording& recording, DWORD stream, IMFSample* sample) 
   if (FAILED(hr)) recording.failure = hr;
 }
 
-// A device that stops answering ends preview and recording, as a vanished camera does; the
-// clips keep what was written.
+// A device that stops answering ends preview and recording, as a vanished camera does. The clip
+// in progress ends at the failure: what the device captured goes in, and sound it had not yet
+// delivered (a microphone may send seconds at once) is silence, so the clip still lasts as long
+// as the device recorded.
 void EngineThread::fail(HRESULT status) {
-  if (current_) finishing_.push_back(std::move(current_));
+  if (current_) {
+    current_->stopAt = std::max(av_gettime(), current_->startAt);
+    finishing_.push_back(std::move(current_));
+  }
   for (auto& recording : finishing_) finish(*recording);
   finishing_.clear();
   {
