@@ -20,4 +20,19 @@ function decodeErrors(file) {
   return spawnSync('ffmpeg', ['-v', 'error', '-i', file, '-f', 'null', '-'], { encoding: 'utf8' }).stderr.trim();
 }
 
-module.exports = { probe, duration, decodeErrors };
+// What two other players make of the file: GStreamer plays it to the end without an error
+// (`played`), and GStreamer's and MediaInfo's durations in seconds (NaN when they find none).
+function otherPlayers(file) {
+  const play = spawnSync('gst-launch-1.0', ['-q', 'playbin', `uri=file://${file}`, 'video-sink=fakesink sync=false',
+    'audio-sink=fakesink sync=false'], { encoding: 'utf8', timeout: 60000 });
+  const discovered = spawnSync('gst-discoverer-1.0', [file], { encoding: 'utf8' }).stdout;
+  const [h, m, s] = (/Duration: (\d+):(\d+):([\d.]+)/.exec(discovered) || []).slice(1).map(Number);
+  const mediainfo = spawnSync('mediainfo', ['--Inform=General;%Duration%', file], { encoding: 'utf8' }).stdout.trim();
+  return {
+    played: play.status === 0 && !/ERROR/.test(play.stdout + play.stderr),
+    gstreamer: h === undefined ? NaN : h * 3600 + m * 60 + s,
+    mediainfo: mediainfo ? Number(mediainfo) / 1000 : NaN,
+  };
+}
+
+module.exports = { probe, duration, decodeErrors, otherPlayers };

@@ -1,7 +1,8 @@
 'use strict';
 // Clips as a user records them: each covers its start to its stop whatever the picture or the
 // sound does, clips started together line up, start/stop cycles lose nothing, and a host killed
-// mid-recording leaves files that play up to about a second before the kill.
+// mid-recording leaves files that play up to about a second before the kill, in FFmpeg, GStreamer
+// and MediaInfo alike.
 const { test, before, after } = require('node:test');
 const assert = require('node:assert');
 const { execFileSync, spawnSync } = require('child_process');
@@ -10,7 +11,7 @@ const os = require('os');
 const path = require('path');
 const { startDesktop } = require('../../scripts/desktop');
 const { runAddon, root } = require('./addon');
-const { duration: probe, decodeErrors } = require('./clips');
+const { duration: probe, decodeErrors, otherPlayers } = require('./clips');
 
 let dir;
 let flashbeep;
@@ -178,6 +179,11 @@ test('a host killed while recording leaves files that play up to a second before
       assert.strictEqual(decodeErrors(file), '', kind);
       const duration = probe(file);
       assert.ok(duration >= recorded - 1, `${kind}: ${duration} s of ${recorded} s`);
+      // The header's duration, kept up to date at every fragment, is what these two read.
+      const others = otherPlayers(file);
+      assert.ok(others.played, `${kind}: GStreamer plays it to the end`);
+      assert.ok(Math.abs(others.gstreamer - duration) < 0.1, `${kind}: GStreamer ${others.gstreamer} s, FFmpeg ${duration} s`);
+      assert.ok(Math.abs(others.mediainfo - duration) < 0.1, `${kind}: MediaInfo ${others.mediainfo} s, FFmpeg ${duration} s`);
     }
   });
 });
