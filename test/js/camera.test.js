@@ -82,6 +82,35 @@ test('cameras and capture-device microphones', async (t) => {
     assert.ok(Math.abs(a.format.duration - seconds) / seconds < 0.05, `audio ${a.format.duration} s for ${seconds} s`);
   });
 
+  await t.test('a microphone that sends seconds at once is not waited for when its sound cannot come in time', async () => {
+    // Eight clips, each stopped at another moment of the microphone's two-second lumps: a stop
+    // waits for the lump only when it is due within the half-second grace (a quarter of them).
+    const { reports, code } = await runAddon(`
+      addon.initialize();
+      await sleep(2500);
+      const clips = [];
+      for (let i = 0; i < 8; i++) {
+        const file = ${JSON.stringify(dir)} + '/lump' + i + '.mp4';
+        const started = Date.now();
+        addon.startCapture(2, file);
+        await sleep(300 + 97 * i);
+        const stopping = Date.now();
+        addon.stopCapture(2);
+        clips.push({ file, seconds: (stopping - started) / 1000, stopMs: Date.now() - stopping });
+      }
+      report(clips);
+    `, { env });
+    assert.strictEqual(code, 0);
+    const clips = reports[0];
+    const waited = clips.reduce((sum, c) => sum + c.stopMs, 0);
+    assert.ok(waited < 2000, `the eight stops took ${waited} ms: ${clips.map((c) => c.stopMs)}`);
+    for (const { file, seconds } of clips) {
+      assert.strictEqual(decodeErrors(file), '');
+      const duration = Number(probe(file).format.duration);
+      assert.ok(Math.abs(duration - seconds) < 0.06, `${file}: ${duration} s for ${seconds} s`);
+    }
+  });
+
   await t.test('the picture is upright in the preview and in the recorded file', async () => {
     // A red band across the top 60 rows of a blue 320x240 picture: an upside-down frame puts it at the bottom.
     const banner = 'Banner=color=c=blue:size=320x240:rate=30,drawbox=x=0:y=0:w=320:h=60:color=red:t=fill';

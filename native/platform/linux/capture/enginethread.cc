@@ -134,8 +134,9 @@ struct Recording {
   int64_t audioReachedAt = INT64_MIN;  // wall clock (µs) up to which sound has come
 };
 
-constexpr int64_t videoGrace = 250000;  // µs after the stop to wait for the stop's picture
-constexpr int64_t soundGrace = 500000;  // and for its sound, which may come in large lumps
+constexpr int64_t videoGrace = 250000;     // µs after the stop to wait for the stop's picture
+constexpr int64_t soundGrace = 500000;     // and for its sound, which may come in large lumps
+constexpr int64_t soundHistory = 5000000;  // how far back the microphone's deliveries are kept
 
 class EngineThread {
  public:
@@ -152,6 +153,7 @@ class EngineThread {
   void finishDue(bool all);
   HRESULT finish(Recording& recording);
   int64_t nextDeadline() const;
+  bool soundCanComeBy(int64_t due) const;
   void fail(HRESULT status);
   void arrive(Arrival& arrival);
   void receive(Device& device, AVPacket* packet, int64_t readAt);
@@ -184,7 +186,8 @@ class EngineThread {
   ComPtr<IMFSample> lastI420_;
   LONGLONG lastPictureTime_ = 0;
   int64_t lastPictureReadAt_ = 0;
-  AVFrame* lastSound_ = nullptr;  // the microphone's last buffer
+  AVFrame* lastSound_ = nullptr;       // the microphone's last buffer
+  std::deque<int64_t> soundArrivals_;  // when its buffers were read (wall clock, µs), oldest first
 };
 
 void EngineThread::send(const GUID& type, HRESULT status) {
@@ -243,6 +246,7 @@ void EngineThread::closeDevices() {
   lastPicture_ = ComPtr<IMFSample>();
   lastI420_ = ComPtr<IMFSample>();
   av_frame_unref(lastSound_);
+  soundArrivals_.clear();
   sws_freeContext(toI420_);
   toI420_ = nullptr;
   sws_freeContext(toBgra_);
@@ -382,15 +386,27 @@ int64_t EngineThread::nextDeadline() const {
   return next;
 }
 
-// Finishes the stopped clips whose last picture and sound have come, or whose grace has run out
-// (all: every one, now), and answers each StopRecord once its file is complete.
+// Whether the microphone's next delivery may come by `due`: it is expected one of its recent
+// longest pauses after its last. One that sends seconds at once is not waited for when its next
+// lump is due after the grace, since the clip would get silence there all the same.
+bool EngineThread::soundCanComeBy(int64_t due) const {
+  int64_t longest = 0;
+  for (size_t i = 1; i < soundArrivals_.size(); ++i)
+    longest = std::max(longest, soundArrivals_[i] - soundArrivals_[i - 1]);
+  return soundArrivals_.empty() || soundArrivals_.back() + longest <= due;
+}
+
+// Finishes the stopped clips whose last picture and sound have come (or cannot come in time), or
+// whose grace has run out (all: every one, now), and answers each StopRecord once its file is
+// complete.
 void EngineThread::finishDue(bool all) {
   const int64_t now = av_gettime();
   for (auto it = finishing_.begin(); it != finishing_.end();) {
     Recording& recording = **it;
-    const bool pictures = !recording.hasVideo || recording.videoDone || FAILED(recording.failure);
-    const bool sound = !recording.hasAudio || recording.audioReachedAt >= recording.stopAt || FAILED(recording.failure);
     const int64_t due = recording.stopAt + (recording.hasAudio ? soundGrace : videoGrace);
+    const bool pictures = !recording.hasVideo || recording.videoDone || FAILED(recording.failure);
+    const bool sound = !recording.hasAudio || recording.audioReachedAt >= recording.stopAt ||
+                       FAILED(recording.failure) || !soundCanComeBy(due);
     if (!all && !(pictures && sound) && now < due) {
       ++it;
       continue;
@@ -776,6 +792,11 @@ void EngineThread::arrive(Arrival& arrival) {
     return;
   }
   Input& input = *device->input;
+  if (!arrival.video && arrival.packet->stream_index == input.stream) {
+    soundArrivals_.push_back(arrival.readAt);
+    while (soundArrivals_.size() > 2 && soundArrivals_.front() < arrival.readAt - soundHistory)
+      soundArrivals_.pop_front();
+  }
   if (arrival.packet->stream_index == input.stream)
     input.deliver(arrival.packet, [&](AVPacket* delivered) { receive(*device, delivered, arrival.readAt); });
   if (current_ && FAILED(current_->failure)) {
