@@ -140,6 +140,38 @@ test('back-to-back one-second clips of a display and an endpoint each last their
   });
 });
 
+test('a start on a source that still records ends its clip there and begins the next, on every source', async () => {
+  await withDesktop(async (env) => {
+    const { reports, code, stderr } = await runAddon(`${FIND}
+      const path = require('path');
+      const clips = [];
+      for (const s of sources) {
+        const file = (n) => path.join(${JSON.stringify(dir)}, 'again-' + s.type + '-' + s.id + '-' + n + '.mp4');
+        addon.startCapture(s.id, file(0));
+        const first = events[events.length - 1].start;
+        await sleep(800);
+        const second = Date.now();
+        addon.startCapture(s.id, file(1));
+        const started = events[events.length - 1].start;  // after the first clip was finished
+        await sleep(800);
+        const stopped = Date.now();
+        addon.stopCapture(s.id);
+        clips.push({ type: s.type, file: file(0), seconds: (second - first) / 1000 },
+          { type: s.type, file: file(1), seconds: (stopped - started) / 1000 });
+      }
+      report(clips);`, { env: { ...env, TAVIO_TEST_CAMERAS: 'Again Camera=testsrc2=size=320x240:rate=30' } });
+    assert.strictEqual(code, 0, stderr);
+    const clips = reports[0];
+    assert.deepStrictEqual([...new Set(clips.map((c) => c.type))].sort(), ['dxgi', 'mfce_audio', 'mfce_video', 'wasapi']);
+    for (const { type, file, seconds } of clips) {
+      const tolerance = type === 'dxgi' || type === 'mfce_video' ? 1 / 30 + 0.01 : 0.06;
+      const duration = probe(file);
+      assert.ok(Math.abs(duration - seconds) <= tolerance, `${path.basename(file)}: ${duration} s for ${seconds} s`);
+      assert.strictEqual(decodeErrors(file), '', path.basename(file));
+    }
+  });
+});
+
 test('an endpoint clip started right after initialize lasts its wall time', async () => {
   await withDesktop(async (env) => {
     const file = path.join(dir, 'early.mp4');

@@ -529,7 +529,7 @@ TEST_F(CameraSource, KindNameAndAudioAnswers) {
   EXPECT_FALSE(nothing.selected());
 }
 
-TEST_F(CameraSource, PreviewShowsTheCameraAndEncodeRepeatsAreQuiet) {
+TEST_F(CameraSource, PreviewShowsTheCameraAndEachStartIsAClipOfItsOwn) {
   IMFActivate* camera =
       device(MF_DEVSOURCE_ATTRIBUTE_SOURCE_TYPE_VIDCAP_GUID, L"Red Camera", L"lavfi:color=c=red:size=160x120:rate=30");
   mfce::MFCESource source(nullptr, camera, false);
@@ -553,21 +553,26 @@ TEST_F(CameraSource, PreviewShowsTheCameraAndEncodeRepeatsAreQuiet) {
   EXPECT_TRUE(source.preview(picture.data(), 1, 16, 12));  // the frame stays for the next reader
   EXPECT_GT(picture[0], 220);
 
-  const std::string path = ::testing::TempDir() + "camera_test_clip.mp4";
-  std::remove(path.c_str());
-  source.startEncode(path);
-  EXPECT_TRUE(eventually([&] { return source.manager()->IsRecording(); }));
-  source.startEncode(path);  // already capturing: no effect
-  std::this_thread::sleep_for(std::chrono::milliseconds(300));
+  // A start while recording ends the running clip: two files.
+  const std::string paths[2] = {::testing::TempDir() + "camera_test_clip.mp4",
+                                ::testing::TempDir() + "camera_test_next.mp4"};
+  for (const std::string& path : paths) {
+    std::remove(path.c_str());
+    source.startEncode(path);
+    EXPECT_TRUE(eventually([&] { return source.manager()->IsRecording(); }));
+    std::this_thread::sleep_for(std::chrono::milliseconds(300));
+  }
   source.stopEncode();
   EXPECT_TRUE(eventually([&] { return !source.manager()->IsRecording(); }));
   source.stopEncode();
-  FILE* file = std::fopen(path.c_str(), "rb");
-  ASSERT_NE(nullptr, file);
-  std::fseek(file, 0, SEEK_END);
-  EXPECT_GT(std::ftell(file), 1000);
-  std::fclose(file);
-  std::remove(path.c_str());
+  for (const std::string& path : paths) {
+    FILE* file = std::fopen(path.c_str(), "rb");
+    ASSERT_NE(nullptr, file) << path;
+    std::fseek(file, 0, SEEK_END);
+    EXPECT_GT(std::ftell(file), 1000) << path;
+    std::fclose(file);
+    std::remove(path.c_str());
+  }
 
   const std::string refused = ::testing::TempDir() + "camera_test_clip.MP4";
   // Only ".mp4" records; the refusal says so, with the name.

@@ -127,6 +127,9 @@ void MFCESource::startEncode(std::string filename) {
     checkResult(file, 295, E_POINTER, "MFCESource::startEncode() could not start preview: bad pointer");
   // A clip the engine ended by itself (a write that failed) leaves nothing to stop: a new one may start.
   if (capturing && !captureManager->IsRecording()) capturing = false;
+  // A new clip while one records ends that one here, as on the other sources, so that every
+  // started clip is a file of its own; only a clip that cannot be stopped keeps recording.
+  if (capturing) stopEncode();
   if (capturing) {
     checkResult(file, 289, 1, "MFCESource::startEncode() could not start capture: already capturing");
     return;
