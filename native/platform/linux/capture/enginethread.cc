@@ -558,9 +558,17 @@ void EngineThread::deliverVideo(AVFrame* frame, int64_t pts, AVRational timeBase
 // return, counted from the clip's first picture, placed by when that one was read, and never
 // after its own read (a first picture read late would push the rest past the stop). The first
 // picture itself is shown from the start.
+// Pictures sit on the grid of the device's frame rate, at the slot nearest that time (never after
+// the read), so that tools which take the clip for constant-rate find at most one picture a slot:
+// reads that jitter on a busy machine would otherwise put two pictures in one.
 LONGLONG clipTime(const Recording& recording, LONGLONG deviceTime, int64_t readAt) {
-  return std::min<LONGLONG>(deviceTime - recording.firstDeviceTime + (recording.firstReadAt - recording.startAt) * 10,
-                            (readAt - recording.startAt) * 10);
+  const LONGLONG read = (readAt - recording.startAt) * 10;
+  const LONGLONG time = std::min<LONGLONG>(
+      deviceTime - recording.firstDeviceTime + (recording.firstReadAt - recording.startAt) * 10, read);
+  const LONGLONG slot = recording.frameDuration;
+  if (slot <= 0 || time < 0) return time;
+  const LONGLONG nearest = (time + slot / 2) / slot * slot;
+  return nearest > read ? nearest - slot : nearest;
 }
 
 // A picture read before the clip's start (it waited behind a command) replaces the opening one;
@@ -583,8 +591,11 @@ void EngineThread::recordPicture(Recording& recording, IMFSample* bgra, IMFSampl
     return;
   }
   LONGLONG time = clipTime(recording, deviceTime, readAt);
-  if (time <= recording.heldTime)
-    time = recording.heldTime + recording.frameDuration;  // the device's clock jumped back
+  if (time == recording.heldTime) {  // a later picture in the held one's slot takes its place
+    recording.held = ComPtr<IMFSample>(picture);
+    return;
+  }
+  if (time < recording.heldTime) time = recording.heldTime + recording.frameDuration;  // the device's clock jumped back
   writeHeld(recording, time - recording.heldTime);
   recording.held = ComPtr<IMFSample>(picture);
   recording.heldTime = time;
