@@ -1,8 +1,8 @@
 // The Linux capture engine. Its cameras that send H.264 are raw H.264 files read through FFmpeg's
 // h264 demuxer, as a V4L2 camera's stream is read: start-code packets with the parameter sets
 // before each key frame, no key frame on request, and a first packet that is not a key frame (the
-// stream was joined between two). The lavfi test camera that encodes itself is tested from
-// JavaScript (test/js/camera-h264.test.js).
+// stream was joined between two). Those are read as fast as the file gives them; a camera that
+// must keep real time is the lavfi test camera that encodes itself.
 #include <gtest/gtest.h>
 
 #include <chrono>
@@ -176,7 +176,7 @@ TEST(LinuxCaptureEngine, H264CameraIsRecordedAsItSendsItFromItsFirstKeyFrame) {
 
 // A camera that sends H.264 in real time (the lavfi test camera that encodes itself, for two
 // seconds), recorded with a bit rate of its own: encoded again, as Baseline, every picture on the
-// grid of the camera's rate, one a slot, none lost.
+// grid of the camera's rate, one a slot.
 TEST(LinuxCaptureEngine, H264CameraIsEncodedAgainOnItsFrameGridWhenTheRecordStreamHasABitRate) {
   MediaFoundation started;
   media::TempFolder folder;
