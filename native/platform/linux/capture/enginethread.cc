@@ -125,7 +125,7 @@ struct Recording {
   ComPtr<IMFSample> held;
   LONGLONG heldTime = 0;
   int64_t firstDeviceTime = AV_NOPTS_VALUE;  // the device's time of the clip's first picture
-  LONGLONG deviceOffset = 0;                 // and its clip time, lowered by any read that comes earlier
+  int64_t firstReadAt = 0;                   // and the wall clock (µs) when it was read
   bool videoDone = false;                    // a picture from after the stop has come
   SwrContext* resampler = nullptr;
   int audioRate = 0;
@@ -359,7 +359,7 @@ HRESULT EngineThread::startRecording(const Order& order) {
     // The picture current at the start opens the clip.
     recording->held = recording->padded ? lastPicture_ : lastI420_;
     recording->firstDeviceTime = lastPictureTime_;
-    recording->deviceOffset = (lastPictureReadAt_ - recording->startAt) * 10;
+    recording->firstReadAt = lastPictureReadAt_;
   }
   // The microphone's last buffer may hold sound from after the start.
   if (recording->hasAudio && lastSound_->nb_samples > 0 && state_->audio && state_->audio->input)
@@ -555,16 +555,16 @@ void EngineThread::deliverVideo(AVFrame* frame, int64_t pts, AVRational timeBase
 }
 
 // Where a picture goes in its clip: its device time, which is steadier than the moments reads
-// return, counted from the clip's first picture and placed as early as any read so far allows,
-// so never after its own read (a first picture read late would push the rest past the stop). The
-// pictures keep the device's spacing however the reads jitter on a busy machine, and sit on the
-// grid of its frame rate, at the nearest slot not after the read, so that tools which take the
-// clip for constant-rate find at most one picture a slot. The first picture is shown from the start.
-LONGLONG clipTime(Recording& recording, LONGLONG deviceTime, int64_t readAt) {
+// return, counted from the clip's first picture, placed by when that one was read, and never
+// after its own read (a first picture read late would push the rest past the stop). The first
+// picture itself is shown from the start.
+// Pictures sit on the grid of the device's frame rate, at the slot nearest that time (never after
+// the read), so that tools which take the clip for constant-rate find at most one picture a slot:
+// reads that jitter on a busy machine would otherwise put two pictures in one.
+LONGLONG clipTime(const Recording& recording, LONGLONG deviceTime, int64_t readAt) {
   const LONGLONG read = (readAt - recording.startAt) * 10;
-  const LONGLONG sinceFirst = deviceTime - recording.firstDeviceTime;
-  recording.deviceOffset = std::min(recording.deviceOffset, read - sinceFirst);
-  const LONGLONG time = sinceFirst + recording.deviceOffset;
+  const LONGLONG time = std::min<LONGLONG>(
+      deviceTime - recording.firstDeviceTime + (recording.firstReadAt - recording.startAt) * 10, read);
   const LONGLONG slot = recording.frameDuration;
   if (slot <= 0 || time < 0) return time;
   const LONGLONG nearest = (time + slot / 2) / slot * slot;
@@ -587,7 +587,7 @@ void EngineThread::recordPicture(Recording& recording, IMFSample* bgra, IMFSampl
     recording.held = ComPtr<IMFSample>(picture);
     recording.heldTime = 0;
     recording.firstDeviceTime = deviceTime;
-    recording.deviceOffset = (readAt - recording.startAt) * 10;
+    recording.firstReadAt = readAt;
     return;
   }
   LONGLONG time = clipTime(recording, deviceTime, readAt);
@@ -757,14 +757,15 @@ void EngineThread::passThrough(Recording& recording, const AVPacket* packet, AVR
     recording.held = sample;
     recording.heldTime = 0;
     recording.firstDeviceTime = deviceTime;
-    recording.deviceOffset = (readAt - recording.startAt) * 10;
+    recording.firstReadAt = readAt;
     recording.frameDuration = duration;
     recording.videoDone = late;
     return;
   }
   LONGLONG time = recording.heldTime + recording.frameDuration;  // no time of its own: the packets follow one another
-  if (deviceTime != AV_NOPTS_VALUE && recording.firstDeviceTime != AV_NOPTS_VALUE)
-    time = std::max(time, clipTime(recording, deviceTime, readAt));
+  if (deviceTime != AV_NOPTS_VALUE && recording.firstDeviceTime != AV_NOPTS_VALUE &&
+      clipTime(recording, deviceTime, readAt) > recording.heldTime)
+    time = clipTime(recording, deviceTime, readAt);
   writeHeld(recording, time - recording.heldTime);
   recording.held = sample;
   recording.heldTime = time;
