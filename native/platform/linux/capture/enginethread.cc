@@ -556,11 +556,10 @@ void EngineThread::deliverVideo(AVFrame* frame, int64_t pts, AVRational timeBase
 
 // Where a picture goes in its clip: its device time, which is steadier than the moments reads
 // return, counted from the clip's first picture, placed by when that one was read, and never
-// after its own read (a first picture read late would push the rest past the stop). The first
-// picture itself is shown from the start.
-// Pictures sit on the grid of the device's frame rate, at the slot nearest that time (never after
-// the read), so that tools which take the clip for constant-rate find at most one picture a slot:
-// reads that jitter on a busy machine would otherwise put two pictures in one.
+// after its own read (a first picture read late would push the rest past the stop), on the grid of
+// the device's frame rate: the nearest slot that is not after the read. Tools that take the clip
+// for constant-rate then find at most one picture a slot, however the reads jitter on a busy
+// machine. The first picture itself is shown from the start.
 LONGLONG clipTime(const Recording& recording, LONGLONG deviceTime, int64_t readAt) {
   const LONGLONG read = (readAt - recording.startAt) * 10;
   const LONGLONG time = std::min<LONGLONG>(
@@ -803,13 +802,14 @@ void EngineThread::arrive(Arrival& arrival) {
     return;
   }
   Input& input = *device->input;
-  if (!arrival.video && arrival.packet->stream_index == input.stream) {
-    soundArrivals_.push_back(arrival.readAt);
-    while (soundArrivals_.size() > 2 && soundArrivals_.front() < arrival.readAt - soundHistory)
-      soundArrivals_.pop_front();
-  }
-  if (arrival.packet->stream_index == input.stream)
+  if (arrival.packet->stream_index == input.stream) {
+    if (!arrival.video) {
+      soundArrivals_.push_back(arrival.readAt);
+      while (soundArrivals_.size() > 2 && soundArrivals_.front() < arrival.readAt - soundHistory)
+        soundArrivals_.pop_front();
+    }
     input.deliver(arrival.packet, [&](AVPacket* delivered) { receive(*device, delivered, arrival.readAt); });
+  }
   if (current_ && FAILED(current_->failure)) {
     // A write failed (a full disk): the clip ends here with what it has, and says so.
     finishing_.push_back(std::move(current_));
