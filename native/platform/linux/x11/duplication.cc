@@ -362,9 +362,7 @@ HRESULT Duplication::AcquireNextFrame(UINT timeoutMilliseconds, DXGI_OUTDUPL_FRA
   handleEvents();
   if (lost_) return DXGI_ERROR_ACCESS_LOST;
 
-  bool moved = pointerMoved();
-  handleEvents();  // events that came in with the reply
-  if (!first_ && !drawn_ && !shapeChanged_ && !moved) {
+  if (!first_ && !drawn_ && !shapeChanged_) {
     auto deadline = std::chrono::steady_clock::now() + std::chrono::milliseconds(timeoutMilliseconds);
     int fd = xcb_get_file_descriptor(connection_.get());
     for (;;) {
@@ -377,13 +375,13 @@ HRESULT Duplication::AcquireNextFrame(UINT timeoutMilliseconds, DXGI_OUTDUPL_FRA
       if (lost_) return DXGI_ERROR_ACCESS_LOST;
       if (drawn_ || shapeChanged_) break;
     }
-    if (!drawn_ && !shapeChanged_) {
-      moved = pointerMoved();
-      handleEvents();
-      if (lost_) return DXGI_ERROR_ACCESS_LOST;
-      if (!drawn_ && !shapeChanged_ && !moved) return DXGI_ERROR_WAIT_TIMEOUT;
-    }
   }
+  // The pointer is asked for once a call, after the wait: the pump calls again at once, so a
+  // second question before the wait would find what this one found (and cost a round trip).
+  const bool moved = pointerMoved();
+  handleEvents();  // events that came in with the reply
+  if (lost_) return DXGI_ERROR_ACCESS_LOST;
+  if (!first_ && !drawn_ && !shapeChanged_ && !moved) return DXGI_ERROR_WAIT_TIMEOUT;
 
   std::memset(frameInfo, 0, sizeof(*frameInfo));
   int64_t now = ticks();
