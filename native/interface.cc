@@ -1,5 +1,5 @@
 // The add-on's face toward Node: the module record, the seven functions, the source list,
-// event delivery and the screen pump.
+// event delivery, the screen pump and the clips finished at exit.
 #include <nan.h>
 #include <node.h>
 
@@ -231,7 +231,32 @@ NAN_METHOD(mouseCapture) {
   }
 }
 
+// A host that ends while clips record (process.exit, the end of its script, an uncaught exception)
+// would lose what they had not written yet: on the process's "exit" event, while every thread still
+// runs, each source stops its clip and the files are finished, for a few seconds at the most.
+NAN_METHOD(finishClipsAtExit) {
+  const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(3);
+  for (size_t i = 0; i < sources.size(); ++i) {
+    try {
+      sources[i]->finishClips(deadline);
+    } catch (const std::exception& e) {
+      capture::logWarning(e.what());
+    }
+  }
+}
+
+void onExit(v8::Local<v8::Function> handler) {
+  v8::Local<v8::Object> global = Nan::GetCurrentContext()->Global();
+  v8::Local<v8::Value> process;
+  v8::Local<v8::Value> on;
+  if (!Nan::Get(global, Nan::New("process").ToLocalChecked()).ToLocal(&process) || !process->IsObject()) return;
+  if (!Nan::Get(process.As<v8::Object>(), Nan::New("on").ToLocalChecked()).ToLocal(&on) || !on->IsFunction()) return;
+  v8::Local<v8::Value> argv[] = {Nan::New("exit").ToLocalChecked(), handler};
+  (void)Nan::Call(on.As<v8::Function>(), process.As<v8::Object>(), 2, argv);
+}
+
 void initModule(v8::Local<v8::Object> exports, v8::Local<v8::Value>, void*) {
+  onExit(Nan::GetFunction(Nan::New<v8::FunctionTemplate>(finishClipsAtExit)).ToLocalChecked());
   Nan::SetMethod(exports, "initialize", initialize);
   Nan::SetMethod(exports, "getPreview", getPreview);
   Nan::SetMethod(exports, "transfer", transfer);

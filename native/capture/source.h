@@ -1,6 +1,7 @@
 // The interface of every capture device the add-on offers to JavaScript.
 #pragma once
 
+#include <chrono>
 #include <cstdint>
 #include <string>
 
@@ -26,6 +27,9 @@ class Source {
   virtual void stopCapturing() = 0;
   virtual void startEncode(std::string filename) = 0;
   virtual void stopEncode() = 0;
+  // Stops the clip that records and returns once every clip of this source is in its file, or at
+  // the deadline; for a host that ends while it records.
+  virtual void finishClips(std::chrono::steady_clock::time_point /*deadline*/) {}
   virtual bool selected() = 0;
 };
 

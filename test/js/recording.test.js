@@ -1,8 +1,8 @@
 'use strict';
 // Clips as a user records them: each covers its start to its stop whatever the picture or the
-// sound does, clips started together line up, start/stop cycles lose nothing, and a host killed
-// mid-recording leaves files that play up to about a second before the kill, in FFmpeg, GStreamer
-// and MediaInfo alike.
+// sound does, clips started together line up, start/stop cycles lose nothing, a host that ends
+// while recording finishes its clips first, and a host killed mid-recording leaves files that play
+// up to about a second before the kill, in FFmpeg, GStreamer and MediaInfo alike.
 const { test, before, after } = require('node:test');
 const assert = require('node:assert');
 const { execFileSync, spawnSync } = require('child_process');
@@ -186,6 +186,34 @@ test('an endpoint clip started right after initialize lasts its wall time', asyn
     const [wall] = reports;
     assert.ok(Math.abs(probe(file) - wall) <= 0.05, `${probe(file)} s for ${wall} s`);
   }, { display: false });
+});
+
+test('a host that ends while recording (process.exit, an uncaught exception) finishes every clip first', async () => {
+  await withDesktop(async (env) => {
+    for (const how of ['exit', 'throw']) {
+      const { reports, code } = await runAddon(`${FIND}
+        const path = require('path');
+        await sleep(500);
+        const clips = sources.map((s) => ({ type: s.type, file: path.join(${JSON.stringify(dir)}, '${how}-' + s.type + '-' + s.id + '.mp4') }));
+        clips.forEach((c, i) => addon.startCapture(sources[i].id, c.file));
+        const start = Date.now();
+        await sleep(2000);
+        report({ clips, seconds: (Date.now() - start) / 1000 });
+        if ('${how}' === 'exit') process.exit(0);
+        setTimeout(() => { throw new Error('a host that fails'); });
+        await sleep(5000);`, { env: { ...env, TAVIO_TEST_CAMERAS: 'Exit Camera=testsrc2=size=320x240:rate=30' } });
+      assert.strictEqual(code, how === 'exit' ? 0 : 1, how);
+      const { clips, seconds } = reports[0];
+      assert.deepStrictEqual([...new Set(clips.map((c) => c.type))].sort(), ['dxgi', 'mfce_audio', 'mfce_video', 'wasapi']);
+      for (const { type, file } of clips) {
+        // Up to the moment the host ended; before, the last unfinished piece of every file was lost.
+        const duration = probe(file);
+        const tolerance = type === 'dxgi' || type === 'mfce_video' ? 1 / 30 + 0.01 : 0.06;
+        assert.ok(duration >= seconds - tolerance && duration <= seconds + 0.5, `${how}, ${path.basename(file)}: ${duration} s for ${seconds} s`);
+        assert.strictEqual(decodeErrors(file), '', path.basename(file));
+      }
+    }
+  });
 });
 
 test('a host killed while recording leaves files that play up to a second before the kill', async () => {

@@ -101,6 +101,7 @@ uint64_t counterNow() {
 }  // namespace
 
 struct Source::Clip {
+  std::shared_ptr<void> unfinished;  // let go last, after the encoder has closed the file
   std::unique_ptr<Encoder> encoder;
   const WAVEFORMATEXTENSIBLE* format = nullptr;  // the capture format the encoder takes
   uint64_t start = 0;                            // capture clock, 100 ns
@@ -192,6 +193,11 @@ void Source::stopEncode() {
   latest.reset();
 }
 
+void Source::finishClips(std::chrono::steady_clock::time_point deadline) {
+  stopEncode();
+  unfinished.waitUntil(deadline);
+}
+
 void Source::capture() {
   if (capturing.exchange(true)) return;
   std::thread([self = shared_from_this()] {
@@ -223,6 +229,7 @@ void Source::startEncode(std::string filename) {
   if (!format.load())
     capture::checkResult(kFile, 150, AUDCLNT_E_NOT_INITIALIZED, "Audio capture has not started on this endpoint.");
   auto clip = std::make_shared<Clip>();
+  clip->unfinished = unfinished.hold();
   clip->format = format.load();
   clip->encoder.reset(makeEncoder(filename, clip->format));
   clip->start = counterNow();

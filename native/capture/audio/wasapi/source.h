@@ -11,6 +11,7 @@
 
 #include "capture/audio/encoder.h"
 #include "capture/audio/source.h"
+#include "capture/unfinished.h"
 #include "platform/wasapi.h"
 
 namespace capture::audio::wasapi {
@@ -36,6 +37,7 @@ class Source : public capture::audio::Source, public std::enable_shared_from_thi
   void stopCapturing() override;
   void startEncode(std::string filename) override;
   void stopEncode() override;
+  void finishClips(std::chrono::steady_clock::time_point deadline) override;
   bool selected() override;
 
   // 0 until the capture thread has read the format.
@@ -72,6 +74,7 @@ class Source : public capture::audio::Source, public std::enable_shared_from_thi
   std::deque<std::shared_ptr<Clip>> started;   // guarded by clipsLock
   std::shared_ptr<Clip> latest;                // the caller's thread only
   std::vector<std::shared_ptr<Clip>> writing;  // the capture thread only
+  capture::UnfinishedClips unfinished;
   EncoderFactory makeEncoder;
   bool isSelected;
   std::mutex peakLock;

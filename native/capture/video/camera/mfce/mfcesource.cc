@@ -168,6 +168,11 @@ void MFCESource::stopEncode() {
   }
 }
 
+// The engine's stop already waits until the file is written.
+void MFCESource::finishClips(std::chrono::steady_clock::time_point) {
+  if (capturing) stopEncode();
+}
+
 bool MFCESource::preview(uint8_t* dst, uint32_t swapRedBlue, int32_t dstWidth, int32_t dstHeight) {
   if (!frameQueue) return false;
   std::lock_guard<std::mutex> lock(frameQueue->mutex);

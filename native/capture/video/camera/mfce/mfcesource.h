@@ -27,6 +27,7 @@ class MFCESource : public capture::video::Source, public capture::audio::Source 
   void stopCapturing() override {}
   void startEncode(std::string filename) override;
   void stopEncode() override;
+  void finishClips(std::chrono::steady_clock::time_point deadline) override;
   bool selected() override { return isSelected; }
 
   bool preview(uint8_t* dst, uint32_t swapRedBlue, int32_t dstWidth, int32_t dstHeight) override;

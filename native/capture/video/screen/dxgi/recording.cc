@@ -10,8 +10,9 @@
 namespace capture::video::screen::dxgi {
 
 void startRecording(const std::shared_ptr<capture::video::FrameQueue>& queue,
-                    const std::shared_ptr<capture::video::Clip>& clip) {
-  std::thread([queue, clip] {
+                    const std::shared_ptr<capture::video::Clip>& clip, std::shared_ptr<void> unfinished) {
+  // The token goes with the thread's function, after the encoder has closed the file.
+  std::thread([queue, clip, unfinished = std::move(unfinished)] {
     capture::nameThread("tavio-record");
     capture::video::encoder::MFTEncoder encoder(clip);
     // A failed clip is reported as a warning and ends only this thread, not the host process.

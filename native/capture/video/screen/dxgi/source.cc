@@ -146,7 +146,7 @@ void Source::startEncode(std::string filename) {
     queue->stopped = false;
   }
   queue->changed.notify_all();
-  startRecording(queue, started);
+  startRecording(queue, started, unfinished.hold());
 }
 
 void Source::stopEncode() {
@@ -156,6 +156,11 @@ void Source::stopEncode() {
     queue->stopped = true;
   }
   queue->changed.notify_all();
+}
+
+void Source::finishClips(std::chrono::steady_clock::time_point deadline) {
+  stopEncode();
+  unfinished.waitUntil(deadline);
 }
 
 }  // namespace capture::video::screen::dxgi

@@ -5,6 +5,7 @@
 #include <memory>
 #include <string>
 
+#include "capture/unfinished.h"
 #include "capture/video/frame.h"
 #include "capture/video/screen/dxgi/pointer.h"
 #include "capture/video/source.h"
@@ -27,6 +28,7 @@ class Source : public capture::video::Source {
   void stopCapturing() override {}
   void startEncode(std::string filename) override;
   void stopEncode() override;
+  void finishClips(std::chrono::steady_clock::time_point deadline) override;
   bool selected() override { return isSelected; }
 
   bool preview(uint8_t* dst, uint32_t swapRedBlue, int32_t dstWidth, int32_t dstHeight) override;
@@ -39,6 +41,7 @@ class Source : public capture::video::Source {
   // Shared with the recording thread, which may outlive the source.
   std::shared_ptr<capture::video::FrameQueue> queue;
   std::shared_ptr<capture::video::Clip> clip;  // the latest clip, guarded by queue->mutex
+  capture::UnfinishedClips unfinished;
   ComPtr<IDXGIOutput1> output;
   ComPtr<ID3D11Device> device;
   ComPtr<ID3D11DeviceContext> context;
