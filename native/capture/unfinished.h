@@ -26,10 +26,10 @@ class UnfinishedClips {
     });
   }
 
-  // True once every clip is in its file, false at the deadline.
-  bool waitUntil(std::chrono::steady_clock::time_point deadline) {
+  // Returns once every clip is in its file, or at the deadline.
+  void waitUntil(std::chrono::steady_clock::time_point deadline) {
     std::unique_lock<std::mutex> lock(state_->mutex);
-    return state_->none.wait_until(lock, deadline, [this] { return state_->count == 0; });
+    state_->none.wait_until(lock, deadline, [this] { return state_->count == 0; });
   }
 
  private:

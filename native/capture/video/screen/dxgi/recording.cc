@@ -11,7 +11,6 @@ namespace capture::video::screen::dxgi {
 
 void startRecording(const std::shared_ptr<capture::video::FrameQueue>& queue,
                     const std::shared_ptr<capture::video::Clip>& clip, std::shared_ptr<void> unfinished) {
-  // The token goes with the thread's function, after the encoder has closed the file.
   std::thread([queue, clip, unfinished = std::move(unfinished)] {
     capture::nameThread("tavio-record");
     capture::video::encoder::MFTEncoder encoder(clip);
