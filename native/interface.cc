@@ -231,11 +231,18 @@ NAN_METHOD(mouseCapture) {
   }
 }
 
-// A host that ends while clips record (process.exit, the end of its script, an uncaught exception)
-// would lose what they had not written yet: on the process's "exit" event, while every thread still
+// A host that ends while clips record (process.exit, the end of its script, an uncaught exception,
+// a signal) would lose what they had not written yet, and on Windows a whole clip, since its file
+// gets its index only when it is finished. So before the process goes, while every thread still
 // runs, each source stops its clip and the files are finished, for a few seconds at the most.
-NAN_METHOD(finishClipsAtExit) {
+void finishEveryClip() {
   const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(3);
+  // Clips that stop at once stop first: a camera's stop may wait for its microphone's last sound,
+  // and the clips of the other sources would run on meanwhile.
+  for (size_t i = 0; i < sources.size(); ++i) {
+    const int32_t type = sources[i]->type();
+    if (type == capture::Screen || type == capture::AudioEndpoint) sources[i]->stopEncode();
+  }
   for (size_t i = 0; i < sources.size(); ++i) {
     try {
       sources[i]->finishClips(deadline);
@@ -245,18 +252,52 @@ NAN_METHOD(finishClipsAtExit) {
   }
 }
 
-void onExit(v8::Local<v8::Function> handler) {
-  v8::Local<v8::Object> global = Nan::GetCurrentContext()->Global();
+v8::Local<v8::Object> processObject() {
   v8::Local<v8::Value> process;
-  v8::Local<v8::Value> on;
-  if (!Nan::Get(global, Nan::New("process").ToLocalChecked()).ToLocal(&process) || !process->IsObject()) return;
-  if (!Nan::Get(process.As<v8::Object>(), Nan::New("on").ToLocalChecked()).ToLocal(&on) || !on->IsFunction()) return;
-  v8::Local<v8::Value> argv[] = {Nan::New("exit").ToLocalChecked(), handler};
-  (void)Nan::Call(on.As<v8::Function>(), process.As<v8::Object>(), 2, argv);
+  if (!Nan::Get(Nan::GetCurrentContext()->Global(), Nan::New("process").ToLocalChecked()).ToLocal(&process) ||
+      !process->IsObject())
+    return {};
+  return process.As<v8::Object>();
+}
+
+// process[name](...argv); an empty handle when there is no such method or it threw.
+v8::Local<v8::Value> callProcess(const char* name, int argc, v8::Local<v8::Value> argv[]) {
+  v8::Local<v8::Object> process = processObject();
+  v8::Local<v8::Value> method;
+  if (process.IsEmpty() || !Nan::Get(process, Nan::New(name).ToLocalChecked()).ToLocal(&method) ||
+      !method->IsFunction())
+    return {};
+  return Nan::Call(method.As<v8::Function>(), process, argc, argv).FromMaybe(v8::Local<v8::Value>());
+}
+
+NAN_METHOD(finishClipsAtExit) { finishEveryClip(); }
+
+// A signal the host does not handle ends the process as before, once the clips are finished: the
+// listener goes and the signal is raised again. A host with a listener of its own decides itself;
+// when it exits, the exit event finishes the clips. This listener comes first, so that a host's
+// `once` listener is still counted.
+NAN_METHOD(finishClipsOnSignal) {
+  v8::Local<v8::Value> signal = info[0];
+  v8::Local<v8::Value> listeners = callProcess("listenerCount", 1, &signal);
+  if (listeners.IsEmpty() || !listeners->IsNumber() || Nan::To<double>(listeners).FromJust() > 1) return;
+  finishEveryClip();
+  callProcess("removeAllListeners", 1, &signal);
+  v8::Local<v8::Value> pid;
+  if (!Nan::Get(processObject(), Nan::New("pid").ToLocalChecked()).ToLocal(&pid)) return;
+  v8::Local<v8::Value> argv[] = {pid, signal};
+  callProcess("kill", 2, argv);
+}
+
+void listen(const char* how, const char* event, Nan::FunctionCallback handler) {
+  v8::Local<v8::Value> argv[] = {Nan::New(event).ToLocalChecked(),
+                                 Nan::GetFunction(Nan::New<v8::FunctionTemplate>(handler)).ToLocalChecked()};
+  callProcess(how, 2, argv);
 }
 
 void initModule(v8::Local<v8::Object> exports, v8::Local<v8::Value>, void*) {
-  onExit(Nan::GetFunction(Nan::New<v8::FunctionTemplate>(finishClipsAtExit)).ToLocalChecked());
+  listen("on", "exit", finishClipsAtExit);
+  // The signals that end a process from its terminal or its session.
+  for (const char* signal : {"SIGINT", "SIGTERM", "SIGHUP"}) listen("prependListener", signal, finishClipsOnSignal);
   Nan::SetMethod(exports, "initialize", initialize);
   Nan::SetMethod(exports, "getPreview", getPreview);
   Nan::SetMethod(exports, "transfer", transfer);

@@ -188,21 +188,29 @@ test('an endpoint clip started right after initialize lasts its wall time', asyn
   }, { display: false });
 });
 
-test('a host that ends while recording (process.exit, an uncaught exception) finishes every clip first', async () => {
+test('a host that ends while recording (process.exit, an uncaught exception, a signal) finishes every clip first', async () => {
   await withDesktop(async (env) => {
-    for (const how of ['exit', 'throw']) {
-      const { reports, code } = await runAddon(`${FIND}
+    // 'SIGINT, handled': the host's own listener decides, and it records on until it exits.
+    for (const how of ['exit', 'throw', 'SIGINT', 'SIGTERM', 'SIGINT, handled']) {
+      const { reports, code, signal } = await runAddon(`${FIND}
         const path = require('path');
+        const how = ${JSON.stringify(how)};
         await sleep(500);
-        const clips = sources.map((s) => ({ type: s.type, file: path.join(${JSON.stringify(dir)}, '${how}-' + s.type + '-' + s.id + '.mp4') }));
+        const clips = sources.map((s) => ({ type: s.type, file: path.join(${JSON.stringify(dir)}, how.replace(/\\W+/g, '-') + '-' + s.type + '-' + s.id + '.mp4') }));
         clips.forEach((c, i) => addon.startCapture(sources[i].id, c.file));
         const start = Date.now();
+        const end = () => report({ clips, seconds: (Date.now() - start) / 1000 });
+        if (how === 'SIGINT, handled') process.once('SIGINT', () => setTimeout(() => { end(); process.exit(0); }, 1000));
         await sleep(2000);
-        report({ clips, seconds: (Date.now() - start) / 1000 });
-        if ('${how}' === 'exit') process.exit(0);
-        setTimeout(() => { throw new Error('a host that fails'); });
+        if (how !== 'SIGINT, handled') end();
+        if (how === 'exit') process.exit(0);
+        if (how === 'throw') setTimeout(() => { throw new Error('a host that fails'); });
+        else process.kill(process.pid, how.split(',')[0]);
         await sleep(5000);`, { env: { ...env, TAVIO_TEST_CAMERAS: 'Exit Camera=testsrc2=size=320x240:rate=30' } });
-      assert.strictEqual(code, how === 'exit' ? 0 : 1, how);
+      // The process still ends as it would have without the add-on.
+      assert.deepStrictEqual({ code, signal }, { exit: { code: 0, signal: null }, throw: { code: 1, signal: null },
+        SIGINT: { code: null, signal: 'SIGINT' }, SIGTERM: { code: null, signal: 'SIGTERM' },
+        'SIGINT, handled': { code: 0, signal: null } }[how], how);
       const { clips, seconds } = reports[0];
       assert.deepStrictEqual([...new Set(clips.map((c) => c.type))].sort(), ['dxgi', 'mfce_audio', 'mfce_video', 'wasapi']);
       for (const { type, file } of clips) {
