@@ -1,8 +1,9 @@
 'use strict';
 // Clips as a user records them: each covers its start to its stop whatever the picture or the
-// sound does, clips started together line up, start/stop cycles lose nothing, a host that ends
-// while recording finishes its clips first, and a host killed mid-recording leaves files that play
-// up to about a second before the kill, in FFmpeg, GStreamer and MediaInfo alike.
+// sound does, clips started together line up, start/stop cycles lose nothing, two clips never
+// write one file, a host that ends while recording finishes its clips first, and a host killed
+// mid-recording leaves files that play up to about a second before the kill, in FFmpeg,
+// GStreamer and MediaInfo alike.
 const { test, before, after } = require('node:test');
 const assert = require('node:assert');
 const { execFileSync, spawnSync } = require('child_process');
@@ -169,6 +170,25 @@ test('a start on a source that still records ends its clip there and begins the 
       assert.ok(Math.abs(duration - seconds) <= tolerance, `${path.basename(file)}: ${duration} s for ${seconds} s`);
       assert.strictEqual(decodeErrors(file), '', path.basename(file));
     }
+  });
+});
+
+test('a clip started under the name of one still being written is a warning line, and the first stays whole', async () => {
+  await withDesktop(async (env) => {
+    const file = path.join(dir, 'one-name.mp4');
+    const { reports, code, stdout, stderr } = await runAddon(`${FIND}
+      addon.startCapture(speakers.id, ${JSON.stringify(file)});
+      const start = Date.now();
+      addon.startCapture(display.id, ${JSON.stringify(file)});
+      await sleep(1000);
+      addon.stopCapture(speakers.id);
+      report((Date.now() - start) / 1000);
+      addon.stopCapture(display.id);
+      await sleep(300);`, { env });
+    assert.strictEqual(code, 0, stderr);
+    assert.match(stdout, /0x80070020: .*\(The process cannot access the file because it is being used by another process\.\)/);
+    assert.ok(Math.abs(probe(file) - reports[0]) <= 0.06, `${probe(file)} s for ${reports[0]} s`);
+    assert.strictEqual(decodeErrors(file), '');
   });
 });
 

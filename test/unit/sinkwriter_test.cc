@@ -163,6 +163,25 @@ TEST(SinkWriter, UnopenablePathsFailWithTheWindowsCodes) {
   EXPECT_EQ(hr, MF_E_UNSUPPORTED_BYTESTREAM_TYPE);
 }
 
+TEST(SinkWriter, AFileAnotherWriterHoldsIsRefusedUntilItIsFinished) {
+  MediaFoundation started;
+  media::TempFolder folder;
+  const std::string path = folder.file("busy.mp4");
+  DWORD stream = 0;
+  ComPtr<IMFSinkWriter> first = videoWriter(path, 64, 64, &stream);
+  ASSERT_TRUE(first);
+  HRESULT hr = S_OK;
+  EXPECT_FALSE(createWriter(path, &hr));
+  EXPECT_EQ(hr, HRESULT_FROM_WIN32(ERROR_SHARING_VIOLATION));
+  // The refused writer left the first one's file alone.
+  const auto pixels = bands(64, 64, true);
+  for (int i = 0; i < 3; ++i) ASSERT_EQ(writeBytes(first, stream, pixels, i * 333333LL, 333333), S_OK);
+  ASSERT_EQ(first->Finalize(), S_OK);
+  EXPECT_EQ(media::decode(path, AVMEDIA_TYPE_VIDEO).frames, 3);
+  EXPECT_TRUE(createWriter(path, &hr));
+  EXPECT_EQ(hr, S_OK);
+}
+
 TEST(SinkWriter, CreatesTheFileAtOnceAndTakesTheContainerFromTheAttribute) {
   MediaFoundation started;
   media::TempFolder folder;

@@ -1,6 +1,7 @@
 #include "platform/linux/ffmpeg/mp4file.h"
 
 #include <fcntl.h>
+#include <sys/file.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -51,10 +52,19 @@ void forEachBox(const std::vector<uint8_t>& data, size_t begin, size_t end, Visi
 }  // namespace
 
 Mp4File::Mp4File(const std::string& path) {
-  // Read and write: the header is read back when its durations are stamped.
-  fd_ = ::open(path.c_str(), O_RDWR | O_CREAT | O_TRUNC | O_CLOEXEC, 0644);
+  // Read and write: the header is read back when its durations are stamped. The file is emptied
+  // only once it is ours: one that another writer holds (a clip still being finished under the
+  // same name) is refused, as Windows refuses to share a file it writes, rather than both writing
+  // over each other.
+  fd_ = ::open(path.c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0644);
   if (fd_ < 0) {
     error_ = errno;
+    return;
+  }
+  if (::flock(fd_, LOCK_EX | LOCK_NB) != 0 || ::ftruncate(fd_, 0) != 0) {
+    error_ = errno == EWOULDBLOCK ? EBUSY : errno;
+    ::close(fd_);
+    fd_ = -1;
     return;
   }
   auto* buffer = static_cast<unsigned char*>(av_malloc(bufferSize));
