@@ -61,8 +61,11 @@ Mp4File::Mp4File(const std::string& path) {
     error_ = errno;
     return;
   }
-  if (::flock(fd_, LOCK_EX | LOCK_NB) != 0 || ::ftruncate(fd_, 0) != 0) {
-    error_ = errno == EWOULDBLOCK ? EBUSY : errno;
+  // A file system without locks records all the same, and so does a device (EINVAL: it has no
+  // length to cut).
+  const bool held = ::flock(fd_, LOCK_EX | LOCK_NB) != 0 && errno == EWOULDBLOCK;
+  if (held || (::ftruncate(fd_, 0) != 0 && errno != EINVAL)) {
+    error_ = held ? EBUSY : errno;
     ::close(fd_);
     fd_ = -1;
     return;
