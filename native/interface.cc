@@ -294,10 +294,23 @@ void listen(const char* how, const char* event, Nan::FunctionCallback handler) {
   callProcess(how, 2, argv);
 }
 
+// Electron quits an app on these signals through handlers of its own, which a listener here would
+// replace; its quit ends in the exit event, which finishes the clips.
+bool inElectron() {
+  v8::Local<v8::Object> process = processObject();
+  v8::Local<v8::Value> versions;
+  v8::Local<v8::Value> electron;
+  return !process.IsEmpty() && Nan::Get(process, Nan::New("versions").ToLocalChecked()).ToLocal(&versions) &&
+         versions->IsObject() &&
+         Nan::Get(versions.As<v8::Object>(), Nan::New("electron").ToLocalChecked()).ToLocal(&electron) &&
+         !electron->IsUndefined();
+}
+
 void initModule(v8::Local<v8::Object> exports, v8::Local<v8::Value>, void*) {
   listen("on", "exit", finishClipsAtExit);
   // The signals that end a process from its terminal or its session.
-  for (const char* signal : {"SIGINT", "SIGTERM", "SIGHUP"}) listen("prependListener", signal, finishClipsOnSignal);
+  if (!inElectron())
+    for (const char* signal : {"SIGINT", "SIGTERM", "SIGHUP"}) listen("prependListener", signal, finishClipsOnSignal);
   Nan::SetMethod(exports, "initialize", initialize);
   Nan::SetMethod(exports, "getPreview", getPreview);
   Nan::SetMethod(exports, "transfer", transfer);

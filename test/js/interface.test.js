@@ -2,7 +2,7 @@
 // The add-on's seven functions, argument rules and events, from JavaScript.
 const test = require('node:test');
 const assert = require('node:assert');
-const { runAddon } = require('./addon');
+const { runAddon, root } = require('./addon');
 const { execFileSync } = require('child_process');
 const { startDesktop, startAnimation } = require('../../scripts/desktop');
 
@@ -15,6 +15,14 @@ test('exports the seven functions in order', async () => {
   assert.deepStrictEqual(reports[0], ['initialize', 'getPreview', 'transfer', 'setCallback', 'startCapture',
     'stopCapture', 'mouseCapture']);
   assert.strictEqual(reports[1], 'function');
+});
+
+test('loading listens for exit and the ending signals, but leaves the signals to Electron, which quits on its own', () => {
+  const listeners = (prelude) => JSON.parse(execFileSync(process.execPath, ['-e', `${prelude}; require(${JSON.stringify(root)});
+    console.log(JSON.stringify(['exit', 'SIGINT', 'SIGTERM', 'SIGHUP'].map((e) => process.listenerCount(e))));`],
+  { encoding: 'utf8' }));
+  assert.deepStrictEqual(listeners(''), [1, 1, 1, 1]);
+  assert.deepStrictEqual(listeners("Object.defineProperty(process.versions, 'electron', { value: '30.0.0' })"), [1, 0, 0, 0]);
 });
 
 test('FFmpeg\'s log never reaches standard error; its errors are warning lines', async (t) => {
