@@ -252,22 +252,23 @@ void finishEveryClip() {
   }
 }
 
-v8::Local<v8::Object> processObject() {
-  v8::Local<v8::Value> process;
-  if (!Nan::Get(Nan::GetCurrentContext()->Global(), Nan::New("process").ToLocalChecked()).ToLocal(&process) ||
-      !process->IsObject())
-    return {};
-  return process.As<v8::Object>();
+// object[key], or undefined when `object` is not an object or has no such property.
+v8::Local<v8::Value> property(v8::Local<v8::Value> object, const char* key) {
+  v8::Local<v8::Value> value;
+  if (object.IsEmpty() || !object->IsObject() ||
+      !Nan::Get(object.As<v8::Object>(), Nan::New(key).ToLocalChecked()).ToLocal(&value))
+    return Nan::Undefined();
+  return value;
 }
+
+v8::Local<v8::Value> processObject() { return property(Nan::GetCurrentContext()->Global(), "process"); }
 
 // process[name](...argv); an empty handle when there is no such method or it threw.
 v8::Local<v8::Value> callProcess(const char* name, int argc, v8::Local<v8::Value> argv[]) {
-  v8::Local<v8::Object> process = processObject();
-  v8::Local<v8::Value> method;
-  if (process.IsEmpty() || !Nan::Get(process, Nan::New(name).ToLocalChecked()).ToLocal(&method) ||
-      !method->IsFunction())
-    return {};
-  return Nan::Call(method.As<v8::Function>(), process, argc, argv).FromMaybe(v8::Local<v8::Value>());
+  v8::Local<v8::Value> process = processObject();
+  v8::Local<v8::Value> method = property(process, name);
+  if (!method->IsFunction()) return {};
+  return Nan::Call(method.As<v8::Function>(), process.As<v8::Object>(), argc, argv).FromMaybe(v8::Local<v8::Value>());
 }
 
 NAN_METHOD(finishClipsAtExit) { finishEveryClip(); }
@@ -282,9 +283,7 @@ NAN_METHOD(finishClipsOnSignal) {
   if (listeners.IsEmpty() || !listeners->IsNumber() || Nan::To<double>(listeners).FromJust() > 1) return;
   finishEveryClip();
   callProcess("removeAllListeners", 1, &signal);
-  v8::Local<v8::Value> pid;
-  if (!Nan::Get(processObject(), Nan::New("pid").ToLocalChecked()).ToLocal(&pid)) return;
-  v8::Local<v8::Value> argv[] = {pid, signal};
+  v8::Local<v8::Value> argv[] = {property(processObject(), "pid"), signal};
   callProcess("kill", 2, argv);
 }
 
@@ -296,15 +295,7 @@ void listen(const char* how, const char* event, Nan::FunctionCallback handler) {
 
 // Electron quits an app on these signals through handlers of its own, which a listener here would
 // replace; its quit ends in the exit event, which finishes the clips.
-bool inElectron() {
-  v8::Local<v8::Object> process = processObject();
-  v8::Local<v8::Value> versions;
-  v8::Local<v8::Value> electron;
-  return !process.IsEmpty() && Nan::Get(process, Nan::New("versions").ToLocalChecked()).ToLocal(&versions) &&
-         versions->IsObject() &&
-         Nan::Get(versions.As<v8::Object>(), Nan::New("electron").ToLocalChecked()).ToLocal(&electron) &&
-         !electron->IsUndefined();
-}
+bool inElectron() { return !property(property(processObject(), "versions"), "electron")->IsUndefined(); }
 
 void initModule(v8::Local<v8::Object> exports, v8::Local<v8::Value>, void*) {
   listen("on", "exit", finishClipsAtExit);
