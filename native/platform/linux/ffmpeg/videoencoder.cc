@@ -74,25 +74,30 @@ class VideoEncoder : public StreamEncoder {
     if (!opened && !openX264(width, height, bitRate, profile)) return MF_E_INVALIDMEDIATYPE;
 
     const AVPixelFormat target = hardwareFrames_ ? AV_PIX_FMT_NV12 : context_->pix_fmt;
+    const bool sameSize = inWidth_ == static_cast<int>(width) && inHeight_ == static_cast<int>(height);
     // Four-byte RGB at the output's size is the display path: our own one-pass converter
     // costs a fraction of swscale's, which matters at 60 frames a second.
-    directI420_ = picture_.bytesPerPixel == 4 && target == AV_PIX_FMT_YUV420P && inWidth_ == static_cast<int>(width) &&
-                  inHeight_ == static_cast<int>(height);
-    if (!directI420_)
+    directI420_ = picture_.bytesPerPixel == 4 && target == AV_PIX_FMT_YUV420P && sameSize;
+    // I420 at the output's size is the camera path: libx264 copies each picture into its own
+    // frames while it is handed over, so it can read the caller's planes where they lie.
+    borrowI420_ = picture_.format == AV_PIX_FMT_YUV420P && target == AV_PIX_FMT_YUV420P && sameSize &&
+                  std::string(context_->codec->name) == "libx264";
+    if (!directI420_ && !borrowI420_)
       scaler_.reset(sws_getContext(inWidth_, inHeight_, picture_.format, static_cast<int>(width),
                                    static_cast<int>(height), target, SWS_BILINEAR, nullptr, nullptr, nullptr));
-    if (!directI420_) {
-      if (!scaler_) return MF_E_INVALIDMEDIATYPE;
+    if (scaler_) {
       // BT.709, limited range, as the stream declares.
       int* table = const_cast<int*>(sws_getCoefficients(SWS_CS_ITU709));
       sws_setColorspaceDetails(scaler_.get(), table, 1, table, 0, 0, 1 << 16, 1 << 16);
     }
 
-    frame_.reset(av_frame_alloc());
-    frame_->format = target;
-    frame_->width = static_cast<int>(width);
-    frame_->height = static_cast<int>(height);
-    if (av_frame_get_buffer(frame_.get(), 0) < 0) return E_OUTOFMEMORY;
+    if (!borrowI420_) {
+      frame_.reset(av_frame_alloc());
+      frame_->format = target;
+      frame_->width = static_cast<int>(width);
+      frame_->height = static_cast<int>(height);
+      if (av_frame_get_buffer(frame_.get(), 0) < 0) return E_OUTOFMEMORY;
+    }
 
     return describe();
   }
@@ -102,28 +107,33 @@ class VideoEncoder : public StreamEncoder {
     clock_.stamp(time, hasTime, duration, hasDuration);
     if (static_cast<int64_t>(length) < requiredLength()) return MF_E_BUFFERTOOSMALL;
 
-    int result = av_frame_make_writable(frame_.get());
-    if (result < 0) return fromAv(result);
     const uint8_t* planes[4] = {};
     int strides[4] = {};
     sourcePlanes(data, planes, strides);
-    if (directI420_)
-      colour::bgrxToI420(planes[0], strides[0], inWidth_, inHeight_, frame_->data[0], frame_->linesize[0],
-                         frame_->data[1], frame_->linesize[1], frame_->data[2], frame_->linesize[2]);
-    else
-      sws_scale(scaler_.get(), planes, strides, 0, inHeight_, frame_->data, frame_->linesize);
+    int result = 0;
+    FramePtr borrowed;
+    if (borrowI420_) {
+      if ((result = borrow(data, length, planes, strides, &borrowed)) < 0) return fromAv(result);
+    } else {
+      if ((result = av_frame_make_writable(frame_.get())) < 0) return fromAv(result);
+      if (directI420_)
+        colour::bgrxToI420(planes[0], strides[0], inWidth_, inHeight_, frame_->data[0], frame_->linesize[0],
+                           frame_->data[1], frame_->linesize[1], frame_->data[2], frame_->linesize[2]);
+      else
+        sws_scale(scaler_.get(), planes, strides, 0, inHeight_, frame_->data, frame_->linesize);
+    }
+    AVFrame* send = borrowed ? borrowed.get() : frame_.get();
 
     // The encoder counts frames at the declared rate; the packets get the samples' own times back.
-    frame_->pts = frameIndex_++;
-    pending_.push_back({frame_->pts, time, duration});
-    AVFrame* send = frame_.get();
+    send->pts = frameIndex_++;
+    pending_.push_back({send->pts, time, duration});
     FramePtr uploaded;
     if (hardwareFrames_) {
       uploaded.reset(av_frame_alloc());
       if ((result = av_hwframe_get_buffer(hardwareFrames_.get(), uploaded.get(), 0)) < 0 ||
           (result = av_hwframe_transfer_data(uploaded.get(), frame_.get(), 0)) < 0)
         return fromAv(result);
-      uploaded->pts = frame_->pts;
+      uploaded->pts = send->pts;
       send = uploaded.get();
     }
     result = avcodec_send_frame(context_.get(), send);
@@ -172,6 +182,26 @@ class VideoEncoder : public StreamEncoder {
       planes[0] = data;
       strides[0] = stride_;
     }
+  }
+
+  // A frame over the caller's planes. Its buffer frees nothing: the caller's memory is only read
+  // while the frame is handed over, and libx264 keeps no reference past that.
+  int borrow(const uint8_t* data, DWORD length, const uint8_t* const* planes, const int* strides,
+             FramePtr* borrowed) const {
+    FramePtr frame(av_frame_alloc());
+    if (!frame) return AVERROR(ENOMEM);
+    frame->format = AV_PIX_FMT_YUV420P;
+    frame->width = inWidth_;
+    frame->height = inHeight_;
+    for (int plane = 0; plane < 3; ++plane) {
+      frame->data[plane] = const_cast<uint8_t*>(planes[plane]);
+      frame->linesize[plane] = strides[plane];
+    }
+    frame->buf[0] = av_buffer_create(
+        const_cast<uint8_t*>(data), length, [](void*, uint8_t*) {}, nullptr, AV_BUFFER_FLAG_READONLY);
+    if (!frame->buf[0]) return AVERROR(ENOMEM);
+    *borrowed = std::move(frame);
+    return 0;
   }
 
   HRESULT drainStamped() {
@@ -284,6 +314,7 @@ class VideoEncoder : public StreamEncoder {
   std::deque<Pending> pending_;
   std::unique_ptr<SwsContext, SwsDeleter> scaler_;
   bool directI420_ = false;
+  bool borrowI420_ = false;
   FramePtr frame_;
   BufferRefPtr hardwareFrames_;
 };
