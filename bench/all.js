@@ -9,9 +9,10 @@
 //   the microphone (the same PulseAudio source, AAC at the bit rate our clip has).
 // The add-on's process previews as a host's window would meanwhile: both pictures 15 times a
 // second at 640x360, both peak meters 10 times a second. Its CPU is the whole process over the
-// recording (utime + stime of /proc/self/stat); ffmpeg's is the four processes' together (the
-// shell's `times`). Frames and durations come from ffprobe; resident memory is read at 10 s and at
-// the end.
+// recording (utime + stime of /proc/self/stat); ffmpeg's is the four processes' together (each
+// one's `times`). Per source, the add-on's threads (by name) are set against the ffmpeg process of
+// that source. Frames and durations come from ffprobe; resident memory is read at 10 s and at the
+// end.
 //   node bench/all.js [seconds=60]
 const { spawn, spawnSync, execFileSync } = require('child_process');
 const fs = require('fs');
@@ -120,13 +121,18 @@ async function main() {
       ['-f', 'pulse', '-i', 'tavio_mic', '-t', String(seconds), '-c:a', 'aac', '-b:a', `${micRate}k`, theirs.microphone],
     ];
     const quote = (a) => `'${a.replace(/'/g, "'\\''")}'`;
-    const script = commands.map((c) => `ffmpeg -nostdin -v error -y ${c.map(quote).join(' ')} &`).join('\n') +
-      '\nwait\ntimes';
+    // Each process in a subshell whose `times` gives that process's user and system time.
+    const script = commands.map((c, i) => `(ffmpeg -nostdin -v error -y ${c.map(quote).join(' ')}; times > ` +
+      `${quote(path.join(dir, `times-${i}`))}) &`).join('\n') + '\nwait';
     const ffmpeg = spawnSync('bash', ['-c', script], { env, encoding: 'utf8' });
     if (ffmpeg.status !== 0) throw new Error(`ffmpeg failed: ${ffmpeg.stderr}`);
-    // `times` prints the shell's and then its children's user and system times.
-    const m = ffmpeg.stdout.trim().split('\n').pop().match(/(\d+)m([\d.]+)s (\d+)m([\d.]+)s/);
-    const theirCpu = Number(m[1]) * 60 + Number(m[2]) + Number(m[3]) * 60 + Number(m[4]);
+    // The second line of `times`: the children's user and system times.
+    const theirBySource = Object.fromEntries(Object.keys(ours).map((kind, i) => {
+      const m = fs.readFileSync(path.join(dir, `times-${i}`), 'utf8').trim().split('\n').pop()
+        .match(/(\d+)m([\d.]+)s (\d+)m([\d.]+)s/);
+      return [kind, Number(m[1]) * 60 + Number(m[2]) + Number(m[3]) * 60 + Number(m[4])];
+    }));
+    const theirCpu = Object.values(theirBySource).reduce((a, b) => a + b, 0);
     const theirFiles = Object.fromEntries(Object.entries(theirs).map(([k, f]) => [k, probe(f)]));
 
     console.log(`${seconds} s of every source at once (the add-on's recording took ${wall.toFixed(1)} s of wall time)`);
@@ -147,6 +153,17 @@ async function main() {
       `ffmpeg's four ${theirCpu.toFixed(1)} s (${(100 * theirCpu / seconds).toFixed(0)} %)`);
     console.log(`CPU, ours / ffmpeg: ${((cpu / wall) / (theirCpu / seconds)).toFixed(2)} (target <= 0.8)`);
     console.log(`  ours by thread name: ${threads.map(([n, c]) => `${n} ${c.toFixed(1)} s`).join(', ')}`);
+    // Threads by source: encoders' threads carry the name of the thread that opened them. The
+    // camera's engine and reader also serve its microphone; the previews run on Node's thread.
+    const named = Object.fromEntries(threads);
+    const sum = (...names) => names.reduce((a, n) => a + (named[n] || 0), 0);
+    const split = [
+      ['display', sum('tavio-record', 'tavio-screen'), theirBySource.display],
+      ['camera + microphone', sum('tavio-engine', 'tavio-reader'), theirBySource.camera + theirBySource.microphone],
+      ['speakers', sum('tavio-capture', 'tavio-silence', 'tavio-pulse'), theirBySource.speakers],
+    ];
+    for (const [kind, mine, theirs] of split)
+      console.log(`  ${kind}: ours ${mine.toFixed(1)} s, ffmpeg ${theirs.toFixed(1)} s (${(mine / theirs).toFixed(2)})`);
     console.log(`resident memory: ${at10.toFixed(1)} MB at 10 s, ${atEnd.toFixed(1)} MB at ${seconds} s`);
   } finally {
     animation.kill('SIGTERM');
