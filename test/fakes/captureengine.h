@@ -13,15 +13,13 @@ namespace fakes {
 
 class FakeCaptureSource : public ComObject<IMFCaptureSource, IID_IMFCaptureSource> {
  public:
-  IMFMediaType* videoType = nullptr;  // borrowed; null: no such stream
-  IMFMediaType* audioType = nullptr;
+  IMFMediaType* videoType = nullptr;  // borrowed; null: no such stream (and there is never an audio stream)
 
   HRESULT GetService(REFIID, REFIID, IUnknown**) override { return E_NOTIMPL; }
   HRESULT GetCurrentDeviceMediaType(DWORD stream, IMFMediaType** type) override {
-    IMFMediaType* chosen = stream == MF_CAPTURE_ENGINE_PREFERRED_SOURCE_STREAM_FOR_AUDIO ? audioType : videoType;
-    if (!chosen) return MF_E_INVALIDSTREAMNUMBER;
-    chosen->AddRef();
-    *type = chosen;
+    if (stream == MF_CAPTURE_ENGINE_PREFERRED_SOURCE_STREAM_FOR_AUDIO || !videoType) return MF_E_INVALIDSTREAMNUMBER;
+    videoType->AddRef();
+    *type = videoType;
     return S_OK;
   }
 };

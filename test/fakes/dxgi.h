@@ -72,7 +72,6 @@ class Duplication : public Counted<IDXGIOutputDuplication> {
   explicit Duplication(Texture* desktop) : resource(desktop) {}
   void GetDesc(DXGI_OUTDUPL_DESC* desc) override { *desc = {}; }
   HRESULT AcquireNextFrame(UINT timeout, DXGI_OUTDUPL_FRAME_INFO* info, IDXGIResource** out) override {
-    ++acquisitions;
     lastTimeout = timeout;
     *out = nullptr;
     if (held) return DXGI_ERROR_INVALID_CALL;
@@ -95,7 +94,6 @@ class Duplication : public Counted<IDXGIOutputDuplication> {
   }
   HRESULT GetFramePointerShape(UINT size, void* buffer, UINT* required,
                                DXGI_OUTDUPL_POINTER_SHAPE_INFO* info) override {
-    ++shapeFetches;
     *required = static_cast<UINT>(shape.size());
     if (size < shape.size()) return DXGI_ERROR_MORE_DATA;
     std::memcpy(buffer, shape.data(), shape.size());
@@ -116,7 +114,7 @@ class Duplication : public Counted<IDXGIOutputDuplication> {
   HRESULT releaseResult = S_OK;
   Resource resource;
   bool held = false;
-  int acquisitions = 0, releases = 0, shapeFetches = 0;
+  int releases = 0;
   UINT lastTimeout = 0;
 };
 
@@ -129,7 +127,6 @@ class Context : public Counted<ID3D11DeviceContext> {
     if (to->pixels.size() == from->pixels.size()) to->pixels = from->pixels;
   }
   HRESULT Map(ID3D11Resource* resource, UINT, D3D11_MAP type, UINT, D3D11_MAPPED_SUBRESOURCE* mapped) override {
-    ++maps;
     if (FAILED(mapResult)) return mapResult;
     auto* texture = static_cast<Texture*>(static_cast<ID3D11Texture2D*>(resource));
     mapped->pData = texture->pixels.data();
@@ -139,7 +136,7 @@ class Context : public Counted<ID3D11DeviceContext> {
   }
   bool answers(REFIID riid) override { return riid == IID_ID3D11DeviceContext; }
   HRESULT mapResult = S_OK;
-  int copies = 0, maps = 0;
+  int copies = 0;
 };
 
 class Device : public Counted<ID3D11Device> {
@@ -147,7 +144,6 @@ class Device : public Counted<ID3D11Device> {
   HRESULT CreateTexture2D(const D3D11_TEXTURE2D_DESC* desc, const D3D11_SUBRESOURCE_DATA*,
                           ID3D11Texture2D** texture) override {
     lastDesc = *desc;
-    if (FAILED(textureResult)) return textureResult;
     textures.push_back(std::make_unique<Texture>(desc->Width, desc->Height));
     *texture = textures.back().get();
     return S_OK;
@@ -162,7 +158,6 @@ class Device : public Counted<ID3D11Device> {
   Context context;
   std::vector<std::unique_ptr<Texture>> textures;
   D3D11_TEXTURE2D_DESC lastDesc{};
-  HRESULT textureResult = S_OK;
 };
 
 // Hands out the duplications a test prepared, failing with the scripted codes first.

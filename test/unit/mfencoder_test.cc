@@ -1,6 +1,7 @@
 // The audio encoder against real files.
 #include "capture/audio/mfencoder.h"
 
+#include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
 #include <cmath>
@@ -13,6 +14,18 @@
 namespace {
 
 using capture::audio::MFEncoder;
+using ::testing::HasSubstr;
+
+// The text of the failure `call` throws, or "no failure".
+template <class Call>
+std::string failureOf(Call call) {
+  try {
+    call();
+  } catch (const std::runtime_error& error) {
+    return error.what();
+  }
+  return "no failure";
+}
 
 WAVEFORMATEXTENSIBLE captureFormat(WORD channels, DWORD rate, WORD bits, const GUID& subFormat, DWORD mask) {
   WAVEFORMATEXTENSIBLE format{};
@@ -113,12 +126,8 @@ TEST(MFEncoder, UnknownSubFormatFailsAfterTheOutputStream) {
   const std::string path = folder.file("unknown.mp4");
   const auto format = captureFormat(2, 48000, 32, MFAudioFormat_AAC, 3);
   testing::internal::CaptureStdout();
-  try {
-    MFEncoder encoder(path, &format);
-    FAIL() << "no failure";
-  } catch (const std::runtime_error& error) {
-    EXPECT_STREQ(error.what(), "native/capture/audio/mfencoder(144): Unable to set format tag.");
-  }
+  EXPECT_EQ(failureOf([&] { MFEncoder encoder(path, &format); }),
+            "native/capture/audio/mfencoder(144): Unable to set format tag.");
   EXPECT_EQ(testing::internal::GetCapturedStdout(), "File: " + path + "\n");
   EXPECT_TRUE(std::filesystem::exists(path));  // the sink was made before the failure
   MFShutdown();                                // the failed constructor left Media Foundation started, as it should
@@ -128,15 +137,8 @@ TEST(MFEncoder, MissingFolderFailsToCreateTheSink) {
   media::TempFolder folder;
   const auto format = captureFormat(2, 48000, 32, KSDATAFORMAT_SUBTYPE_IEEE_FLOAT, 3);
   testing::internal::CaptureStdout();
-  try {
-    MFEncoder encoder(folder.file("missing/a.mp4"), &format);
-    FAIL() << "no failure";
-  } catch (const std::runtime_error& error) {
-    EXPECT_NE(
-        std::string(error.what()).find("\tnative/capture/audio/mfencoder(35): 0x80070003: Could not create sink."),
-        std::string::npos)
-        << error.what();
-  }
+  EXPECT_THAT(failureOf([&] { MFEncoder encoder(folder.file("missing/a.mp4"), &format); }),
+              HasSubstr("\tnative/capture/audio/mfencoder(35): 0x80070003: Could not create sink."));
   testing::internal::GetCapturedStdout();
   MFShutdown();
 }
@@ -150,21 +152,10 @@ TEST(MFEncoder, WriteAfterFinalizeFailsInThePlatform) {
   recordTone(encoder, format, 5, 480);
   encoder.finalize();
   const auto data = tone(format, 0, 480);
-  try {
-    encoder.write(data.data(), 480, &format.Format, 500000);
-    FAIL() << "no failure";
-  } catch (const std::runtime_error& error) {
-    EXPECT_NE(std::string(error.what()).find("mfencoder(106): 0xc00d36b2: Could not write sample."), std::string::npos)
-        << error.what();
-  }
-  try {
-    encoder.finalize();
-    FAIL() << "no failure";
-  } catch (const std::runtime_error& error) {
-    EXPECT_NE(std::string(error.what()).find("mfencoder(113): 0xc00d36b2: Unable to finalize audio encoder."),
-              std::string::npos)
-        << error.what();
-  }
+  EXPECT_THAT(failureOf([&] { encoder.write(data.data(), 480, &format.Format, 500000); }),
+              HasSubstr("mfencoder(106): 0xc00d36b2: Could not write sample."));
+  EXPECT_THAT(failureOf([&] { encoder.finalize(); }),
+              HasSubstr("mfencoder(113): 0xc00d36b2: Unable to finalize audio encoder."));
 }
 
 TEST(MFEncoder, EachEncoderStartsAndShutsDownMediaFoundationOnce) {

@@ -4,6 +4,7 @@
 #include <algorithm>
 #include <cstring>
 #include <fstream>
+#include <functional>
 #include <random>
 #include <ostream>
 #include <string>
@@ -19,8 +20,6 @@ struct MediaFoundation {
   ~MediaFoundation() { EXPECT_EQ(MFShutdown(), S_OK); }
 };
 
-std::wstring wide(const std::string& path) { return platform::widen(path); }
-
 ComPtr<IMFSinkWriter> createWriter(const std::string& path, HRESULT* result = nullptr, bool mp4 = true) {
   ComPtr<IMFAttributes> attributes;
   MFCreateAttributes(&attributes, 0);
@@ -28,7 +27,7 @@ ComPtr<IMFSinkWriter> createWriter(const std::string& path, HRESULT* result = nu
   attributes->SetUINT32(MF_SINK_WRITER_DISABLE_THROTTLING, TRUE);
   if (mp4) attributes->SetGUID(MF_TRANSCODE_CONTAINERTYPE, MFTranscodeContainerType_MPEG4);
   ComPtr<IMFSinkWriter> writer;
-  HRESULT hr = MFCreateSinkWriterFromURL(wide(path).c_str(), nullptr, attributes.Get(), &writer);
+  HRESULT hr = MFCreateSinkWriterFromURL(platform::widen(path).c_str(), nullptr, attributes.Get(), &writer);
   if (result) *result = hr;
   return writer;
 }
@@ -58,23 +57,18 @@ ComPtr<IMFMediaType> rgb32Type(UINT32 width, UINT32 height) {
 }
 
 // A video writer of one H.264 stream fed with RGB32; input is adjusted by `adjust` if given.
-template <class Adjust>
-ComPtr<IMFSinkWriter> videoWriterWith(const std::string& path, UINT32 width, UINT32 height, DWORD* stream,
-                                      Adjust adjust, UINT32 profile = eAVEncH264VProfile_Main) {
+ComPtr<IMFSinkWriter> videoWriter(const std::string& path, UINT32 width, UINT32 height, DWORD* stream,
+                                  UINT32 profile = eAVEncH264VProfile_Main,
+                                  const std::function<void(IMFMediaType*)>& adjust = nullptr) {
   ComPtr<IMFSinkWriter> writer = createWriter(path);
   if (!writer) return nullptr;
   ComPtr<IMFMediaType> out = h264Type(width, height, profile);
   EXPECT_EQ(writer->AddStream(out.Get(), stream), S_OK);
   ComPtr<IMFMediaType> in = rgb32Type(width, height);
-  adjust(in.Get());
+  if (adjust) adjust(in.Get());
   EXPECT_EQ(writer->SetInputMediaType(*stream, in.Get(), nullptr), S_OK);
   EXPECT_EQ(writer->BeginWriting(), S_OK);
   return writer;
-}
-ComPtr<IMFSinkWriter> videoWriter(const std::string& path, UINT32 width, UINT32 height, DWORD* stream,
-                                  UINT32 profile = eAVEncH264VProfile_Main) {
-  return videoWriterWith(
-      path, width, height, stream, [](IMFMediaType*) {}, profile);
 }
 
 ComPtr<IMFSample> sampleOf(const void* bytes, DWORD length, LONGLONG time, LONGLONG duration, bool timed = true) {
@@ -124,10 +118,22 @@ char colourAt(const media::Decoded& decoded, int x, int y) {
   return '?';
 }
 
-TEST(MediaFoundationStartup, CountsStartupsAndRefusesUnpairedShutdown) {
+// Every test of the writer runs with Media Foundation started and a folder of its own.
+class SinkWriter : public testing::Test {
+ protected:
+  MediaFoundation started;
+  media::TempFolder folder;
+};
+
+TEST(MediaFoundationStartup, CountsStartupsAndRefusesUnpairedShutdownAndWriters) {
   while (SUCCEEDED(MFShutdown())) {
   }
   EXPECT_EQ(MFShutdown(), MF_E_PLATFORM_NOT_INITIALIZED);
+  // A sink writer needs a started platform.
+  media::TempFolder folder;
+  HRESULT hr = S_OK;
+  EXPECT_FALSE(createWriter(folder.file("a.mp4"), &hr));
+  EXPECT_EQ(hr, MF_E_PLATFORM_NOT_INITIALIZED);
   EXPECT_EQ(MFStartup(0x10000, MFSTARTUP_FULL), MF_E_BAD_STARTUP_VERSION);
   EXPECT_EQ(MFStartup(MF_VERSION, MFSTARTUP_FULL), S_OK);
   EXPECT_EQ(MFStartup(MF_VERSION, MFSTARTUP_LITE), S_OK);
@@ -137,19 +143,7 @@ TEST(MediaFoundationStartup, CountsStartupsAndRefusesUnpairedShutdown) {
   EXPECT_EQ(MF_VERSION, 0x20070u);
 }
 
-TEST(SinkWriter, NeedsAStartedPlatform) {
-  while (SUCCEEDED(MFShutdown())) {
-  }
-  media::TempFolder folder;
-  HRESULT hr = S_OK;
-  ComPtr<IMFSinkWriter> writer = createWriter(folder.file("a.mp4"), &hr);
-  EXPECT_EQ(hr, MF_E_PLATFORM_NOT_INITIALIZED);
-  EXPECT_FALSE(writer);
-}
-
-TEST(SinkWriter, UnopenablePathsFailWithTheWindowsCodes) {
-  MediaFoundation started;
-  media::TempFolder folder;
+TEST_F(SinkWriter, UnopenablePathsFailWithTheWindowsCodes) {
   HRESULT hr = S_OK;
   EXPECT_FALSE(createWriter(folder.file("missing/a.mp4"), &hr));
   EXPECT_EQ(hr, HRESULT_FROM_WIN32(ERROR_PATH_NOT_FOUND));
@@ -163,9 +157,7 @@ TEST(SinkWriter, UnopenablePathsFailWithTheWindowsCodes) {
   EXPECT_EQ(hr, MF_E_UNSUPPORTED_BYTESTREAM_TYPE);
 }
 
-TEST(SinkWriter, AFileAnotherWriterHoldsIsRefusedUntilItIsFinished) {
-  MediaFoundation started;
-  media::TempFolder folder;
+TEST_F(SinkWriter, AFileAnotherWriterHoldsIsRefusedUntilItIsFinished) {
   const std::string path = folder.file("busy.mp4");
   DWORD stream = 0;
   ComPtr<IMFSinkWriter> first = videoWriter(path, 64, 64, &stream);
@@ -182,9 +174,7 @@ TEST(SinkWriter, AFileAnotherWriterHoldsIsRefusedUntilItIsFinished) {
   EXPECT_EQ(hr, S_OK);
 }
 
-TEST(SinkWriter, CreatesTheFileAtOnceAndTakesTheContainerFromTheAttribute) {
-  MediaFoundation started;
-  media::TempFolder folder;
+TEST_F(SinkWriter, CreatesTheFileAtOnceAndTakesTheContainerFromTheAttribute) {
   // The extension says nothing; the attribute chooses MP4.
   const std::string path = folder.file("clip.unknown");
   DWORD stream = 0;
@@ -205,11 +195,9 @@ TEST(SinkWriter, CreatesTheFileAtOnceAndTakesTheContainerFromTheAttribute) {
   avformat_close_input(&format);
 }
 
-TEST(SinkWriter, FileNamesOutsideTheBasicPlaneArriveAsUtf8) {
-  MediaFoundation started;
-  media::TempFolder folder;
+TEST_F(SinkWriter, FileNamesOutsideTheBasicPlaneArriveAsUtf8) {
   const std::string path = folder.file("clip-\xF0\x9F\x8E\xA5-\xC3\xA9.mp4");  // camera emoji, e acute
-  const std::wstring units = wide(path);
+  const std::wstring units = platform::widen(path);
   EXPECT_EQ(units.size(), folder.path().size() + 1 + 13);  // the emoji is a surrogate pair
   ComPtr<IMFAttributes> attributes;
   MFCreateAttributes(&attributes, 0);
@@ -219,9 +207,7 @@ TEST(SinkWriter, FileNamesOutsideTheBasicPlaneArriveAsUtf8) {
   EXPECT_TRUE(std::filesystem::exists(std::filesystem::u8path(path)));
 }
 
-TEST(SinkWriter, H264IsReallyMainWithTheTypesSizeRateAndBitRate) {
-  MediaFoundation started;
-  media::TempFolder folder;
+TEST_F(SinkWriter, H264IsReallyMainWithTheTypesSizeRateAndBitRate) {
   const std::string path = folder.file("noise.mp4");
   const UINT32 width = 640, height = 360;
   DWORD stream = 99;
@@ -285,21 +271,16 @@ struct PictureCase {
 };
 void PrintTo(const PictureCase& c, std::ostream* out) { *out << c.name; }
 
-class PictureLayout : public testing::TestWithParam<PictureCase> {};
+class PictureLayout : public SinkWriter, public testing::WithParamInterface<PictureCase> {};
 
 TEST_P(PictureLayout, DecodesUprightWithTheProfileAskedFor) {
   const PictureCase c = GetParam();
-  MediaFoundation started;
-  media::TempFolder folder;
   const std::string path = folder.file("layout.mp4");
   DWORD stream = 0;
-  ComPtr<IMFSinkWriter> writer = videoWriterWith(
-      path, 160, 120, &stream,
-      [&](IMFMediaType* in) {
-        in->SetGUID(MF_MT_SUBTYPE, c.subtype);
-        if (c.stride) in->SetUINT32(MF_MT_DEFAULT_STRIDE, c.stride);
-      },
-      c.profile);
+  ComPtr<IMFSinkWriter> writer = videoWriter(path, 160, 120, &stream, c.profile, [&](IMFMediaType* in) {
+    in->SetGUID(MF_MT_SUBTYPE, c.subtype);
+    if (c.stride) in->SetUINT32(MF_MT_DEFAULT_STRIDE, c.stride);
+  });
   ASSERT_TRUE(writer);
   // RGB32 without a stride is bottom-up.
   const auto pixels = c.subtype == MFVideoFormat_I420 ? i420Bands(160, 120) : bands(160, 120, c.stride == 0);
@@ -325,9 +306,7 @@ INSTANTIATE_TEST_SUITE_P(Inputs, PictureLayout,
                                                      FF_PROFILE_H264_BASELINE}),
                          [](const testing::TestParamInfo<PictureCase>& info) { return std::string(info.param.name); });
 
-TEST(SinkWriter, SampleTimesAndDurationsBecomePacketTimes) {
-  MediaFoundation started;
-  media::TempFolder folder;
+TEST_F(SinkWriter, SampleTimesAndDurationsBecomePacketTimes) {
   const std::string path = folder.file("times.mp4");
   DWORD stream = 0;
   ComPtr<IMFSinkWriter> writer = videoWriter(path, 64, 64, &stream);
@@ -353,9 +332,7 @@ TEST(SinkWriter, SampleTimesAndDurationsBecomePacketTimes) {
   EXPECT_NEAR(file.duration, 0.15 + 1 / 30.0, 1e-3);
 }
 
-TEST(SinkWriter, RefusesCallsOutOfOrder) {
-  MediaFoundation started;
-  media::TempFolder folder;
+TEST_F(SinkWriter, RefusesCallsOutOfOrder) {
   ComPtr<IMFSinkWriter> writer = createWriter(folder.file("order.mp4"));
   ASSERT_TRUE(writer);
   std::vector<uint8_t> pixels(64 * 64 * 4);
@@ -379,9 +356,7 @@ TEST(SinkWriter, RefusesCallsOutOfOrder) {
   EXPECT_EQ(writeBytes(writer, stream, pixels, 0, 1), MF_E_INVALIDREQUEST);
 }
 
-TEST(SinkWriter, RefusesTypesItCannotWrite) {
-  MediaFoundation started;
-  media::TempFolder folder;
+TEST_F(SinkWriter, RefusesTypesItCannotWrite) {
   ComPtr<IMFSinkWriter> writer = createWriter(folder.file("types.mp4"));
   ASSERT_TRUE(writer);
   DWORD stream = 0;
@@ -400,9 +375,7 @@ TEST(SinkWriter, RefusesTypesItCannotWrite) {
   EXPECT_EQ(writer->SetInputMediaType(stream, in.Get(), nullptr), MF_E_INVALIDMEDIATYPE);
 }
 
-TEST(SinkWriter, FinalizeWithoutSamplesFails) {
-  MediaFoundation started;
-  media::TempFolder folder;
+TEST_F(SinkWriter, FinalizeWithoutSamplesFails) {
   DWORD stream = 0;
   ComPtr<IMFSinkWriter> writer = videoWriter(folder.file("empty.mp4"), 64, 64, &stream);
   ASSERT_TRUE(writer);
@@ -460,32 +433,22 @@ void expectCameraStreamIn(const std::string& path, const media::CameraStream& ca
   EXPECT_EQ(colourAt(decoded, 80, 100), 'b');
 }
 
-TEST(SinkWriter, H264InputIsCopiedWithTheSequenceHeaderOfItsType) {
-  MediaFoundation started;
-  media::TempFolder folder;
-  const media::CameraStream camera = media::cameraStream(160, 120, 45, 15, true);
-  ASSERT_EQ(camera.packets.size(), 45u);
-  ASSERT_FALSE(camera.header.empty());
-  ASSERT_EQ(std::count(camera.keys.begin(), camera.keys.end(), true), 3);
-  const std::string path = folder.file("copy.mp4");
-  ASSERT_EQ(copyStream(path, camera, 160, 120, true), S_OK);
-  expectCameraStreamIn(path, camera);
+// With a sequence header on the input type, or without one: then the first key frame's parameter
+// sets serve.
+TEST_F(SinkWriter, H264InputIsCopiedWithOrWithoutTheSequenceHeaderOfItsType) {
+  for (bool withHeader : {true, false}) {
+    SCOPED_TRACE(withHeader ? "sequence header" : "parameter sets in the packets");
+    const media::CameraStream camera = media::cameraStream(160, 120, 45, 15, withHeader);
+    ASSERT_EQ(camera.packets.size(), 45u);
+    ASSERT_EQ(camera.header.empty(), !withHeader);
+    ASSERT_EQ(std::count(camera.keys.begin(), camera.keys.end(), true), 3);
+    const std::string path = folder.file(withHeader ? "copy.mp4" : "inband.mp4");
+    ASSERT_EQ(copyStream(path, camera, 160, 120, withHeader), S_OK);
+    expectCameraStreamIn(path, camera);
+  }
 }
 
-TEST(SinkWriter, H264InputWithoutSequenceHeaderUsesTheFirstKeyFramesParameterSets) {
-  MediaFoundation started;
-  media::TempFolder folder;
-  const media::CameraStream camera = media::cameraStream(160, 120, 45, 15, false);
-  ASSERT_EQ(camera.packets.size(), 45u);
-  ASSERT_TRUE(camera.header.empty());
-  const std::string path = folder.file("inband.mp4");
-  ASSERT_EQ(copyStream(path, camera, 160, 120, false), S_OK);
-  expectCameraStreamIn(path, camera);
-}
-
-TEST(SinkWriter, H264InputMustHaveTheOutputsSize) {
-  MediaFoundation started;
-  media::TempFolder folder;
+TEST_F(SinkWriter, H264InputMustHaveTheOutputsSize) {
   ComPtr<IMFSinkWriter> writer = createWriter(folder.file("sizes.mp4"));
   ASSERT_TRUE(writer);
   DWORD stream = 0;
@@ -564,12 +527,10 @@ struct AudioCase {
 };
 void PrintTo(const AudioCase& c, std::ostream* out) { *out << c.name; }
 
-class AacFile : public testing::TestWithParam<AudioCase> {};
+class AacFile : public SinkWriter, public testing::WithParamInterface<AudioCase> {};
 
 TEST_P(AacFile, KeepsRateChannelsDurationAndTheTone) {
   const AudioCase c = GetParam();
-  MediaFoundation started;
-  media::TempFolder folder;
   const std::string path = folder.file("tone.mp4");
   DWORD stream = 0;
   ComPtr<IMFSinkWriter> writer = audioWriter(path, c.rate, c.channels, c.tag, c.bits, c.mask, &stream);
@@ -618,9 +579,7 @@ INSTANTIATE_TEST_SUITE_P(
                     AudioCase{"Float5_1WithSideSpeakers", 48000, 6, WAVE_FORMAT_IEEE_FLOAT, 32, 0x60F}),
     [](const testing::TestParamInfo<AudioCase>& info) { return std::string(info.param.name); });
 
-TEST(SinkWriter, AudioGapsInSampleTimesBecomeSilence) {
-  MediaFoundation started;
-  media::TempFolder folder;
+TEST_F(SinkWriter, AudioGapsInSampleTimesBecomeSilence) {
   const std::string path = folder.file("gap.mp4");
   DWORD stream = 0;
   ComPtr<IMFSinkWriter> writer = audioWriter(path, 48000, 2, WAVE_FORMAT_IEEE_FLOAT, 32, 3, &stream);

@@ -1,4 +1,3 @@
-#include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
 #include <algorithm>
@@ -16,8 +15,6 @@
 #include "platform/kernel32.h"
 
 namespace {
-
-using ::testing::HasSubstr;
 
 WAVEFORMATEXTENSIBLE stereoFloat(DWORD rate = 48000) {
   WAVEFORMATEXTENSIBLE format{};
@@ -68,6 +65,16 @@ int count(const std::vector<std::string>& lines, const std::string& part) {
                                         [&](const std::string& line) { return line.find(part) != std::string::npos; }));
 }
 
+// Polls `done` for up to ten seconds.
+template <class Done>
+bool eventually(Done done) {
+  for (int i = 0; i < 2000; ++i) {
+    if (done()) return true;
+    std::this_thread::sleep_for(std::chrono::milliseconds(5));
+  }
+  return false;
+}
+
 class WasapiSource : public testing::Test {
  protected:
   void SetUp() override {
@@ -108,6 +115,21 @@ class WasapiSource : public testing::Test {
     EXPECT_TRUE(watch.expired()) << "the capture thread did not end";
   }
 
+  // Changes the endpoint's script under its lock.
+  template <class Change>
+  void script(Change change) {
+    std::lock_guard<std::mutex> lock(audio->mutex);
+    change();
+  }
+
+  // Waits until the clip of encoder `index` is finished.
+  bool finished(size_t index) {
+    return eventually([&] {
+      std::lock_guard<std::mutex> lock(encoders[index]->mutex);
+      return encoders[index]->finalized == 1;
+    });
+  }
+
   void feed(fakes::Packet packet) {
     const int before = answered();
     audio->push(std::move(packet));
@@ -139,10 +161,7 @@ TEST_F(WasapiSource, DescribesItselfBeforeCapture) {
 }
 
 TEST_F(WasapiSource, SilenceThreadRefillsWhatThePlaybackBufferLacks) {
-  {
-    std::lock_guard<std::mutex> lock(audio->mutex);
-    audio->paddings = {4800, 1000, 4800, 4700};
-  }
+  script([&] { audio->paddings = {4800, 1000, 4800, 4700}; });
   ASSERT_TRUE(audio->waitFor([&] { return audio->silenceReleases.size() >= 2; }));
   std::lock_guard<std::mutex> lock(audio->mutex);
   ASSERT_GE(audio->initializations.size(), 1u);
@@ -204,11 +223,10 @@ TEST_F(WasapiSource, ClosestMatchReplacesTheWaveFieldsAndIsDescribed) {
   closest.Format.cbSize = 0;
   closest.dwChannelMask = 0x4;
   closest.SubFormat = KSDATAFORMAT_SUBTYPE_PCM;
-  {
-    std::lock_guard<std::mutex> lock(audio->mutex);
+  script([&] {
     audio->formatAnswer = S_FALSE;
     audio->closest = closest;
-  }
+  });
   Output output;
   startCapture();
   endCapture();
@@ -234,10 +252,7 @@ TEST_F(WasapiSource, ClosestMatchReplacesTheWaveFieldsAndIsDescribed) {
 }
 
 TEST_F(WasapiSource, OtherFormatAnswersAreIgnored) {
-  {
-    std::lock_guard<std::mutex> lock(audio->mutex);
-    audio->formatAnswer = E_FAIL;
-  }
+  script([&] { audio->formatAnswer = E_FAIL; });
   Output output;
   startCapture();
   endCapture();
@@ -248,16 +263,6 @@ TEST_F(WasapiSource, OtherFormatAnswersAreIgnored) {
 
 // The base follows every packet while not encoding; the first recorded packet keeps the base of
 // the packet before it, and every later one is timed from there.
-// Polls `done` for up to ten seconds.
-template <class Done>
-bool eventually(Done done) {
-  for (int i = 0; i < 2000; ++i) {
-    if (done()) return true;
-    std::this_thread::sleep_for(std::chrono::milliseconds(5));
-  }
-  return false;
-}
-
 // The capture clock, as packets are stamped on it (100 ns units).
 UINT64 clockNow() {
   LARGE_INTEGER count{};
@@ -336,10 +341,7 @@ TEST_F(WasapiSource, AStoppedClipThatNoPacketReachesIsFinishedAnyway) {
   feed(floats(tone(480), clockNow()));
   source->stopEncode();
   // The endpoint delivers nothing more; the clip must not stay open.
-  ASSERT_TRUE(eventually([&] {
-    std::lock_guard<std::mutex> lock(encoders[0]->mutex);
-    return encoders[0]->finalized == 1;
-  }));
+  ASSERT_TRUE(finished(0));
   std::lock_guard<std::mutex> lock(encoders[0]->mutex);
   EXPECT_EQ(encoders[0]->writes.size(), 1u);
 }
@@ -436,6 +438,7 @@ TEST_F(WasapiSource, DiscontinuityAndTimestampErrorsWriteOnePositionLine) {
 }
 
 struct Failure {
+  const char* name;
   HRESULT result;
   const char* text;
 };
@@ -451,10 +454,7 @@ TEST_P(WasapiSourceFailure, FinishesTheClipWarnsOnceAndCapturesAgain) {
   audio->push(answer(GetParam().result));
   audio->push(answer(GetParam().result));  // the same failure again on the next try
   // What was recorded up to the failure stays: the clip is finished.
-  ASSERT_TRUE(eventually([&] {
-    std::lock_guard<std::mutex> lock(encoders[0]->mutex);
-    return encoders[0]->finalized == 1;
-  }));
+  ASSERT_TRUE(finished(0));
   // Half a second later the thread opens the endpoint again, by itself, twice.
   ASSERT_TRUE(eventually([&] {
     std::lock_guard<std::mutex> lock(audio->mutex);
@@ -472,27 +472,20 @@ TEST_P(WasapiSourceFailure, FinishesTheClipWarnsOnceAndCapturesAgain) {
 INSTANTIATE_TEST_SUITE_P(
     Results, WasapiSourceFailure,
     testing::Values(
-        Failure{AUDCLNT_E_DEVICE_INVALIDATED,
+        Failure{"DeviceInvalidated", AUDCLNT_E_DEVICE_INVALIDATED,
                 "native/capture/audio/wasapi/source(262): 0x88890004: Audio device is no longer valid for capture."},
-        Failure{AUDCLNT_E_BUFFER_OPERATION_PENDING,
+        Failure{"BufferOperationPending", AUDCLNT_E_BUFFER_OPERATION_PENDING,
                 "native/capture/audio/wasapi/source(264): 0x8889000b: Audio buffer operation is pending."},
-        Failure{AUDCLNT_E_SERVICE_NOT_RUNNING,
+        Failure{"ServiceNotRunning", AUDCLNT_E_SERVICE_NOT_RUNNING,
                 "native/capture/audio/wasapi/source(266): 0x88890010: Audio client service is not running."}),
-    [](const testing::TestParamInfo<Failure>& info) {
-      switch (info.param.result) {
-        case AUDCLNT_E_DEVICE_INVALIDATED: return std::string("DeviceInvalidated");
-        case AUDCLNT_E_BUFFER_OPERATION_PENDING: return std::string("BufferOperationPending");
-        default: return std::string("ServiceNotRunning");
-      }
-    });
+    [](const testing::TestParamInfo<Failure>& info) { return std::string(info.param.name); });
 
 TEST_F(WasapiSource, UnreadableSamplesEndTheTryAfterTheEncoderHadThePacket) {
-  {
-    std::lock_guard<std::mutex> lock(audio->mutex);
+  script([&] {
     audio->mix.SubFormat = KSDATAFORMAT_SUBTYPE_PCM;
     audio->mix.Format.wBitsPerSample = 24;
     audio->mix.Format.nBlockAlign = 6;
-  }
+  });
   startCapture();
   source->startPreview();
   source->startEncode("clip.mp4");
@@ -501,10 +494,7 @@ TEST_F(WasapiSource, UnreadableSamplesEndTheTryAfterTheEncoderHadThePacket) {
   packet.bytes.assign(12, 0x10);
   packet.frames = 2;
   audio->push(packet);
-  ASSERT_TRUE(eventually([&] {
-    std::lock_guard<std::mutex> lock(encoders[0]->mutex);
-    return encoders[0]->finalized == 1;
-  }));
+  ASSERT_TRUE(finished(0));
   endCapture();
   const std::vector<std::string> lines = output.lines();
   EXPECT_EQ(count(lines, "Warning: native/capture/audio/wasapi/source(354): Peaks cannot be calculated"), 1)
