@@ -37,8 +37,7 @@ class TempFolder {
 };
 
 struct Packet {
-  double time;      // seconds
-  double duration;  // seconds
+  double time;  // seconds
   bool key;
 };
 
@@ -51,7 +50,6 @@ struct Stream {
   AVRational avgFrameRate{0, 1};
   int sampleRate = 0;
   int channels = 0;
-  double duration = 0;  // seconds, from the stream
   std::vector<Packet> packets;
   int64_t bytes = 0;  // sum of packet sizes
 };
@@ -83,7 +81,6 @@ inline File probe(const std::string& path) {
     stream.avgFrameRate = s->avg_frame_rate;
     stream.sampleRate = s->codecpar->sample_rate;
     stream.channels = s->codecpar->ch_layout.nb_channels;
-    stream.duration = s->duration == AV_NOPTS_VALUE ? 0 : s->duration * av_q2d(s->time_base);
     file.streams.push_back(stream);
   }
   av_seek_frame(format, -1, 0, AVSEEK_FLAG_BACKWARD);
@@ -91,7 +88,7 @@ inline File probe(const std::string& path) {
   while (av_read_frame(format, packet) >= 0) {
     const AVRational tb = format->streams[packet->stream_index]->time_base;
     file.streams[packet->stream_index].packets.push_back(
-        {packet->pts * av_q2d(tb), packet->duration * av_q2d(tb), (packet->flags & AV_PKT_FLAG_KEY) != 0});
+        {packet->pts * av_q2d(tb), (packet->flags & AV_PKT_FLAG_KEY) != 0});
     file.streams[packet->stream_index].bytes += packet->size;
     av_packet_unref(packet);
   }
@@ -127,7 +124,6 @@ struct Decoded {
   int height = 0;
   std::vector<uint8_t> firstPicture;  // BGRA
   std::vector<uint8_t> lastPicture;   // BGRA
-  int sampleRate = 0;
   int channels = 0;
   std::vector<float> samples;  // interleaved
 };
@@ -167,7 +163,6 @@ inline Decoded decode(const std::string& path, AVMediaType kind) {
         if (out.firstPicture.empty()) out.firstPicture = out.lastPicture;
       } else if (kind == AVMEDIA_TYPE_AUDIO) {
         if (!resampler) {
-          out.sampleRate = frame->sample_rate;
           out.channels = frame->ch_layout.nb_channels;
           swr_alloc_set_opts2(&resampler, &frame->ch_layout, AV_SAMPLE_FMT_FLT, frame->sample_rate, &frame->ch_layout,
                               static_cast<AVSampleFormat>(frame->format), frame->sample_rate, 0, nullptr);

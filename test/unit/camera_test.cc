@@ -33,6 +33,19 @@ ComPtr<IMFMediaType> videoType(const GUID& subtype, UINT32 width, UINT32 height,
   return type;
 }
 
+GUID subtypeOf(IMFMediaType* type) {
+  GUID subtype = GUID_NULL;
+  type->GetGUID(MF_MT_SUBTYPE, &subtype);
+  return subtype;
+}
+
+// A number of a media type; 0 when it has none.
+UINT32 numberOf(IMFMediaType* type, const GUID& key) {
+  UINT32 value = 0;
+  type->GetUINT32(key, &value);
+  return value;
+}
+
 class FakeEvent : public platform::Attributes<IMFMediaEvent, IID_IMFMediaEvent> {
  public:
   FakeEvent(const GUID& type, HRESULT status, bool typeReadable = true)
@@ -85,9 +98,7 @@ TEST(CameraMediaTypes, MakeVideoTypeCopiesGeometryAndNeedsEveryItem) {
   ComPtr<IMFMediaType> source = videoType(MFVideoFormat_YUY2, 640, 480, 30, 1);
   IMFMediaType* made = nullptr;
   ASSERT_EQ(S_OK, mfce::MakeVideoType(source.Get(), MFVideoFormat_ARGB32, &made));
-  GUID subtype{};
-  made->GetGUID(MF_MT_SUBTYPE, &subtype);
-  EXPECT_EQ(MFVideoFormat_ARGB32, subtype);
+  EXPECT_EQ(MFVideoFormat_ARGB32, subtypeOf(made));
   UINT64 size = 0;
   made->GetUINT64(MF_MT_FRAME_SIZE, &size);
   EXPECT_EQ((UINT64{640} << 32) | 480, size);
@@ -118,25 +129,17 @@ TEST(CameraMediaTypes, MakePcmType) {
   floats->SetUINT32(MF_MT_AUDIO_SAMPLES_PER_SECOND, 48000);
   IMFMediaType* made = nullptr;
   ASSERT_EQ(S_OK, mfce::MakePcmType(floats, &made));  // no bit count: 16
-  UINT32 value = 0;
-  GUID subtype{};
-  made->GetGUID(MF_MT_SUBTYPE, &subtype);
-  EXPECT_EQ(MFAudioFormat_PCM, subtype);
-  made->GetUINT32(MF_MT_AUDIO_BITS_PER_SAMPLE, &value);
-  EXPECT_EQ(16u, value);
-  made->GetUINT32(MF_MT_AUDIO_BLOCK_ALIGNMENT, &value);
-  EXPECT_EQ(4u, value);
-  made->GetUINT32(MF_MT_AUDIO_AVG_BYTES_PER_SECOND, &value);
-  EXPECT_EQ(192000u, value);
-  made->GetUINT32(MF_MT_ALL_SAMPLES_INDEPENDENT, &value);
-  EXPECT_EQ(1u, value);
+  EXPECT_EQ(MFAudioFormat_PCM, subtypeOf(made));
+  EXPECT_EQ(16u, numberOf(made, MF_MT_AUDIO_BITS_PER_SAMPLE));
+  EXPECT_EQ(4u, numberOf(made, MF_MT_AUDIO_BLOCK_ALIGNMENT));
+  EXPECT_EQ(192000u, numberOf(made, MF_MT_AUDIO_AVG_BYTES_PER_SECOND));
+  EXPECT_EQ(1u, numberOf(made, MF_MT_ALL_SAMPLES_INDEPENDENT));
   made->Release();
 
   floats->SetUINT32(MF_MT_AUDIO_BITS_PER_SAMPLE, 24);
   floats->SetUINT32(MF_MT_AUDIO_NUM_CHANNELS, 3);
   ASSERT_EQ(S_OK, mfce::MakePcmType(floats, &made));
-  made->GetUINT32(MF_MT_AUDIO_BLOCK_ALIGNMENT, &value);
-  EXPECT_EQ(9u, value);
+  EXPECT_EQ(9u, numberOf(made, MF_MT_AUDIO_BLOCK_ALIGNMENT));
   made->Release();
 
   floats->DeleteItem(MF_MT_AUDIO_NUM_CHANNELS);
@@ -236,10 +239,8 @@ TEST(CameraCaptureManager, VideoRecordStreamAsksForH264) {
   EXPECT_EQ(1, engine->startRecordCalls);
   ASSERT_EQ(1u, engine->sink->added.size());  // video only: no audio stream is asked for
   EXPECT_EQ(DWORD{MF_CAPTURE_ENGINE_PREFERRED_SOURCE_STREAM_FOR_VIDEO_RECORD}, engine->sink->sources[0]);
-  GUID subtype{};
   UINT32 bitrate = 0;
-  engine->sink->added[0]->GetGUID(MF_MT_SUBTYPE, &subtype);
-  EXPECT_EQ(MFVideoFormat_H264, subtype);
+  EXPECT_EQ(MFVideoFormat_H264, subtypeOf(engine->sink->added[0]));
   EXPECT_EQ(S_OK, engine->sink->added[0]->GetUINT32(MF_MT_AVG_BITRATE, &bitrate));
   EXPECT_EQ(3072000u, bitrate);
 
@@ -249,8 +250,7 @@ TEST(CameraCaptureManager, VideoRecordStreamAsksForH264) {
   ASSERT_EQ(S_OK, manager.StopRecord());
   ASSERT_EQ(S_OK, manager.StartRecord(L"/tmp/clip.mp4"));
   ASSERT_EQ(2u, engine->sink->added.size());
-  engine->sink->added[1]->GetGUID(MF_MT_SUBTYPE, &subtype);
-  EXPECT_EQ(MFVideoFormat_H264, subtype);
+  EXPECT_EQ(MFVideoFormat_H264, subtypeOf(engine->sink->added[1]));
   EXPECT_EQ(MF_E_ATTRIBUTENOTFOUND, engine->sink->added[1]->GetUINT32(MF_MT_AVG_BITRATE, &bitrate));
   engine->source->videoType = nullptr;
   manager.DestroyEngine();
@@ -263,9 +263,7 @@ TEST(CameraCaptureManager, AudioRecordStreamIsTheFirstAacType) {
   ASSERT_EQ(S_OK, manager.StartRecord(L"/tmp/clip.mp4"));
   ASSERT_EQ(1u, engine->sink->added.size());
   EXPECT_EQ(DWORD{MF_CAPTURE_ENGINE_PREFERRED_SOURCE_STREAM_FOR_AUDIO}, engine->sink->sources[0]);
-  GUID subtype{};
-  engine->sink->added[0]->GetGUID(MF_MT_SUBTYPE, &subtype);
-  EXPECT_EQ(MFAudioFormat_AAC, subtype);
+  EXPECT_EQ(MFAudioFormat_AAC, subtypeOf(engine->sink->added[0]));
 
   // A device without sound still records.
   engine->sink->audioAnswer = MF_E_INVALIDSTREAMNUMBER;
@@ -348,10 +346,8 @@ TEST(CameraCaptureManager, PreviewIsConfiguredOnceAndLaterCallsKeepTheCallersSiz
   ASSERT_TRUE(manager.previewSink);
   ASSERT_EQ(1u, engine->preview->added.size());
   EXPECT_EQ(DWORD{MF_CAPTURE_ENGINE_PREFERRED_SOURCE_STREAM_FOR_VIDEO_PREVIEW}, engine->preview->sources[0]);
-  GUID subtype{};
   UINT32 independent = 0;
-  engine->preview->added[0]->GetGUID(MF_MT_SUBTYPE, &subtype);
-  EXPECT_EQ(MFVideoFormat_ARGB32, subtype);
+  EXPECT_EQ(MFVideoFormat_ARGB32, subtypeOf(engine->preview->added[0]));
   EXPECT_EQ(S_OK, engine->preview->added[0]->GetUINT32(MF_MT_ALL_SAMPLES_INDEPENDENT, &independent));
   EXPECT_EQ(1u, independent);
   EXPECT_EQ(static_cast<IMFCaptureEngineOnSampleCallback*>(manager.videoSampleCallback.Get()),
