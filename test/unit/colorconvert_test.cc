@@ -120,6 +120,7 @@ TEST(ColourConversion, MatchesTheMatrixWithinOneLevelAtOddAndEvenSizes) {
   }
 }
 
+// The noise fills the ignored fourth byte too: a path that reads it differs.
 TEST(ColourConversion, WidePathGivesExactlyThePerPixelIntegerResult) {
   for (const auto& size : sizes) {
     SCOPED_TRACE(testing::Message() << size[0] << "x" << size[1]);
@@ -166,16 +167,6 @@ TEST(ColourConversion, NegativeStrideReadsBottomUpRowsUpright) {
   EXPECT_EQ(got.y, want.y);
   EXPECT_EQ(got.u, want.u);
   EXPECT_EQ(got.v, want.v);
-}
-
-TEST(ColourConversion, AlphaIsIgnored) {
-  auto pixels = noise(20, 6, 3);
-  auto opaque = pixels;
-  for (size_t i = 3; i < opaque.size(); i += 4) opaque[i] = 255;
-  const Planes a = convert(pixels, 20, 6), b = convert(opaque, 20, 6);
-  EXPECT_EQ(a.y, b.y);
-  EXPECT_EQ(a.u, b.u);
-  EXPECT_EQ(a.v, b.v);
 }
 
 TEST(ColourConversion, AgreesWithSwscaleWithinTwoLevelsOnAScreenPattern) {
