@@ -16,6 +16,7 @@
 #include "capture/video/camera/mfce/previewcallbacks.h"
 #include "fakes/captureengine.h"
 #include "platform/linux/mf/mfattributes.h"
+#include "support.h"
 
 namespace mfce = capture::video::camera::mfce;
 
@@ -74,14 +75,7 @@ bool signalled(HANDLE event) { return WaitForSingleObject(event, 0) == WAIT_OBJE
 
 // The manager's one auto-reset event keeps a signal of an earlier event pending, so a wait may end
 // before the event it waits for has come: poll the flag the event sets.
-template <class Condition>
-bool eventually(Condition condition) {
-  for (int i = 0; i < 500; ++i) {
-    if (condition()) return true;
-    std::this_thread::sleep_for(std::chrono::milliseconds(10));
-  }
-  return condition();
-}
+using testsupport::eventually;
 
 }  // namespace
 

@@ -19,6 +19,7 @@
 #include "platform/linux/ffmpeg/evenpicture.h"
 #include "platform/linux/mfcapture.h"
 #include "platform/linux/capture/testcameragraph.h"
+#include "support.h"
 
 namespace {
 
@@ -199,12 +200,6 @@ TEST(LinuxCaptureEngine, H264CameraIsEncodedAgainOnItsFrameGridWhenTheRecordStre
   EXPECT_GE(video.packets.size() + 2, static_cast<size_t>(last + 1));
 }
 
-template <class Condition>
-bool eventually(Condition condition) {
-  for (int i = 0; i < 500 && !condition(); ++i) std::this_thread::sleep_for(std::chrono::milliseconds(10));
-  return condition();
-}
-
 // Keeps the first picture it is given and remembers its bytes as they were then; counts the rest.
 class KeepFirstPicture
     : public platform::ComObject<IMFCaptureEngineOnSampleCallback, IID_IMFCaptureEngineOnSampleCallback> {
@@ -275,7 +270,7 @@ TEST(LinuxCaptureEngine, APictureACallbackKeepsIsNotOverwrittenByTheNextOnes) {
   EXPECT_EQ(previewSink->SetSampleCallback(index, callback), S_OK);
   EXPECT_EQ(engine->StartPreview(), S_OK);
   EXPECT_EQ(events->waitFor(MF_CAPTURE_ENGINE_PREVIEW_STARTED), S_OK);
-  EXPECT_TRUE(eventually([&] { return callback->pictures() >= 10; }));
+  EXPECT_TRUE(testsupport::eventually([&] { return callback->pictures() >= 10; }));
   EXPECT_EQ(engine->StopPreview(), S_OK);
   EXPECT_EQ(events->waitFor(MF_CAPTURE_ENGINE_PREVIEW_STOPPED), S_OK);
 

@@ -10,11 +10,13 @@
 #include <vector>
 
 #include "media.h"
+#include "support.h"
 
 namespace {
 
 using capture::audio::MFEncoder;
 using ::testing::HasSubstr;
+using testsupport::waveFormat;
 
 // The text of the failure `call` throws, or "no failure".
 template <class Call>
@@ -25,21 +27,6 @@ std::string failureOf(Call call) {
     return error.what();
   }
   return "no failure";
-}
-
-WAVEFORMATEXTENSIBLE captureFormat(WORD channels, DWORD rate, WORD bits, const GUID& subFormat, DWORD mask) {
-  WAVEFORMATEXTENSIBLE format{};
-  format.Format.wFormatTag = WAVE_FORMAT_EXTENSIBLE;
-  format.Format.nChannels = channels;
-  format.Format.nSamplesPerSec = rate;
-  format.Format.wBitsPerSample = bits;
-  format.Format.nBlockAlign = static_cast<WORD>(channels * bits / 8);
-  format.Format.nAvgBytesPerSec = rate * format.Format.nBlockAlign;
-  format.Format.cbSize = 22;
-  format.Samples.wValidBitsPerSample = bits;
-  format.dwChannelMask = mask;
-  format.SubFormat = subFormat;
-  return format;
 }
 
 // Packets of `frames` frames of a 440 Hz tone at amplitude 0.5, in the format's sample kind.
@@ -76,7 +63,7 @@ TEST(MFEncoder, FloatStereoEndpointGivesAnAacFileOfItsRateAndChannels) {
   media::TempFolder folder;
   const std::string path = folder.file("endpoint.mp4");
   const auto format =
-      captureFormat(2, 48000, 32, KSDATAFORMAT_SUBTYPE_IEEE_FLOAT, SPEAKER_FRONT_LEFT | SPEAKER_FRONT_RIGHT);
+      waveFormat(2, 48000, 32, KSDATAFORMAT_SUBTYPE_IEEE_FLOAT, SPEAKER_FRONT_LEFT | SPEAKER_FRONT_RIGHT);
   testing::internal::CaptureStdout();
   auto encoder = std::make_unique<MFEncoder>(path, &format);
   EXPECT_EQ(testing::internal::GetCapturedStdout(), "File: " + path + "\n");
@@ -106,7 +93,7 @@ TEST(MFEncoder, SampleSizesFollowTheBlockAlignment) {
   // change how long the file plays.
   media::TempFolder folder;
   const std::string path = folder.file("pcm.mp4");
-  const auto format = captureFormat(2, 44100, 16, KSDATAFORMAT_SUBTYPE_PCM, 3);
+  const auto format = waveFormat(2, 44100, 16, KSDATAFORMAT_SUBTYPE_PCM, 3);
   testing::internal::CaptureStdout();
   {
     MFEncoder encoder(path, &format);
@@ -124,7 +111,7 @@ TEST(MFEncoder, SampleSizesFollowTheBlockAlignment) {
 TEST(MFEncoder, UnknownSubFormatFailsAfterTheOutputStream) {
   media::TempFolder folder;
   const std::string path = folder.file("unknown.mp4");
-  const auto format = captureFormat(2, 48000, 32, MFAudioFormat_AAC, 3);
+  const auto format = waveFormat(2, 48000, 32, MFAudioFormat_AAC, 3);
   testing::internal::CaptureStdout();
   EXPECT_EQ(failureOf([&] { MFEncoder encoder(path, &format); }),
             "native/capture/audio/mfencoder(144): Unable to set format tag.");
@@ -135,7 +122,7 @@ TEST(MFEncoder, UnknownSubFormatFailsAfterTheOutputStream) {
 
 TEST(MFEncoder, MissingFolderFailsToCreateTheSink) {
   media::TempFolder folder;
-  const auto format = captureFormat(2, 48000, 32, KSDATAFORMAT_SUBTYPE_IEEE_FLOAT, 3);
+  const auto format = waveFormat(2, 48000, 32, KSDATAFORMAT_SUBTYPE_IEEE_FLOAT, 3);
   testing::internal::CaptureStdout();
   EXPECT_THAT(failureOf([&] { MFEncoder encoder(folder.file("missing/a.mp4"), &format); }),
               HasSubstr("\tnative/capture/audio/mfencoder(35): 0x80070003: Could not create sink."));
@@ -145,7 +132,7 @@ TEST(MFEncoder, MissingFolderFailsToCreateTheSink) {
 
 TEST(MFEncoder, WriteAfterFinalizeFailsInThePlatform) {
   media::TempFolder folder;
-  const auto format = captureFormat(1, 48000, 32, KSDATAFORMAT_SUBTYPE_IEEE_FLOAT, SPEAKER_FRONT_CENTER);
+  const auto format = waveFormat(1, 48000, 32, KSDATAFORMAT_SUBTYPE_IEEE_FLOAT, SPEAKER_FRONT_CENTER);
   testing::internal::CaptureStdout();
   MFEncoder encoder(folder.file("late.mp4"), &format);
   testing::internal::GetCapturedStdout();
@@ -162,7 +149,7 @@ TEST(MFEncoder, EachEncoderStartsAndShutsDownMediaFoundationOnce) {
   while (SUCCEEDED(MFShutdown())) {
   }
   media::TempFolder folder;
-  const auto format = captureFormat(2, 48000, 32, KSDATAFORMAT_SUBTYPE_IEEE_FLOAT, 3);
+  const auto format = waveFormat(2, 48000, 32, KSDATAFORMAT_SUBTYPE_IEEE_FLOAT, 3);
   testing::internal::CaptureStdout();
   auto first = std::make_unique<MFEncoder>(folder.file("1.mp4"), &format);
   auto second = std::make_unique<MFEncoder>(folder.file("2.mp4"), &format);
@@ -174,7 +161,7 @@ TEST(MFEncoder, EachEncoderStartsAndShutsDownMediaFoundationOnce) {
 
 TEST(MFEncoder, AnUnpairedShutDownInTheDestructorBecomesAWarningLine) {
   media::TempFolder folder;
-  const auto format = captureFormat(2, 48000, 32, KSDATAFORMAT_SUBTYPE_IEEE_FLOAT, 3);
+  const auto format = waveFormat(2, 48000, 32, KSDATAFORMAT_SUBTYPE_IEEE_FLOAT, 3);
   testing::internal::CaptureStdout();
   auto encoder = std::make_unique<MFEncoder>(folder.file("w.mp4"), &format);
   while (SUCCEEDED(MFShutdown())) {

@@ -12,6 +12,7 @@
 
 #include "media.h"
 #include "platform/mf.h"
+#include "support.h"
 
 namespace {
 
@@ -640,17 +641,7 @@ TEST(Attributes, StoreTypedValuesAndAnswerWithMediaFoundationCodes) {
 }
 
 TEST(Attributes, MediaTypeFromWaveFormat) {
-  WAVEFORMATEXTENSIBLE format{};
-  format.Format.wFormatTag = WAVE_FORMAT_EXTENSIBLE;
-  format.Format.nChannels = 2;
-  format.Format.nSamplesPerSec = 48000;
-  format.Format.wBitsPerSample = 32;
-  format.Format.nBlockAlign = 8;
-  format.Format.nAvgBytesPerSec = 384000;
-  format.Format.cbSize = 22;
-  format.Samples.wValidBitsPerSample = 32;
-  format.dwChannelMask = 3;
-  format.SubFormat = KSDATAFORMAT_SUBTYPE_IEEE_FLOAT;
+  WAVEFORMATEXTENSIBLE format = testsupport::waveFormat(2, 48000, 32, KSDATAFORMAT_SUBTYPE_IEEE_FLOAT, 3);
   ComPtr<IMFMediaType> type;
   MFCreateMediaType(&type);
   EXPECT_EQ(MFInitMediaTypeFromWaveFormatEx(type.Get(), &format.Format, 18), E_INVALIDARG);

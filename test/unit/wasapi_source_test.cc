@@ -13,22 +13,15 @@
 #include "capture/audio/wasapi/source.h"
 #include "fakes/audio.h"
 #include "platform/kernel32.h"
+#include "support.h"
 
 namespace {
 
+using testsupport::eventually;
+
 WAVEFORMATEXTENSIBLE stereoFloat(DWORD rate = 48000) {
-  WAVEFORMATEXTENSIBLE format{};
-  format.Format.wFormatTag = WAVE_FORMAT_EXTENSIBLE;
-  format.Format.nChannels = 2;
-  format.Format.nSamplesPerSec = rate;
-  format.Format.wBitsPerSample = 32;
-  format.Format.nBlockAlign = 8;
-  format.Format.nAvgBytesPerSec = rate * 8;
-  format.Format.cbSize = 22;
-  format.Samples.wValidBitsPerSample = 32;
-  format.dwChannelMask = SPEAKER_FRONT_LEFT | SPEAKER_FRONT_RIGHT;
-  format.SubFormat = KSDATAFORMAT_SUBTYPE_IEEE_FLOAT;
-  return format;
+  return testsupport::waveFormat(2, rate, 32, KSDATAFORMAT_SUBTYPE_IEEE_FLOAT,
+                                 SPEAKER_FRONT_LEFT | SPEAKER_FRONT_RIGHT);
 }
 
 fakes::Packet floats(std::vector<float> samples, UINT64 qpc, DWORD flags = 0, UINT64 device = 0) {
@@ -63,16 +56,6 @@ class Output {
 int count(const std::vector<std::string>& lines, const std::string& part) {
   return static_cast<int>(std::count_if(lines.begin(), lines.end(),
                                         [&](const std::string& line) { return line.find(part) != std::string::npos; }));
-}
-
-// Polls `done` for up to ten seconds.
-template <class Done>
-bool eventually(Done done) {
-  for (int i = 0; i < 2000; ++i) {
-    if (done()) return true;
-    std::this_thread::sleep_for(std::chrono::milliseconds(5));
-  }
-  return false;
 }
 
 class WasapiSource : public testing::Test {
