@@ -302,26 +302,22 @@ TEST_F(DisplayGrab, CopiesTheDesktopAndDrawsThePointer) {
   EXPECT_EQ(std::memcmp(source.queue->frames.back()->data.get(), desktop.pixels.data(), desktop.pixels.size()), 0);
 }
 
-TEST_F(DisplayGrab, StillDesktopAddsNothingAndPreviewKeepsTheLastFrame) {
-  acquireFrame();
+TEST_F(DisplayGrab, PreviewIsFalseBeforeAFrameAndAStillDesktopAddsNothing) {
   Source source(&output, &device, false);
+  std::vector<uint8_t> preview(8 * 4 * 4, 7);
+  EXPECT_FALSE(source.preview(preview.data(), 1, 2, 2));
+  EXPECT_EQ(preview[0], 7);
+
+  acquireFrame();
   source.capture();
   source.capture();  // time-out
   EXPECT_EQ(source.queue->frames.size(), 1u);
   EXPECT_EQ(device.context.copies, 1);
-
-  std::vector<uint8_t> preview(8 * 4 * 4);
+  // The preview keeps the last frame.
   EXPECT_TRUE(source.preview(preview.data(), 1, 8, 4));
   EXPECT_EQ(preview[0], desktop.pixels[2]);  // red and blue exchanged
   EXPECT_EQ(preview[2], desktop.pixels[0]);
   EXPECT_EQ(preview[5], desktop.pixels[5]);
-}
-
-TEST_F(DisplayGrab, PreviewWithoutFrameIsFalse) {
-  Source source(&output, &device, false);
-  std::vector<uint8_t> preview(16, 7);
-  EXPECT_FALSE(source.preview(preview.data(), 1, 2, 2));
-  EXPECT_EQ(preview[0], 7);
 }
 
 TEST_F(DisplayGrab, WhileAClipRecordsThePicturesItHasNotTakenStayAndTheirMemoryIsUsedAgain) {
