@@ -108,26 +108,23 @@ TEST(MFEncoder, SampleSizesFollowTheBlockAlignment) {
   EXPECT_NEAR(file.duration, 1.0, 0.03);
 }
 
-TEST(MFEncoder, UnknownSubFormatFailsAfterTheOutputStream) {
+TEST(MFEncoder, AMissingFolderOrAnUnknownSubFormatFailsTheConstruction) {
   media::TempFolder folder;
-  const std::string path = folder.file("unknown.mp4");
-  const auto format = waveFormat(2, 48000, 32, MFAudioFormat_AAC, 3);
+  const auto floats = waveFormat(2, 48000, 32, KSDATAFORMAT_SUBTYPE_IEEE_FLOAT, 3);
   testing::internal::CaptureStdout();
-  EXPECT_EQ(failureOf([&] { MFEncoder encoder(path, &format); }),
+  EXPECT_THAT(failureOf([&] { MFEncoder encoder(folder.file("missing/a.mp4"), &floats); }),
+              HasSubstr("\tnative/capture/audio/mfencoder(35): 0x80070003: Could not create sink."));
+  testing::internal::GetCapturedStdout();
+  MFShutdown();
+  // An unknown subformat fails after the output stream.
+  const std::string path = folder.file("unknown.mp4");
+  const auto aac = waveFormat(2, 48000, 32, MFAudioFormat_AAC, 3);
+  testing::internal::CaptureStdout();
+  EXPECT_EQ(failureOf([&] { MFEncoder encoder(path, &aac); }),
             "native/capture/audio/mfencoder(144): Unable to set format tag.");
   EXPECT_EQ(testing::internal::GetCapturedStdout(), "File: " + path + "\n");
   EXPECT_TRUE(std::filesystem::exists(path));  // the sink was made before the failure
   MFShutdown();                                // the failed constructor left Media Foundation started, as it should
-}
-
-TEST(MFEncoder, MissingFolderFailsToCreateTheSink) {
-  media::TempFolder folder;
-  const auto format = waveFormat(2, 48000, 32, KSDATAFORMAT_SUBTYPE_IEEE_FLOAT, 3);
-  testing::internal::CaptureStdout();
-  EXPECT_THAT(failureOf([&] { MFEncoder encoder(folder.file("missing/a.mp4"), &format); }),
-              HasSubstr("\tnative/capture/audio/mfencoder(35): 0x80070003: Could not create sink."));
-  testing::internal::GetCapturedStdout();
-  MFShutdown();
 }
 
 TEST(MFEncoder, WriteAfterFinalizeFailsInThePlatform) {
@@ -145,7 +142,7 @@ TEST(MFEncoder, WriteAfterFinalizeFailsInThePlatform) {
               HasSubstr("mfencoder(113): 0xc00d36b2: Unable to finalize audio encoder."));
 }
 
-TEST(MFEncoder, EachEncoderStartsAndShutsDownMediaFoundationOnce) {
+TEST(MFEncoder, EachEncoderStartsAndShutsDownMediaFoundationOnceAndWarnsOfAnUnpairedShutDown) {
   while (SUCCEEDED(MFShutdown())) {
   }
   media::TempFolder folder;
@@ -157,11 +154,8 @@ TEST(MFEncoder, EachEncoderStartsAndShutsDownMediaFoundationOnce) {
   first.reset();  // unfinalised: released and shut down all the same
   second.reset();
   EXPECT_EQ(MFShutdown(), MF_E_PLATFORM_NOT_INITIALIZED);
-}
 
-TEST(MFEncoder, AnUnpairedShutDownInTheDestructorBecomesAWarningLine) {
-  media::TempFolder folder;
-  const auto format = waveFormat(2, 48000, 32, KSDATAFORMAT_SUBTYPE_IEEE_FLOAT, 3);
+  // Media Foundation shut down under the encoder: its own shut-down becomes a warning line.
   testing::internal::CaptureStdout();
   auto encoder = std::make_unique<MFEncoder>(folder.file("w.mp4"), &format);
   while (SUCCEEDED(MFShutdown())) {
