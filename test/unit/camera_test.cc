@@ -311,7 +311,7 @@ TEST(CameraCaptureManager, EngineEventsSetFlagsAndSignalEveryTime) {
   EXPECT_TRUE(signalled(manager.engineEvent));
 
   // The error event tears the engine down; later operations find none.
-  auto* engine = fakeEngine(manager);
+  fakeEngine(manager);
   manager.recording = true;
   handle(MF_CAPTURE_ENGINE_ERROR, E_FAIL);
   EXPECT_FALSE(manager.engine);
