@@ -2,6 +2,8 @@
 #pragma once
 
 #include <chrono>
+#include <stdexcept>
+#include <string>
 #include <thread>
 
 #include "platform/wave.h"
@@ -13,6 +15,17 @@ template <class Condition>
 bool eventually(Condition condition) {
   for (int i = 0; i < 2000 && !condition(); ++i) std::this_thread::sleep_for(std::chrono::milliseconds(5));
   return condition();
+}
+
+// The text of the failure `call` throws, or "no failure".
+template <class Call>
+std::string failureOf(Call call) {
+  try {
+    call();
+  } catch (const std::runtime_error& error) {
+    return error.what();
+  }
+  return "no failure";
 }
 
 // An extensible wave format whose samples fill their `bits`, as an endpoint's mix format is.

@@ -8,6 +8,7 @@
 #include <sstream>
 
 #include "capture/check.h"
+#include "support.h"
 #include "capture/log.h"
 #include "capture/text.h"
 #include "wine.h"
@@ -18,12 +19,7 @@ using ::testing::HasSubstr;
 namespace {
 
 std::string failureText(HRESULT hr, const char* message) {
-  try {
-    capture::checkResult("native/interface", 47, hr, message);
-  } catch (const std::runtime_error& e) {
-    return e.what();
-  }
-  return "<no exception>";
+  return testsupport::failureOf([&] { capture::checkResult("native/interface", 47, hr, message); });
 }
 
 // Captures what a call writes to std::cout.

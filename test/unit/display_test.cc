@@ -9,12 +9,14 @@
 #include "capture/video/screen/dxgi/pointer.h"
 #include "capture/video/screen/dxgi/source.h"
 #include "fakes/dxgi.h"
+#include "support.h"
 
 using capture::video::Frame;
 using capture::video::screen::dxgi::drawPointer;
 using capture::video::screen::dxgi::PointerInfo;
 using capture::video::screen::dxgi::Source;
 using capture::video::screen::dxgi::updatePointer;
+using testsupport::failureOf;
 
 namespace {
 
@@ -45,17 +47,6 @@ PointerInfo colourPointer(uint32_t type, uint32_t w, uint32_t h, LONG x, LONG y,
   p.shapeBuffer.reset(new uint8_t[p.shapeBufferSize]);
   for (uint32_t i = 0; i < w * h; ++i) std::memcpy(&p.shapeBuffer[i * 4], colour.data(), 4);
   return p;
-}
-
-// The text of the failure `call` throws; empty when it throws none.
-template <class Call>
-std::string failureOf(Call call) {
-  try {
-    call();
-  } catch (const std::runtime_error& e) {
-    return e.what();
-  }
-  return "";
 }
 
 // Counts the pixels of a frame that differ from `background`.

@@ -16,18 +16,8 @@ namespace {
 
 using capture::audio::MFEncoder;
 using ::testing::HasSubstr;
+using testsupport::failureOf;
 using testsupport::waveFormat;
-
-// The text of the failure `call` throws, or "no failure".
-template <class Call>
-std::string failureOf(Call call) {
-  try {
-    call();
-  } catch (const std::runtime_error& error) {
-    return error.what();
-  }
-  return "no failure";
-}
 
 // Packets of `frames` frames of a 440 Hz tone at amplitude 0.5, in the format's sample kind.
 std::vector<uint8_t> tone(const WAVEFORMATEXTENSIBLE& format, int64_t first, uint32_t frames) {
