@@ -8,6 +8,10 @@
 #include <string>
 #include <vector>
 
+#include <gtest/gtest.h>
+
+#include "platform/mf.h"
+
 extern "C" {
 #include <libavcodec/avcodec.h>
 #include <libavformat/avformat.h>
@@ -17,6 +21,12 @@ extern "C" {
 }
 
 namespace media {
+
+// Media Foundation started for as long as it lives, as every writer and engine needs it.
+struct MediaFoundation {
+  MediaFoundation() { EXPECT_EQ(MFStartup(MF_VERSION, MFSTARTUP_FULL), S_OK); }
+  ~MediaFoundation() { EXPECT_EQ(MFShutdown(), S_OK); }
+};
 
 // A folder of its own for a test's files, removed with everything in it.
 class TempFolder {
@@ -121,7 +131,6 @@ struct Decoded {
   int frames = 0;
   int errors = 0;
   int width = 0;
-  int height = 0;
   std::vector<uint8_t> firstPicture;  // BGRA
   std::vector<uint8_t> lastPicture;   // BGRA
   int channels = 0;
@@ -151,7 +160,6 @@ inline Decoded decode(const std::string& path, AVMediaType kind) {
       ++out.frames;
       if (kind == AVMEDIA_TYPE_VIDEO) {
         out.width = frame->width;
-        out.height = frame->height;
         out.lastPicture.resize(static_cast<size_t>(frame->width) * frame->height * 4);
         SwsContext* sws =
             sws_getContext(frame->width, frame->height, static_cast<AVPixelFormat>(frame->format), frame->width,

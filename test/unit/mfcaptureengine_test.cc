@@ -23,11 +23,6 @@
 
 namespace {
 
-struct MediaFoundation {
-  MediaFoundation() { EXPECT_EQ(MFStartup(MF_VERSION, MFSTARTUP_FULL), S_OK); }
-  ~MediaFoundation() { EXPECT_EQ(MFShutdown(), S_OK); }
-};
-
 class Events : public platform::ComObject<IMFCaptureEngineOnEventCallback, IID_IMFCaptureEngineOnEventCallback> {
  public:
   HRESULT OnEvent(IMFMediaEvent* event) override {
@@ -142,7 +137,7 @@ void record(const std::wstring& link, const std::string& clip, UINT32 bitRate) {
 }
 
 TEST(LinuxCaptureEngine, H264CameraIsRecordedAsItSendsItFromItsFirstKeyFrame) {
-  MediaFoundation started;
+  media::MediaFoundation started;
   media::TempFolder folder;
   const media::CameraStream camera = media::cameraStream(160, 120, 75, 30, false);
   ASSERT_EQ(camera.packets.size(), 75u);
@@ -175,7 +170,7 @@ TEST(LinuxCaptureEngine, H264CameraIsRecordedAsItSendsItFromItsFirstKeyFrame) {
 // seconds), recorded with a bit rate of its own: encoded again, as Baseline, every picture on the
 // grid of the camera's rate, one a slot.
 TEST(LinuxCaptureEngine, H264CameraIsEncodedAgainOnItsFrameGridWhenTheRecordStreamHasABitRate) {
-  MediaFoundation started;
+  media::MediaFoundation started;
   media::TempFolder folder;
   const std::string clip = folder.file("clip.mp4");
   record(L"lavfi:h264:testsrc2=size=160x120:rate=30:duration=2", clip, 500000);
@@ -249,7 +244,7 @@ class KeepFirstPicture
 // The engine writes picture after picture into one buffer when it can; a picture that a preview
 // callback still holds must keep its bytes.
 TEST(LinuxCaptureEngine, APictureACallbackKeepsIsNotOverwrittenByTheNextOnes) {
-  MediaFoundation started;
+  media::MediaFoundation started;
   // Every picture differs from the one before: the pattern moves.
   InitializedEngine initialized(L"lavfi:testsrc2=size=64x48:rate=30");
   IMFCaptureEngine* engine = initialized.engine.Get();
@@ -353,7 +348,7 @@ TEST(LinuxCaptureEngine, AnEventClosedWhileWaitedOnLivesUntilTheWaitEnds) {
 // Clips started and stopped back to back, the second stopped the moment it started: the engine
 // answers each command in order, and each clip is a file of its own with the pictures of its time.
 TEST(LinuxCaptureEngine, BackToBackClipsAreAnsweredInOrderAndEachIsAFile) {
-  MediaFoundation started;
+  media::MediaFoundation started;
   media::TempFolder folder;
   InitializedEngine initialized(L"lavfi:testsrc2=size=64x48:rate=30");
   IMFCaptureEngine* engine = initialized.engine.Get();

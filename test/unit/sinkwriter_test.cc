@@ -16,11 +16,6 @@
 
 namespace {
 
-struct MediaFoundation {
-  MediaFoundation() { EXPECT_EQ(MFStartup(MF_VERSION, MFSTARTUP_FULL), S_OK); }
-  ~MediaFoundation() { EXPECT_EQ(MFShutdown(), S_OK); }
-};
-
 ComPtr<IMFSinkWriter> createWriter(const std::string& path, HRESULT* result = nullptr, bool mp4 = true) {
   ComPtr<IMFAttributes> attributes;
   MFCreateAttributes(&attributes, 0);
@@ -122,7 +117,7 @@ char colourAt(const media::Decoded& decoded, int x, int y) {
 // Every test of the writer runs with Media Foundation started and a folder of its own.
 class SinkWriter : public testing::Test {
  protected:
-  MediaFoundation started;
+  media::MediaFoundation started;
   media::TempFolder folder;
 };
 
@@ -313,9 +308,7 @@ TEST_F(SinkWriter, SampleTimesAndDurationsBecomePacketTimes) {
   ComPtr<IMFSinkWriter> writer = videoWriter(path, 64, 64, &stream);
   ASSERT_TRUE(writer);
   const auto pixels = bands(64, 64, true);
-  ASSERT_EQ(writeBytes(writer, stream, pixels, 0, 166666), S_OK);
-  ASSERT_EQ(writeBytes(writer, stream, pixels, 330000, 166666), S_OK);
-  ASSERT_EQ(writeBytes(writer, stream, pixels, 1000000, 166666), S_OK);
+  for (LONGLONG time : {0, 330000, 1000000}) ASSERT_EQ(writeBytes(writer, stream, pixels, time, 166666), S_OK);
   // Without a time a sample follows the previous one; without a duration it lasts one frame.
   ASSERT_EQ(writeBytes(writer, stream, pixels, 0, -1, false), S_OK);
   ASSERT_EQ(writeBytes(writer, stream, pixels, 0, -1, false), S_OK);
@@ -324,11 +317,8 @@ TEST_F(SinkWriter, SampleTimesAndDurationsBecomePacketTimes) {
   ASSERT_TRUE(file.opened);
   const auto& packets = file.streams[0].packets;
   ASSERT_EQ(packets.size(), 5u);
-  EXPECT_NEAR(packets[0].time, 0.0, 1e-4);
-  EXPECT_NEAR(packets[1].time, 0.033, 1e-4);
-  EXPECT_NEAR(packets[2].time, 0.100, 1e-4);
-  EXPECT_NEAR(packets[3].time, 0.1166666, 1e-4);
-  EXPECT_NEAR(packets[4].time, 0.15, 1e-4);
+  const double times[] = {0.0, 0.033, 0.100, 0.1166666, 0.15};
+  for (size_t i = 0; i < packets.size(); ++i) EXPECT_NEAR(packets[i].time, times[i], 1e-4) << "packet " << i;
   EXPECT_TRUE(packets[0].key);
   EXPECT_NEAR(file.duration, 0.15 + 1 / 30.0, 1e-3);
 }
