@@ -80,10 +80,8 @@ using testsupport::eventually;
 }  // namespace
 
 TEST(CameraMediaTypes, EstimateBitrateInSinglePrecision) {
-  EXPECT_EQ(3072000u, mfce::EstimateBitrate(640, 480, 30, 1));
-  EXPECT_EQ(9216000u, mfce::EstimateBitrate(1280, 720, 30, 1));
+  // Whole rates are checked through the record stream's bit rate; this one needs the denominator.
   EXPECT_EQ(9206793u, mfce::EstimateBitrate(1280, 720, 30000, 1001));
-  EXPECT_EQ(20736000u, mfce::EstimateBitrate(1920, 1080, 30, 1));
   ComPtr<IMFMediaType> type = videoType(MFVideoFormat_MJPG, 1280, 720, 30000, 1001);
   EXPECT_EQ(9206793u, mfce::EstimateBitrate(type.Get()));
 }
