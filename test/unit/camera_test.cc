@@ -82,6 +82,7 @@ using testsupport::eventually;
 TEST(CameraMediaTypes, EstimateBitrateInSinglePrecision) {
   // Whole rates are checked through the record stream's bit rate; this one needs the denominator.
   EXPECT_EQ(9206793u, mfce::EstimateBitrate(1280, 720, 30000, 1001));
+  EXPECT_EQ(41430568u, mfce::EstimateBitrate(1920, 1080, 60000, 1001));  // 41430569 in double precision
   ComPtr<IMFMediaType> type = videoType(MFVideoFormat_MJPG, 1280, 720, 30000, 1001);
   EXPECT_EQ(9206793u, mfce::EstimateBitrate(type.Get()));
 }
