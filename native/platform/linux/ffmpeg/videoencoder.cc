@@ -3,9 +3,9 @@
 // through swscale.
 #include <unistd.h>
 
+#include <cstring>
 #include <deque>
 #include <initializer_list>
-#include <string>
 
 extern "C" {
 #include <libavutil/hwcontext.h>
@@ -75,30 +75,31 @@ class VideoEncoder : public StreamEncoder {
 
     const AVPixelFormat target = hardwareFrames_ ? AV_PIX_FMT_NV12 : context_->pix_fmt;
     const bool sameSize = inWidth_ == static_cast<int>(width) && inHeight_ == static_cast<int>(height);
-    // Four-byte RGB at the output's size is the display path: our own one-pass converter
-    // costs a fraction of swscale's, which matters at 60 frames a second.
-    directI420_ = picture_.bytesPerPixel == 4 && target == AV_PIX_FMT_YUV420P && sameSize;
-    // I420 at the output's size is the camera path: libx264 copies each picture into its own
-    // frames while it is handed over, so it can read the caller's planes where they lie.
-    borrowI420_ = picture_.format == AV_PIX_FMT_YUV420P && target == AV_PIX_FMT_YUV420P && sameSize &&
-                  std::string(context_->codec->name) == "libx264";
-    if (!directI420_ && !borrowI420_)
+    if (picture_.bytesPerPixel == 4 && target == AV_PIX_FMT_YUV420P && sameSize) {
+      // Four-byte RGB at the output's size is the display path: our own one-pass converter
+      // costs a fraction of swscale's, which matters at 60 frames a second.
+      conversion_ = Conversion::bgrxToI420;
+    } else if (picture_.format == AV_PIX_FMT_YUV420P && target == AV_PIX_FMT_YUV420P && sameSize &&
+               std::strcmp(context_->codec->name, "libx264") == 0) {
+      // I420 at the output's size is the camera path: libx264 copies each picture into its own
+      // frames while it is handed over, so it can read the caller's planes where they lie.
+      conversion_ = Conversion::borrowI420;
+    } else {
       scaler_.reset(sws_getContext(inWidth_, inHeight_, picture_.format, static_cast<int>(width),
                                    static_cast<int>(height), target, SWS_BILINEAR, nullptr, nullptr, nullptr));
-    if (scaler_) {
+      if (!scaler_) return MF_E_INVALIDMEDIATYPE;
       // BT.709, limited range, as the stream declares.
       int* table = const_cast<int*>(sws_getCoefficients(SWS_CS_ITU709));
       sws_setColorspaceDetails(scaler_.get(), table, 1, table, 0, 0, 1 << 16, 1 << 16);
     }
 
-    if (!borrowI420_) {
+    if (conversion_ != Conversion::borrowI420) {
       frame_.reset(av_frame_alloc());
       frame_->format = target;
       frame_->width = static_cast<int>(width);
       frame_->height = static_cast<int>(height);
       if (av_frame_get_buffer(frame_.get(), 0) < 0) return E_OUTOFMEMORY;
     }
-
     return describe();
   }
 
@@ -112,15 +113,15 @@ class VideoEncoder : public StreamEncoder {
     sourcePlanes(data, planes, strides);
     int result = 0;
     FramePtr borrowed;
-    if (borrowI420_) {
+    if (conversion_ == Conversion::borrowI420) {
       if ((result = borrow(data, length, planes, strides, &borrowed)) < 0) return fromAv(result);
+    } else if ((result = av_frame_make_writable(frame_.get())) < 0) {
+      return fromAv(result);
+    } else if (conversion_ == Conversion::bgrxToI420) {
+      colour::bgrxToI420(planes[0], strides[0], inWidth_, inHeight_, frame_->data[0], frame_->linesize[0],
+                         frame_->data[1], frame_->linesize[1], frame_->data[2], frame_->linesize[2]);
     } else {
-      if ((result = av_frame_make_writable(frame_.get())) < 0) return fromAv(result);
-      if (directI420_)
-        colour::bgrxToI420(planes[0], strides[0], inWidth_, inHeight_, frame_->data[0], frame_->linesize[0],
-                           frame_->data[1], frame_->linesize[1], frame_->data[2], frame_->linesize[2]);
-      else
-        sws_scale(scaler_.get(), planes, strides, 0, inHeight_, frame_->data, frame_->linesize);
+      sws_scale(scaler_.get(), planes, strides, 0, inHeight_, frame_->data, frame_->linesize);
     }
     AVFrame* send = borrowed ? borrowed.get() : frame_.get();
 
@@ -131,7 +132,7 @@ class VideoEncoder : public StreamEncoder {
     if (hardwareFrames_) {
       uploaded.reset(av_frame_alloc());
       if ((result = av_hwframe_get_buffer(hardwareFrames_.get(), uploaded.get(), 0)) < 0 ||
-          (result = av_hwframe_transfer_data(uploaded.get(), frame_.get(), 0)) < 0)
+          (result = av_hwframe_transfer_data(uploaded.get(), send, 0)) < 0)
         return fromAv(result);
       uploaded->pts = send->pts;
       send = uploaded.get();
@@ -313,8 +314,8 @@ class VideoEncoder : public StreamEncoder {
   int64_t frameIndex_ = 0;
   std::deque<Pending> pending_;
   std::unique_ptr<SwsContext, SwsDeleter> scaler_;
-  bool directI420_ = false;
-  bool borrowI420_ = false;
+  // How a picture becomes the encoder's: swscale, our converter, or handed over where it lies.
+  enum class Conversion { swscale, bgrxToI420, borrowI420 } conversion_ = Conversion::swscale;
   FramePtr frame_;
   BufferRefPtr hardwareFrames_;
 };
