@@ -29,6 +29,7 @@ extern "C" {
 #include "platform/com.h"
 #include "platform/linux/capture/devicereader.h"
 #include "platform/linux/capture/enginestate.h"
+#include "platform/linux/capture/pictureslots.h"
 #include "platform/linux/ffmpeg/evenpicture.h"
 #include "platform/linux/mf/mfattributes.h"
 
@@ -108,6 +109,7 @@ HRESULT makeSample(DWORD length, LONGLONG time, LONGLONG duration, Fill fill, IM
 // until the stop), and sound missing at the ends is silence.
 struct Recording {
   ~Recording() { swr_free(&resampler); }
+  LONGLONG sinceStart(int64_t at) const { return (at - startAt) * 10; }  // wall clock (µs) to media time
   ComPtr<IMFSinkWriter> writer;
   int64_t startAt = 0;     // wall clock (µs) of the StartRecord call
   int64_t stopAt = 0;      // of the StopRecord call; 0 while it records
@@ -124,9 +126,9 @@ struct Recording {
   // The last picture, written when the next one shows how long it lasted.
   ComPtr<IMFSample> held;
   LONGLONG heldTime = 0;
-  int64_t firstDeviceTime = AV_NOPTS_VALUE;  // the device's time of the clip's first picture
-  int64_t firstReadAt = 0;                   // and the wall clock (µs) when it was read
-  bool videoDone = false;                    // a picture from after the stop has come
+  pictureslots::PictureSlots slots;  // from the clip's first picture
+  bool timed = false;                // whether that picture had a device time
+  bool videoDone = false;            // a picture from after the stop has come
   SwrContext* resampler = nullptr;
   int audioRate = 0;
   int audioChannels = 0;
@@ -358,8 +360,7 @@ HRESULT EngineThread::startRecording(const Order& order) {
   } else if (recording->hasVideo && lastPicture_) {
     // The picture current at the start opens the clip.
     recording->held = recording->padded ? lastPicture_ : lastI420_;
-    recording->firstDeviceTime = lastPictureTime_;
-    recording->firstReadAt = lastPictureReadAt_;
+    recording->slots.open(lastPictureTime_, recording->sinceStart(lastPictureReadAt_), recording->frameDuration);
   }
   // The microphone's last buffer may hold sound from after the start.
   if (recording->hasAudio && lastSound_->nb_samples > 0 && state_->audio && state_->audio->input)
@@ -554,22 +555,6 @@ void EngineThread::deliverVideo(AVFrame* frame, int64_t pts, AVRational timeBase
   for (Recording* recording : recordings()) recordPicture(*recording, sample.Get(), i420.Get(), time, readAt);
 }
 
-// Where a picture goes in its clip: its device time, which is steadier than the moments reads
-// return, counted from the clip's first picture, placed by when that one was read, and never
-// after its own read (a first picture read late would push the rest past the stop), on the grid of
-// the device's frame rate: the nearest slot that is not after the read. Tools that take the clip
-// for constant-rate then find at most one picture a slot, however the reads jitter on a busy
-// machine. The first picture itself is shown from the start.
-LONGLONG clipTime(const Recording& recording, LONGLONG deviceTime, int64_t readAt) {
-  const LONGLONG read = (readAt - recording.startAt) * 10;
-  const LONGLONG time = std::min<LONGLONG>(
-      deviceTime - recording.firstDeviceTime + (recording.firstReadAt - recording.startAt) * 10, read);
-  const LONGLONG slot = recording.frameDuration;
-  if (slot <= 0 || time < 0) return time;
-  const LONGLONG nearest = (time + slot / 2) / slot * slot;
-  return nearest > read ? nearest - slot : nearest;
-}
-
 // A picture read before the clip's start (it waited behind a command) replaces the opening one;
 // from then on each picture writes the one before it, now that its length is known.
 void EngineThread::recordPicture(Recording& recording, IMFSample* bgra, IMFSample* i420, LONGLONG deviceTime,
@@ -585,11 +570,10 @@ void EngineThread::recordPicture(Recording& recording, IMFSample* bgra, IMFSampl
   if (!recording.held || readAt < recording.startAt) {
     recording.held = ComPtr<IMFSample>(picture);
     recording.heldTime = 0;
-    recording.firstDeviceTime = deviceTime;
-    recording.firstReadAt = readAt;
+    recording.slots.open(deviceTime, recording.sinceStart(readAt), recording.frameDuration);
     return;
   }
-  LONGLONG time = clipTime(recording, deviceTime, readAt);
+  LONGLONG time = recording.slots.place(deviceTime, recording.sinceStart(readAt), recording.frameDuration);
   if (time == recording.heldTime) {  // a later picture in the held one's slot takes its place
     recording.held = ComPtr<IMFSample>(picture);
     return;
@@ -755,16 +739,15 @@ void EngineThread::passThrough(Recording& recording, const AVPacket* packet, AVR
     // The first key frame opens the clip, even one that came after the stop.
     recording.held = sample;
     recording.heldTime = 0;
-    recording.firstDeviceTime = deviceTime;
-    recording.firstReadAt = readAt;
     recording.frameDuration = duration;
+    recording.timed = deviceTime != AV_NOPTS_VALUE;
+    if (recording.timed) recording.slots.open(deviceTime, recording.sinceStart(readAt), duration);
     recording.videoDone = late;
     return;
   }
   LONGLONG time = recording.heldTime + recording.frameDuration;  // no time of its own: the packets follow one another
-  if (deviceTime != AV_NOPTS_VALUE && recording.firstDeviceTime != AV_NOPTS_VALUE &&
-      clipTime(recording, deviceTime, readAt) > recording.heldTime)
-    time = clipTime(recording, deviceTime, readAt);
+  if (deviceTime != AV_NOPTS_VALUE && recording.timed)
+    time = std::max(time, recording.slots.place(deviceTime, recording.sinceStart(readAt), recording.frameDuration));
   writeHeld(recording, time - recording.heldTime);
   recording.held = sample;
   recording.heldTime = time;
