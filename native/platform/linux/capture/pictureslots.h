@@ -20,7 +20,7 @@ class PictureSlots {
 
  private:
   int64_t firstDeviceTime_ = 0;
-  int64_t origin_ = 0;  // the first picture's slot
+  int64_t origin_ = 0;  // the first picture's slot, moved back when reads show it was read late
 };
 
 }  // namespace platform::pictureslots
