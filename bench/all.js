@@ -113,22 +113,22 @@ async function main() {
 
     const theirs = Object.fromEntries(Object.keys(ours).map((k) => [k, path.join(dir, `ffmpeg-${k}.mp4`)]));
     const micRate = Math.round(ourFiles.microphone.bitRate / 1000) || 192;
-    const commands = [
-      ['-f', 'x11grab', '-framerate', '30', '-video_size', '1920x1080', '-i', `${desktop.env.DISPLAY}+0,0`,
+    const commands = {
+      display: ['-f', 'x11grab', '-framerate', '30', '-video_size', '1920x1080', '-i', `${desktop.env.DISPLAY}+0,0`,
         '-t', String(seconds), ...DISPLAY_X264, theirs.display],
-      ['-re', '-f', 'lavfi', '-i', `${CAMERA},format=yuyv422`, '-t', String(seconds), ...CAMERA_X264, theirs.camera],
-      ['-f', 'pulse', '-i', 'tavio_speakers.monitor', '-t', String(seconds), '-c:a', 'aac', '-b:a', '192k', theirs.speakers],
-      ['-f', 'pulse', '-i', 'tavio_mic', '-t', String(seconds), '-c:a', 'aac', '-b:a', `${micRate}k`, theirs.microphone],
-    ];
+      camera: ['-re', '-f', 'lavfi', '-i', `${CAMERA},format=yuyv422`, '-t', String(seconds), ...CAMERA_X264, theirs.camera],
+      speakers: ['-f', 'pulse', '-i', 'tavio_speakers.monitor', '-t', String(seconds), '-c:a', 'aac', '-b:a', '192k', theirs.speakers],
+      microphone: ['-f', 'pulse', '-i', 'tavio_mic', '-t', String(seconds), '-c:a', 'aac', '-b:a', `${micRate}k`, theirs.microphone],
+    };
     const quote = (a) => `'${a.replace(/'/g, "'\\''")}'`;
     // Each process in a subshell whose `times` gives that process's user and system time.
-    const script = commands.map((c, i) => `(ffmpeg -nostdin -v error -y ${c.map(quote).join(' ')}; times > ` +
-      `${quote(path.join(dir, `times-${i}`))}) &`).join('\n') + '\nwait';
+    const script = Object.entries(commands).map(([kind, c]) => `(ffmpeg -nostdin -v error -y ` +
+      `${c.map(quote).join(' ')}; times > ${quote(path.join(dir, `times-${kind}`))}) &`).join('\n') + '\nwait';
     const ffmpeg = spawnSync('bash', ['-c', script], { env, encoding: 'utf8' });
     if (ffmpeg.status !== 0) throw new Error(`ffmpeg failed: ${ffmpeg.stderr}`);
     // The second line of `times`: the children's user and system times.
-    const theirBySource = Object.fromEntries(Object.keys(ours).map((kind, i) => {
-      const m = fs.readFileSync(path.join(dir, `times-${i}`), 'utf8').trim().split('\n').pop()
+    const theirBySource = Object.fromEntries(Object.keys(commands).map((kind) => {
+      const m = fs.readFileSync(path.join(dir, `times-${kind}`), 'utf8').trim().split('\n').pop()
         .match(/(\d+)m([\d.]+)s (\d+)m([\d.]+)s/);
       return [kind, Number(m[1]) * 60 + Number(m[2]) + Number(m[3]) * 60 + Number(m[4])];
     }));

@@ -126,8 +126,7 @@ struct Recording {
   // The last picture, written when the next one shows how long it lasted.
   ComPtr<IMFSample> held;
   LONGLONG heldTime = 0;
-  pictureslots::PictureSlots slots;  // from the clip's first picture
-  bool timed = false;                // whether that picture had a device time
+  pictureslots::PictureSlots slots;  // opened by the clip's first picture that has a device time
   bool videoDone = false;            // a picture from after the stop has come
   SwrContext* resampler = nullptr;
   int audioRate = 0;
@@ -740,13 +739,12 @@ void EngineThread::passThrough(Recording& recording, const AVPacket* packet, AVR
     recording.held = sample;
     recording.heldTime = 0;
     recording.frameDuration = duration;
-    recording.timed = deviceTime != AV_NOPTS_VALUE;
-    if (recording.timed) recording.slots.open(deviceTime, recording.sinceStart(readAt), duration);
+    if (deviceTime != AV_NOPTS_VALUE) recording.slots.open(deviceTime, recording.sinceStart(readAt), duration);
     recording.videoDone = late;
     return;
   }
   LONGLONG time = recording.heldTime + recording.frameDuration;  // no time of its own: the packets follow one another
-  if (deviceTime != AV_NOPTS_VALUE && recording.timed)
+  if (deviceTime != AV_NOPTS_VALUE && recording.slots.opened())
     time = std::max(time, recording.slots.place(deviceTime, recording.sinceStart(readAt), recording.frameDuration));
   writeHeld(recording, time - recording.heldTime);
   recording.held = sample;

@@ -12,6 +12,7 @@ int64_t floorDiv(int64_t a, int64_t b) { return a / b - (a % b < 0 ? 1 : 0); }
 }  // namespace
 
 void PictureSlots::open(int64_t deviceTime, int64_t readTime, int64_t slot) {
+  opened_ = true;
   firstDeviceTime_ = deviceTime;
   origin_ = slot > 0 ? floorDiv(readTime, slot) * slot : readTime;
 }

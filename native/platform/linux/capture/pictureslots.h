@@ -13,12 +13,14 @@ class PictureSlots {
  public:
   // The clip's first picture, shown from the start: its device time and when it was read.
   void open(int64_t deviceTime, int64_t readTime, int64_t slot);
+  bool opened() const { return opened_; }
   // The start of a later picture's slot, on a grid of `slot`-long slots from the clip's start:
   // the device's frames since the first picture, counted on from the first picture's slot. Never
   // before the start, and never more than half a slot after the picture's read.
   int64_t place(int64_t deviceTime, int64_t readTime, int64_t slot);
 
  private:
+  bool opened_ = false;
   int64_t firstDeviceTime_ = 0;
   int64_t origin_ = 0;  // the first picture's slot, moved back when reads show it was read late
 };
