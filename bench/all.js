@@ -13,6 +13,10 @@
 // one's `times`). Per source, the add-on's threads (by name) are set against the ffmpeg process of
 // that source. Frames and durations come from ffprobe; resident memory is read at 10 s and at the
 // end.
+// A floor is printed as well: the four encoders alone (libx264 twice, AAC twice) on the same sources
+// with the same settings, each fed raw pictures or samples through a pipe by an ffmpeg that grabs
+// and converts them; only the encoding processes are counted, pipe reads included. Both sides pay
+// this much; what is left over is capture, conversion, previews and file writing.
 //   node bench/all.js [seconds=60]
 const { spawn, spawnSync, execFileSync } = require('child_process');
 const fs = require('fs');
@@ -120,19 +124,30 @@ async function main() {
       speakers: ['-f', 'pulse', '-i', 'tavio_speakers.monitor', '-t', String(seconds), '-c:a', 'aac', '-b:a', '192k', theirs.speakers],
       microphone: ['-f', 'pulse', '-i', 'tavio_mic', '-t', String(seconds), '-c:a', 'aac', '-b:a', `${micRate}k`, theirs.microphone],
     };
-    const quote = (a) => `'${a.replace(/'/g, "'\\''")}'`;
-    // Each process in a subshell whose `times` gives that process's user and system time.
-    const script = Object.entries(commands).map(([kind, c]) => `(ffmpeg -nostdin -v error -y ` +
-      `${c.map(quote).join(' ')}; times > ${quote(path.join(dir, `times-${kind}`))}) &`).join('\n') + '\nwait';
-    const ffmpeg = spawnSync('bash', ['-c', script], { env, encoding: 'utf8' });
-    if (ffmpeg.status !== 0) throw new Error(`ffmpeg failed: ${ffmpeg.stderr}`);
-    // The second line of `times`: the children's user and system times.
-    const theirBySource = Object.fromEntries(Object.keys(commands).map((kind) => {
-      const m = fs.readFileSync(path.join(dir, `times-${kind}`), 'utf8').trim().split('\n').pop()
-        .match(/(\d+)m([\d.]+)s (\d+)m([\d.]+)s/);
-      return [kind, Number(m[1]) * 60 + Number(m[2]) + Number(m[3]) * 60 + Number(m[4])];
-    }));
+    const theirBySource = runFfmpeg(dir, 'times', env, Object.fromEntries(Object.entries(commands).map(([kind, c]) =>
+      [kind, { counted: c }])));
     const theirCpu = Object.values(theirBySource).reduce((a, b) => a + b, 0);
+
+    const raw = (kind) => path.join(dir, `encoder-${kind}.mp4`);
+    const grab = commands.display.slice(0, commands.display.indexOf('-t') + 2);
+    const encoders = runFfmpeg(dir, 'encoder', env, {
+      display: {
+        feed: [...grab, '-pix_fmt', 'yuv420p', '-f', 'rawvideo', '-'],
+        counted: ['-f', 'rawvideo', '-pix_fmt', 'yuv420p', '-s', '1920x1080', '-r', '30', '-i', '-', ...DISPLAY_X264,
+          raw('display')],
+      },
+      camera: {
+        feed: ['-re', '-f', 'lavfi', '-i', `${CAMERA},format=yuyv422`, '-t', String(seconds), '-pix_fmt', 'yuv420p',
+          '-f', 'rawvideo', '-'],
+        counted: ['-f', 'rawvideo', '-pix_fmt', 'yuv420p', '-s', '1280x720', '-r', '30', '-i', '-', ...CAMERA_X264,
+          raw('camera')],
+      },
+      ...Object.fromEntries(['speakers', 'microphone'].map((kind) => [kind, {
+        feed: [...commands[kind].slice(0, 6), '-ac', '2', '-ar', '48000', '-f', 'f32le', '-'],
+        counted: ['-f', 'f32le', '-ac', '2', '-ar', '48000', '-i', '-', ...commands[kind].slice(6, -1), raw(kind)],
+      }])),
+    });
+    const encoderCpu = Object.values(encoders).reduce((a, b) => a + b, 0);
     const theirFiles = Object.fromEntries(Object.entries(theirs).map(([k, f]) => [k, probe(f)]));
 
     console.log(`${seconds} s of every source at once (the add-on's recording took ${wall.toFixed(1)} s of wall time)`);
@@ -152,6 +167,11 @@ async function main() {
     console.log(`CPU: ours ${cpu.toFixed(1)} s (${(100 * cpu / wall).toFixed(0)} % of a core, previews included), ` +
       `ffmpeg's four ${theirCpu.toFixed(1)} s (${(100 * theirCpu / seconds).toFixed(0)} %)`);
     console.log(`CPU, ours / ffmpeg: ${((cpu / wall) / (theirCpu / seconds)).toFixed(2)} (target <= 0.8)`);
+    const ourRest = cpu / wall * seconds - encoderCpu;
+    console.log(`  floor, the four encoders alone: ${encoderCpu.toFixed(1)} s (${(encoderCpu / theirCpu).toFixed(2)} of ` +
+      `ffmpeg's four: ${Object.entries(encoders).map(([k, c]) => `${k} ${c.toFixed(1)} s`).join(', ')}); ` +
+      `the rest: ours ${ourRest.toFixed(1)} s, ffmpeg ${(theirCpu - encoderCpu).toFixed(1)} s ` +
+      `(${(ourRest / (theirCpu - encoderCpu)).toFixed(2)})`);
     console.log(`  ours by thread name: ${threads.map(([n, c]) => `${n} ${c.toFixed(1)} s`).join(', ')}`);
     // Threads by source: encoders' threads carry the name of the thread that opened them. The
     // camera's engine and reader also serve its microphone; the previews run on Node's thread.
@@ -171,6 +191,24 @@ async function main() {
     desktop.stop();
     fs.rmSync(dir, { recursive: true, force: true });
   }
+}
+
+// Runs ffmpeg processes side by side and returns each one's CPU (user + system) in seconds: a
+// command's `counted` process, fed by its `feed` process through a pipe when it has one.
+function runFfmpeg(dir, name, env, commands) {
+  const quote = (a) => `'${a.replace(/'/g, "'\\''")}'`;
+  const ffmpeg = (args) => `ffmpeg -nostdin -v error -y ${args.map(quote).join(' ')}`;
+  const times = (kind) => path.join(dir, `${name}-${kind}`);
+  // Each counted process in a subshell whose `times` gives that process's user and system time.
+  const script = Object.entries(commands).map(([kind, { feed, counted }]) =>
+    `${feed ? `${ffmpeg(feed)} | ` : ''}(${ffmpeg(counted)}; times > ${quote(times(kind))}) &`).join('\n') + '\nwait';
+  const run = spawnSync('bash', ['-c', script], { env, encoding: 'utf8' });
+  if (run.status !== 0 || run.stderr.trim()) throw new Error(`ffmpeg failed: ${run.stderr}`);
+  // The second line of `times`: the children's user and system times.
+  return Object.fromEntries(Object.keys(commands).map((kind) => {
+    const m = fs.readFileSync(times(kind), 'utf8').trim().split('\n').pop().match(/(\d+)m([\d.]+)s (\d+)m([\d.]+)s/);
+    return [kind, Number(m[1]) * 60 + Number(m[2]) + Number(m[3]) * 60 + Number(m[4])];
+  }));
 }
 
 main().catch((e) => { console.error(e); process.exit(1); });
