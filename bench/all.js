@@ -126,28 +126,18 @@ async function main() {
     };
     const theirBySource = runFfmpeg(dir, 'times', env, Object.fromEntries(Object.entries(commands).map(([kind, c]) =>
       [kind, { counted: c }])));
-    const theirCpu = Object.values(theirBySource).reduce((a, b) => a + b, 0);
+    const theirCpu = total(theirBySource);
 
-    const raw = (kind) => path.join(dir, `encoder-${kind}.mp4`);
-    const grab = commands.display.slice(0, commands.display.indexOf('-t') + 2);
-    const encoders = runFfmpeg(dir, 'encoder', env, {
-      display: {
-        feed: [...grab, '-pix_fmt', 'yuv420p', '-f', 'rawvideo', '-'],
-        counted: ['-f', 'rawvideo', '-pix_fmt', 'yuv420p', '-s', '1920x1080', '-r', '30', '-i', '-', ...DISPLAY_X264,
-          raw('display')],
-      },
-      camera: {
-        feed: ['-re', '-f', 'lavfi', '-i', `${CAMERA},format=yuyv422`, '-t', String(seconds), '-pix_fmt', 'yuv420p',
-          '-f', 'rawvideo', '-'],
-        counted: ['-f', 'rawvideo', '-pix_fmt', 'yuv420p', '-s', '1280x720', '-r', '30', '-i', '-', ...CAMERA_X264,
-          raw('camera')],
-      },
-      ...Object.fromEntries(['speakers', 'microphone'].map((kind) => [kind, {
-        feed: [...commands[kind].slice(0, 6), '-ac', '2', '-ar', '48000', '-f', 'f32le', '-'],
-        counted: ['-f', 'f32le', '-ac', '2', '-ar', '48000', '-i', '-', ...commands[kind].slice(6, -1), raw(kind)],
-      }])),
-    });
-    const encoderCpu = Object.values(encoders).reduce((a, b) => a + b, 0);
+    // The same inputs and encoder settings, with raw pictures or samples between them.
+    const untilDuration = (c) => c.indexOf('-t') + 2;
+    const rawVideo = (size) => ['-f', 'rawvideo', '-pix_fmt', 'yuv420p', '-s', size, '-r', '30'];
+    const rawAudio = ['-f', 'f32le', '-ac', '2', '-ar', '48000'];
+    const raw = { display: rawVideo('1920x1080'), camera: rawVideo('1280x720'), speakers: rawAudio, microphone: rawAudio };
+    const encoders = runFfmpeg(dir, 'encoder', env, Object.fromEntries(Object.entries(commands).map(([kind, c]) => [kind, {
+      feed: [...c.slice(0, untilDuration(c)), ...raw[kind], '-'],
+      counted: [...raw[kind], '-i', '-', ...c.slice(untilDuration(c), -1), path.join(dir, `encoder-${kind}.mp4`)],
+    }])));
+    const encoderCpu = total(encoders);
     const theirFiles = Object.fromEntries(Object.entries(theirs).map(([k, f]) => [k, probe(f)]));
 
     console.log(`${seconds} s of every source at once (the add-on's recording took ${wall.toFixed(1)} s of wall time)`);
@@ -192,6 +182,8 @@ async function main() {
     fs.rmSync(dir, { recursive: true, force: true });
   }
 }
+
+const total = (bySource) => Object.values(bySource).reduce((a, b) => a + b, 0);
 
 // Runs ffmpeg processes side by side and returns each one's CPU (user + system) in seconds: a
 // command's `counted` process, fed by its `feed` process through a pipe when it has one.
