@@ -111,6 +111,26 @@ test('cameras and capture-device microphones', async (t) => {
     }
   });
 
+  await t.test('a clip inside the microphone\'s first lump of sound lasts from its start to its stop', async () => {
+    // The sound server's first lump can come stamped as if it were captured from its arrival on;
+    // a clip that starts inside it must not take the rest of the lump, up to two seconds ahead.
+    // Only a new stream's first lump is at stake, and only some come so: a dozen processes, each
+    // connecting anew (without the test cameras, which only slow the start).
+    for (let run = 0; run < 12; run++) {
+      const file = path.join(dir, `first-lump-${run}.mp4`);
+      const { code } = await runAddon(`
+        addon.initialize();
+        const microphone = events.find((e) => e.source.type === 'mfce_audio').source.id;
+        await sleep(300);
+        addon.startCapture(microphone, ${JSON.stringify(file)});
+        addon.stopCapture(microphone);
+      `, { env: desktop.env });
+      assert.strictEqual(code, 0);
+      const duration = Number(probe(file).format.duration);
+      assert.ok(duration < 0.06, `run ${run}: ${duration} s for a clip stopped at once`);
+    }
+  });
+
   await t.test('the picture is upright in the preview and in the recorded file', async () => {
     // A red band across the top 60 rows of a blue 320x240 picture: an upside-down frame puts it at the bottom.
     const banner = 'Banner=color=c=blue:size=320x240:rate=30,drawbox=x=0:y=0:w=320:h=60:color=red:t=fill';

@@ -161,7 +161,7 @@ class EngineThread {
   void passThrough(Recording& recording, const AVPacket* packet, AVRational timeBase, int64_t readAt);
   static IMFMediaBuffer* pooledBuffer(std::vector<ComPtr<IMFMediaBuffer>>& pool, DWORD length);
   void deliverVideo(AVFrame* frame, int64_t pts, AVRational timeBase, int64_t readAt);
-  void deliverAudio(AVFrame* frame, int64_t pts, AVRational timeBase);
+  void deliverAudio(AVFrame* frame, int64_t pts, AVRational timeBase, int64_t readAt);
   void recordPicture(Recording& recording, IMFSample* bgra, IMFSample* i420, LONGLONG deviceTime, int64_t readAt);
   void writeHeld(Recording& recording, LONGLONG duration);
   void recordSound(Recording& recording, AVFrame* frame, int64_t capturedAt);
@@ -188,6 +188,7 @@ class EngineThread {
   LONGLONG lastPictureTime_ = 0;
   int64_t lastPictureReadAt_ = 0;
   AVFrame* lastSound_ = nullptr;       // the microphone's last buffer
+  int64_t lastSoundAt_ = 0;            // when its first sample was captured (wall clock, µs)
   std::deque<int64_t> soundArrivals_;  // when its buffers were read (wall clock, µs), oldest first
 };
 
@@ -363,8 +364,7 @@ HRESULT EngineThread::startRecording(const Order& order) {
   }
   // The microphone's last buffer may hold sound from after the start.
   if (recording->hasAudio && lastSound_->nb_samples > 0 && state_->audio && state_->audio->input)
-    recordSound(*recording, lastSound_,
-                av_rescale_q(timeOf(lastSound_), state_->audio->input->timeBase, AVRational{1, 1000000}));
+    recordSound(*recording, lastSound_, lastSoundAt_);
   current_ = std::move(recording);
   return S_OK;
 }
@@ -608,18 +608,25 @@ void EngineThread::writeHeld(Recording& recording, LONGLONG duration) {
   write(recording, recording.videoStream, sample.Get());
 }
 
-void EngineThread::deliverAudio(AVFrame* frame, int64_t pts, AVRational timeBase) {
+void EngineThread::deliverAudio(AVFrame* frame, int64_t pts, AVRational timeBase, int64_t readAt) {
   const DeviceFormat& f = state_->audio->current;
   const int channels = frame->ch_layout.nb_channels;
   const bool interleaved16 = frame->format == AV_SAMPLE_FMT_S16;
   const DWORD length = static_cast<DWORD>(frame->nb_samples * channels * 2);
   const LONGLONG duration = av_rescale(frame->nb_samples, ticksPerSecond, f.sampleRate);
 
+  // The pulse input stamps a packet with the wall clock (µs) of its first sample, from the stream's
+  // latency. A new stream's first packet has come stamped as if captured from its arrival on
+  // (PulseAudio's sine source: a two-second lump ahead of the clock); sound cannot end after it
+  // was read.
+  const int64_t span = frame->sample_rate > 0 ? av_rescale(frame->nb_samples, 1000000, frame->sample_rate) : 0;
+  const int64_t capturedAt = pts == AV_NOPTS_VALUE
+                                 ? readAt - span
+                                 : std::min(av_rescale_q(pts, timeBase, AVRational{1, 1000000}), readAt - span);
   // Kept for a clip that starts while this buffer's sound is still current.
   av_frame_unref(lastSound_);
   av_frame_ref(lastSound_, frame);
-  // The pulse input stamps a packet with the wall clock (µs) of its first sample.
-  const int64_t capturedAt = av_rescale_q(pts, timeBase, AVRational{1, 1000000});
+  lastSoundAt_ = capturedAt;
   for (Recording* recording : recordings()) recordSound(*recording, frame, capturedAt);
 
   if (interleaved16) {
@@ -769,7 +776,7 @@ void EngineThread::receive(Device& device, AVPacket* packet, int64_t readAt) {
     if (device.video)
       deliverVideo(frame_, pts, input.timeBase, readAt);
     else
-      deliverAudio(frame_, pts, input.timeBase);
+      deliverAudio(frame_, pts, input.timeBase, readAt);
     av_frame_unref(frame_);
   }
 }
