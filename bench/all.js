@@ -24,6 +24,7 @@ const os = require('os');
 const path = require('path');
 const { startDesktop, playTone } = require('../scripts/desktop');
 const { distinct } = require('./pictures');
+const { runFfmpeg } = require('./ffmpegcpu');
 const { runAddon, root } = require('../test/js/addon');
 
 const seconds = Number(process.argv[2] || 60);
@@ -124,8 +125,8 @@ async function main() {
       speakers: ['-f', 'pulse', '-i', 'tavio_speakers.monitor', '-t', String(seconds), '-c:a', 'aac', '-b:a', '192k', theirs.speakers],
       microphone: ['-f', 'pulse', '-i', 'tavio_mic', '-t', String(seconds), '-c:a', 'aac', '-b:a', `${micRate}k`, theirs.microphone],
     };
-    const theirBySource = runFfmpeg(dir, 'times', env, Object.fromEntries(Object.entries(commands).map(([kind, c]) =>
-      [kind, { counted: c }])));
+    const counted = Object.fromEntries(Object.entries(commands).map(([kind, c]) => [kind, { counted: c }]));
+    const theirBySource = runFfmpeg(dir, counted, env);
     const theirCpu = total(theirBySource);
 
     // The same inputs and encoder settings, with raw pictures or samples between them.
@@ -133,10 +134,10 @@ async function main() {
     const rawVideo = (size) => ['-f', 'rawvideo', '-pix_fmt', 'yuv420p', '-s', size, '-r', '30'];
     const rawAudio = ['-f', 'f32le', '-ac', '2', '-ar', '48000'];
     const raw = { display: rawVideo('1920x1080'), camera: rawVideo('1280x720'), speakers: rawAudio, microphone: rawAudio };
-    const encoders = runFfmpeg(dir, 'encoder', env, Object.fromEntries(Object.entries(commands).map(([kind, c]) => [kind, {
+    const encoders = runFfmpeg(dir, Object.fromEntries(Object.entries(commands).map(([kind, c]) => [kind, {
       feed: [...c.slice(0, untilDuration(c)), ...raw[kind], '-'],
       counted: [...raw[kind], '-i', '-', ...c.slice(untilDuration(c), -1), path.join(dir, `encoder-${kind}.mp4`)],
-    }])));
+    }])), env);
     const encoderCpu = total(encoders);
     const theirFiles = Object.fromEntries(Object.entries(theirs).map(([k, f]) => [k, probe(f)]));
 
@@ -184,23 +185,5 @@ async function main() {
 }
 
 const total = (bySource) => Object.values(bySource).reduce((a, b) => a + b, 0);
-
-// Runs ffmpeg processes side by side and returns each one's CPU (user + system) in seconds: a
-// command's `counted` process, fed by its `feed` process through a pipe when it has one.
-function runFfmpeg(dir, name, env, commands) {
-  const quote = (a) => `'${a.replace(/'/g, "'\\''")}'`;
-  const ffmpeg = (args) => `ffmpeg -nostdin -v error -y ${args.map(quote).join(' ')}`;
-  const times = (kind) => path.join(dir, `${name}-${kind}`);
-  // Each counted process in a subshell whose `times` gives that process's user and system time.
-  const script = Object.entries(commands).map(([kind, { feed, counted }]) =>
-    `${feed ? `${ffmpeg(feed)} | ` : ''}(${ffmpeg(counted)}; times > ${quote(times(kind))}) &`).join('\n') + '\nwait';
-  const run = spawnSync('bash', ['-c', script], { env, encoding: 'utf8' });
-  if (run.status !== 0 || run.stderr.trim()) throw new Error(`ffmpeg failed: ${run.stderr}`);
-  // The second line of `times`: the children's user and system times.
-  return Object.fromEntries(Object.keys(commands).map((kind) => {
-    const m = fs.readFileSync(times(kind), 'utf8').trim().split('\n').pop().match(/(\d+)m([\d.]+)s (\d+)m([\d.]+)s/);
-    return [kind, Number(m[1]) * 60 + Number(m[2]) + Number(m[3]) * 60 + Number(m[4])];
-  }));
-}
 
 main().catch((e) => { console.error(e); process.exit(1); });

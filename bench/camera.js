@@ -27,6 +27,7 @@ const path = require('path');
 const { startDesktop } = require('../scripts/desktop');
 const { runAddon } = require('../test/js/addon');
 const { CLOCK, CLOCK_READER } = require('./clockcamera');
+const { ffmpegCpu } = require('./ffmpegcpu');
 
 const seconds = Number(process.argv[2] || 20);
 const SOURCE = 'testsrc2=size=1280x720:rate=30';
@@ -39,15 +40,6 @@ function stream(file) {
   const r = spawnSync('ffprobe', ['-v', 'error', '-select_streams', 'v:0', '-count_packets', '-show_entries',
     'stream=nb_read_packets,profile,bit_rate,width,height', '-of', 'json', file], { encoding: 'utf8' });
   return JSON.parse(r.stdout).streams[0];
-}
-
-// CPU seconds of an ffmpeg run: `times` prints the shell's and then its children's user and system times.
-function ffmpegCpu(args) {
-  const quoted = args.map((a) => `'${a.replace(/'/g, "'\\''")}'`).join(' ');
-  const run = spawnSync('bash', ['-c', `ffmpeg -v error -y ${quoted} && times`], { encoding: 'utf8' });
-  if (run.status !== 0) throw new Error(`ffmpeg failed: ${run.stderr}`);
-  const m = run.stdout.trim().split('\n').pop().match(/(\d+)m([\d.]+)s (\d+)m([\d.]+)s/);
-  return Number(m[1]) * 60 + Number(m[2]) + Number(m[3]) * 60 + Number(m[4]);
 }
 
 const CHILD_HELPERS = `
@@ -114,8 +106,8 @@ async function main() {
 
     const theirs = path.join(dir, 'ffmpeg.mp4');
     const input = ['-re', '-f', 'lavfi', '-i', DELIVERED, '-frames:v', String(frames)];
-    const theirCpu = ffmpegCpu([...input, ...X264, theirs]);
-    const theirBase = ffmpegCpu([...input, '-f', 'null', '-']);
+    const theirCpu = ffmpegCpu(dir, [...input, ...X264, theirs]);
+    const theirBase = ffmpegCpu(dir, [...input, '-f', 'null', '-']);
     const theirStream = stream(theirs);
     const theirFrames = Number(theirStream.nb_read_packets);
     const baseRate = theirBase / (frames / 30);

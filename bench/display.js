@@ -16,6 +16,7 @@ const os = require('os');
 const path = require('path');
 const { startDesktop } = require('../scripts/desktop');
 const { distinct } = require('./pictures');
+const { ffmpegCpu } = require('./ffmpegcpu');
 const { runAddon, root } = require('../test/js/addon');
 
 const seconds = Number(process.argv.slice(2).find((a) => /^\d+$/.test(a)) || 20);
@@ -73,12 +74,9 @@ async function main() {
     const ourStream = frames(ours);
 
     const theirs = path.join(dir, 'ffmpeg.mp4');
-    const run = spawnSync('bash', ['-c', `ffmpeg -v error -y -f x11grab -framerate 30 -video_size 1920x1080 -i "$DISPLAY+0,0" ` +
-      `-t ${seconds} -c:v libx264 -preset superfast -tune zerolatency -profile:v main -b:v 10485760 ` +
-      `-pix_fmt yuv420p "${theirs}" && times`], { env, encoding: 'utf8' });
-    // `times` prints the shell's and then its children's user and system times.
-    const children = run.stdout.trim().split('\n').pop().match(/(\d+)m([\d.]+)s (\d+)m([\d.]+)s/);
-    const theirCpu = Number(children[1]) * 60 + Number(children[2]) + Number(children[3]) * 60 + Number(children[4]);
+    const theirCpu = ffmpegCpu(dir, ['-f', 'x11grab', '-framerate', '30', '-video_size', '1920x1080', '-i',
+      `${env.DISPLAY}+0,0`, '-t', String(seconds), '-c:v', 'libx264', '-preset', 'superfast', '-tune', 'zerolatency',
+      '-profile:v', 'main', '-b:v', '10485760', '-pix_fmt', 'yuv420p', theirs], env);
     const theirStream = frames(theirs);
 
     const ourFrames = Number(ourStream.nb_read_packets);

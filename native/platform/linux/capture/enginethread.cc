@@ -620,9 +620,8 @@ void EngineThread::deliverAudio(AVFrame* frame, int64_t pts, AVRational timeBase
   // (PulseAudio's sine source: a two-second lump ahead of the clock); sound cannot end after it
   // was read.
   const int64_t span = frame->sample_rate > 0 ? av_rescale(frame->nb_samples, 1000000, frame->sample_rate) : 0;
-  const int64_t capturedAt = pts == AV_NOPTS_VALUE
-                                 ? readAt - span
-                                 : std::min(av_rescale_q(pts, timeBase, AVRational{1, 1000000}), readAt - span);
+  const int64_t stamped = pts == AV_NOPTS_VALUE ? INT64_MAX : av_rescale_q(pts, timeBase, AVRational{1, 1000000});
+  const int64_t capturedAt = std::min(stamped, readAt - span);
   // Kept for a clip that starts while this buffer's sound is still current.
   av_frame_unref(lastSound_);
   av_frame_ref(lastSound_, frame);
@@ -641,8 +640,8 @@ void EngineThread::deliverAudio(AVFrame* frame, int64_t pts, AVRational timeBase
     if (previewing && !callbacks.empty()) {
       ComPtr<IMFSample> sample;
       if (SUCCEEDED(makeSample(
-              length, av_rescale_q(pts, timeBase, AVRational{1, static_cast<int>(ticksPerSecond)}), duration,
-              [&](BYTE* data) { std::memcpy(data, frame->data[0], length); }, sample.GetAddressOf())))
+              length, capturedAt * 10, duration, [&](BYTE* data) { std::memcpy(data, frame->data[0], length); },
+              sample.GetAddressOf())))
         for (auto& callback : callbacks) callback->OnSample(sample.Get());
     }
   }
