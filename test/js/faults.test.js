@@ -170,6 +170,10 @@ async function faultCase({ folder, broken, fault, repair, desktopOptions = DESKT
       assert.ok(probe(file) >= 1.8, `${type} clip after recovery: ${probe(file)} s`);
     }
     assert.ok(peaks.left > 0.3, `the endpoint hears the tone again: ${JSON.stringify(peaks)}`);
+  } catch (error) {
+    // What the host printed tells a failure on a slow machine from a fault of the add-on.
+    error.message += `\nthe host printed:\n${host.output()}`;
+    throw error;
   } finally {
     host.child.kill('SIGKILL');
     helpers.forEach((h) => h.kill('SIGKILL'));
