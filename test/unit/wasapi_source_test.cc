@@ -318,15 +318,56 @@ TEST_F(WasapiSource, ClipsWithoutAGapSplitAPacketBetweenThem) {
   EXPECT_EQ(encoders[1]->finalized, 0);
 }
 
+// The endpoint delivers nothing more after the first clip's packet, and nothing at all in the
+// second clip. Neither may stay open, and each lasts as long as it ran: the sound that never came
+// is silence.
 TEST_F(WasapiSource, AStoppedClipThatNoPacketReachesIsFinishedAnyway) {
   startCapture();
+  const UINT64 firstStart = clockNow();
   source->startEncode("quiet.mp4");
-  feed(floats(tone(480), clockNow()));
+  const UINT64 packetAt = clockNow();
+  feed(floats(tone(480), packetAt));
+  std::this_thread::sleep_for(std::chrono::milliseconds(40));
+  const UINT64 secondStart = clockNow();
+  source->startEncode("silent.mp4");
+  const UINT64 secondStarted = clockNow();
+  std::this_thread::sleep_for(std::chrono::milliseconds(50));
+  const UINT64 secondStop = clockNow();
   source->stopEncode();
-  // The endpoint delivers nothing more; the clip must not stay open.
+  const UINT64 afterStop = clockNow();
   ASSERT_TRUE(finished(0));
-  std::lock_guard<std::mutex> lock(encoders[0]->mutex);
-  EXPECT_EQ(encoders[0]->writes.size(), 1u);
+  ASSERT_TRUE(finished(1));
+  const auto framesIn = [](UINT64 units) { return units * 48000 / 10000000; };
+  // Frames in all, and whether any but the first write holds sound.
+  const auto frames = [](fakes::EncoderLog& log, bool& soundAfterFirst) {
+    std::lock_guard<std::mutex> lock(log.mutex);
+    uint64_t all = 0;
+    soundAfterFirst = false;
+    for (size_t i = 0; i < log.writes.size(); ++i) {
+      all += log.writes[i].frames;
+      const auto& samples = log.writes[i].samples;
+      if (i > 0 && std::any_of(samples.begin(), samples.end(), [](float v) { return v != 0.0f; }))
+        soundAfterFirst = true;
+    }
+    return all;
+  };
+  bool sound = false;
+  const uint64_t first = frames(*encoders[0], sound);
+  EXPECT_FALSE(sound);
+  {
+    std::lock_guard<std::mutex> lock(encoders[0]->mutex);
+    EXPECT_EQ(encoders[0]->writes.front().samples.front(), 0.25f);  // the packet, then silence
+  }
+  EXPECT_GE(first + 1, framesIn(secondStart - packetAt));  // the file begins with its first packet
+  EXPECT_LE(first, framesIn(secondStarted - firstStart) + 1);
+  const uint64_t second = frames(*encoders[1], sound);
+  EXPECT_FALSE(sound);
+  {
+    std::lock_guard<std::mutex> lock(encoders[1]->mutex);
+    EXPECT_EQ(encoders[1]->writes.front().samples.front(), 0.0f);
+  }
+  EXPECT_GE(second + 1, framesIn(secondStop - secondStarted));
+  EXPECT_LE(second, framesIn(afterStop - secondStart));
 }
 
 // A clip begun while the endpoint is away is silence until its first packet, or up to its stop
@@ -351,6 +392,7 @@ TEST_F(WasapiSource, AClipBegunWhileTheEndpointIsAwayIsSilenceUntilItsFirstPacke
   }));
   const UINT64 packetTime = clockNow();
   feed(floats(tone(480), packetTime));
+  const UINT64 backStop = clockNow();
   source->stopEncode();
   feed(floats(tone(480), clockNow() + 100 * kMs));
   endCapture();
@@ -380,8 +422,15 @@ TEST_F(WasapiSource, AClipBegunWhileTheEndpointIsAwayIsSilenceUntilItsFirstPacke
   const uint64_t silence = leadingSilence(*encoders[1]);
   EXPECT_GE(silence + 1, framesIn(packetTime - backStart));
   EXPECT_LE(silence, framesIn(packetTime - awayStop));
-  ASSERT_FALSE(encoders[1]->writes.back().samples.empty());
-  EXPECT_EQ(encoders[1]->writes.back().samples[0], 0.25f);  // then the packet
+  // Then the packet, and silence up to the stop, which no packet reached.
+  const auto& writes = encoders[1]->writes;
+  const auto sound = std::find_if(writes.begin(), writes.end(),
+                                  [](const auto& write) { return !write.samples.empty() && write.samples[0] != 0; });
+  ASSERT_NE(sound, writes.end());
+  EXPECT_EQ(sound->samples[0], 0.25f);
+  uint64_t back = 0;
+  for (const auto& write : writes) back += write.frames;
+  EXPECT_GE(back + 2, framesIn(backStop - backStart));  // the two silences each rounded down to a frame
 }
 
 TEST_F(WasapiSource, SpecialAnswersOfGetBuffer) {

@@ -106,7 +106,7 @@ struct Source::Clip {
   const WAVEFORMATEXTENSIBLE* format = nullptr;  // the capture format the encoder takes
   uint64_t start = 0;                            // capture clock, 100 ns
   std::atomic<uint64_t> stop{0};                 // 0 while recording
-  bool written = false;                          // the capture thread only: a packet has reached it
+  uint64_t reached = 0;  // the capture thread only: where the sound written so far ends, 0 before any
 };
 
 // The silence thread's share of the source: it never ends, so it must not depend on the source.
@@ -243,13 +243,7 @@ void Source::startEncode(std::string filename) {
 }
 
 void Source::record(const BYTE* data, UINT32 frames, uint64_t begin, const WAVEFORMATEXTENSIBLE* captureFormat) {
-  {
-    std::lock_guard<std::mutex> hold(clipsLock);
-    while (!started.empty()) {
-      writing.push_back(std::move(started.front()));
-      started.pop_front();
-    }
-  }
+  takeStarted();
   const uint64_t rate = captureFormat->Format.nSamplesPerSec;
   const uint32_t blockAlign = captureFormat->Format.nBlockAlign;
   const uint64_t end = begin + frames * kUnitsPerSecond / rate;
@@ -267,10 +261,10 @@ void Source::record(const BYTE* data, UINT32 frames, uint64_t begin, const WAVEF
       const UINT32 first = frameAt(from), last = frameAt(to);
       if (last > first) {
         // A clip that began while its endpoint was away starts with silence up to its first packet.
-        if (!clip.written && from > clip.start + kLateFirstPacket) writeSilence(clip, from);
+        if (!clip.reached && from > clip.start + kLateFirstPacket) writeSilence(clip, clip.start, from);
         clip.encoder->write(data + static_cast<size_t>(first) * blockAlign, last - first, &captureFormat->Format,
                             static_cast<int64_t>(from - clip.start));
-        clip.written = true;
+        clip.reached = to;
       }
     }
     if (stop && end >= stop) {
@@ -282,7 +276,17 @@ void Source::record(const BYTE* data, UINT32 frames, uint64_t begin, const WAVEF
   }
 }
 
+void Source::takeStarted() {
+  std::lock_guard<std::mutex> hold(clipsLock);
+  while (!started.empty()) {
+    writing.push_back(std::move(started.front()));
+    started.pop_front();
+  }
+}
+
+// Also a clip that no packet has reached at all: an endpoint that plays nothing may deliver none.
 void Source::finishOverdue(uint64_t now) {
+  takeStarted();
   for (auto it = writing.begin(); it != writing.end();) {
     const uint64_t stop = (*it)->stop.load();
     if (stop && now > stop + kStopWait) {
@@ -298,43 +302,40 @@ void Source::finishOverdue(uint64_t now) {
 // printed and does not keep the others from finishing. After a failed try, a clip that nothing
 // has reached yet and that is still recording waits for the endpoint to come back.
 void Source::finishAll(bool failed) {
-  {
-    std::lock_guard<std::mutex> hold(clipsLock);
-    while (!started.empty()) {
-      writing.push_back(std::move(started.front()));
-      started.pop_front();
-    }
-  }
+  takeStarted();
   const uint64_t now = counterNow();
   for (auto it = writing.begin(); it != writing.end();) {
     Clip& clip = **it;
     const uint64_t stop = clip.stop.load();
-    if (failed && !clip.written && !stop) {
+    if (failed && !clip.reached && !stop) {
       ++it;
       continue;
     }
-    guarded([&] { finish(clip, stop ? stop : now); });
+    // A clip still recording ends where its sound does, or now if none reached it.
+    uint64_t end = stop ? stop : clip.reached;
+    if (!end) end = now;
+    guarded([&] { finish(clip, end); });
     it = writing.erase(it);
   }
 }
 
-// A clip that no packet reached (its endpoint was away all along) is silence up to its end, so
-// that it is a file of its length all the same.
+// Time the endpoint never delivered (it stalled, or was away all along) is silence up to the end,
+// so that the file lasts as long as the clip all the same.
 void Source::finish(Clip& clip, uint64_t end) {
-  if (!clip.written) writeSilence(clip, end);
+  writeSilence(clip, clip.reached ? clip.reached : clip.start, end);
   clip.encoder->finalize();
 }
 
-// Silence from the clip's start up to `until` on the capture clock, a tenth of a second at a time.
-void Source::writeSilence(Clip& clip, uint64_t until) {
+// Silence over [from, until) on the capture clock, a tenth of a second at a time.
+void Source::writeSilence(Clip& clip, uint64_t from, uint64_t until) {
   const WAVEFORMATEX& f = clip.format->Format;
   const bool unsigned8 = f.wBitsPerSample == 8 && clip.format->SubFormat == KSDATAFORMAT_SUBTYPE_PCM;
   const uint32_t chunk = std::max<uint32_t>(f.nSamplesPerSec / 10, 1);
   const std::vector<BYTE> zeros(static_cast<size_t>(chunk) * f.nBlockAlign, unsigned8 ? 0x80 : 0);
-  const uint64_t frames = until > clip.start ? (until - clip.start) * f.nSamplesPerSec / kUnitsPerSecond : 0;
+  const uint64_t frames = until > from ? (until - from) * f.nSamplesPerSec / kUnitsPerSecond : 0;
   for (uint64_t done = 0; done < frames; done += chunk)
     clip.encoder->write(zeros.data(), static_cast<uint32_t>(std::min<uint64_t>(chunk, frames - done)), &f,
-                        static_cast<int64_t>(done * kUnitsPerSecond / f.nSamplesPerSec));
+                        static_cast<int64_t>(from - clip.start + done * kUnitsPerSecond / f.nSamplesPerSec));
 }
 
 uint16_t Source::channels() {

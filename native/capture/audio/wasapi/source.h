@@ -55,9 +55,11 @@ class Source : public capture::audio::Source, public std::enable_shared_from_thi
   void record(const BYTE* data, UINT32 frames, uint64_t begin, const WAVEFORMATEXTENSIBLE* captureFormat);
   // Finishes the clips whose stop lies far enough behind without packets reaching it.
   void finishOverdue(uint64_t now);
+  // Moves the clips startEncode handed over into `writing`.
+  void takeStarted();
   void finishAll(bool failed);
   void finish(Clip& clip, uint64_t end);
-  void writeSilence(Clip& clip, uint64_t until);
+  void writeSilence(Clip& clip, uint64_t from, uint64_t until);
 
   ComPtr<IMMDevice> endpoint;
   // The newest capture thread's clients; each thread works with its own, and a later thread's
