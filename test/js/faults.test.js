@@ -111,7 +111,12 @@ function pulseArguments(dir) {
 function pulseEnv(dir) { return { ...process.env, HOME: dir, XDG_RUNTIME_DIR: dir }; }
 function pulsePid(dir) { return Number(fs.readFileSync(path.join(dir, 'pulse', 'pid'), 'utf8')); }
 async function restartPulse(dir, env) {
-  spawnSync('pulseaudio', pulseArguments(dir), { env: pulseEnv(dir) });
+  // The killed server can linger as a zombie until its parent (often init) reaps it, and a server
+  // whose pid file names a pid that still exists refuses to start ("Daemon already running").
+  // A zombie holds nothing else, so its pid file goes.
+  fs.rmSync(path.join(dir, 'pulse', 'pid'), { force: true });
+  const started = spawnSync('pulseaudio', pulseArguments(dir), { env: pulseEnv(dir), encoding: 'utf8' });
+  if (started.status !== 0) throw new Error(`pulseaudio did not start again: ${started.stderr}`);
   for (let i = 0; i < 100; i++) {
     if (spawnSync('pactl', ['info'], { env: { ...process.env, ...env } }).status === 0) return;
     await sleep(20);
