@@ -258,6 +258,17 @@ constexpr UINT64 kFrame = 10000000 / 48000;  // whole units per frame at 48 kHz,
 
 std::vector<float> tone(size_t frames) { return std::vector<float>(frames * 2, 0.25f); }
 
+// The frames of all of a clip's writes; the caller holds the log's lock.
+uint64_t framesOf(const fakes::EncoderLog& log) {
+  uint64_t frames = 0;
+  for (const auto& write : log.writes) frames += write.frames;
+  return frames;
+}
+
+bool silent(const fakes::EncoderLog::Write& write) {
+  return std::all_of(write.samples.begin(), write.samples.end(), [](float v) { return v == 0.0f; });
+}
+
 TEST_F(WasapiSource, AClipTakesTheFramesFromItsStartToItsStopTimedFromItsStart) {
   startCapture();
   feed(floats(tone(960), clockNow() - 200 * kMs));  // before the clip: nobody records it
@@ -308,10 +319,10 @@ TEST_F(WasapiSource, ClipsWithoutAGapSplitAPacketBetweenThem) {
   std::lock_guard<std::mutex> lock(encoders[1]->mutex);
   ASSERT_EQ(encoders[1]->writes.size(), 1u);
   EXPECT_EQ(encoders[1]->writes[0].time, 0);
-  UINT32 total = encoders[1]->writes[0].frames;
+  uint64_t total = encoders[1]->writes[0].frames;
   {
     std::lock_guard<std::mutex> firstLock(encoders[0]->mutex);
-    for (const auto& write : encoders[0]->writes) total += write.frames;
+    total += framesOf(*encoders[0]);
   }
   EXPECT_GE(total, 960u - (later - now) / kFrame - 2);  // nothing lost between the two
   EXPECT_LE(total, 960u);
@@ -338,34 +349,20 @@ TEST_F(WasapiSource, AStoppedClipThatNoPacketReachesIsFinishedAnyway) {
   ASSERT_TRUE(finished(0));
   ASSERT_TRUE(finished(1));
   const auto framesIn = [](UINT64 units) { return units * 48000 / 10000000; };
-  // Frames in all, and whether any but the first write holds sound.
-  const auto frames = [](fakes::EncoderLog& log, bool& soundAfterFirst) {
-    std::lock_guard<std::mutex> lock(log.mutex);
-    uint64_t all = 0;
-    soundAfterFirst = false;
-    for (size_t i = 0; i < log.writes.size(); ++i) {
-      all += log.writes[i].frames;
-      const auto& samples = log.writes[i].samples;
-      if (i > 0 && std::any_of(samples.begin(), samples.end(), [](float v) { return v != 0.0f; }))
-        soundAfterFirst = true;
-    }
-    return all;
-  };
-  bool sound = false;
-  const uint64_t first = frames(*encoders[0], sound);
-  EXPECT_FALSE(sound);
   {
     std::lock_guard<std::mutex> lock(encoders[0]->mutex);
-    EXPECT_EQ(encoders[0]->writes.front().samples.front(), 0.25f);  // the packet, then silence
+    const auto& writes = encoders[0]->writes;
+    EXPECT_EQ(writes.front().samples.front(), 0.25f);  // the packet, then silence
+    EXPECT_TRUE(std::all_of(writes.begin() + 1, writes.end(), silent));
+    const uint64_t first = framesOf(*encoders[0]);
+    EXPECT_GE(first + 1, framesIn(secondStart - packetAt));  // the file begins with its first packet
+    EXPECT_LE(first, framesIn(secondStarted - firstStart) + 1);
   }
-  EXPECT_GE(first + 1, framesIn(secondStart - packetAt));  // the file begins with its first packet
-  EXPECT_LE(first, framesIn(secondStarted - firstStart) + 1);
-  const uint64_t second = frames(*encoders[1], sound);
-  EXPECT_FALSE(sound);
-  {
-    std::lock_guard<std::mutex> lock(encoders[1]->mutex);
-    EXPECT_EQ(encoders[1]->writes.front().samples.front(), 0.0f);
-  }
+  std::lock_guard<std::mutex> lock(encoders[1]->mutex);
+  const auto& writes = encoders[1]->writes;
+  EXPECT_EQ(writes.front().samples.front(), 0.0f);
+  EXPECT_TRUE(std::all_of(writes.begin() + 1, writes.end(), silent));
+  const uint64_t second = framesOf(*encoders[1]);
   EXPECT_GE(second + 1, framesIn(secondStop - secondStarted));
   EXPECT_LE(second, framesIn(afterStop - secondStart));
 }
@@ -402,7 +399,7 @@ TEST_F(WasapiSource, AClipBegunWhileTheEndpointIsAwayIsSilenceUntilItsFirstPacke
   auto leadingSilence = [](const fakes::EncoderLog& log) {
     uint64_t frames = 0;
     for (const auto& write : log.writes) {
-      if (std::any_of(write.samples.begin(), write.samples.end(), [](float v) { return v != 0; })) break;
+      if (!silent(write)) break;
       EXPECT_EQ(write.time, static_cast<int64_t>(frames * 10000000 / 48000));
       frames += write.frames;
     }
@@ -412,8 +409,7 @@ TEST_F(WasapiSource, AClipBegunWhileTheEndpointIsAwayIsSilenceUntilItsFirstPacke
   ASSERT_EQ(encoders.size(), 2u);
   std::lock_guard<std::mutex> lockAway(encoders[0]->mutex);
   EXPECT_EQ(encoders[0]->finalized, 1);
-  uint64_t all = 0;
-  for (const auto& write : encoders[0]->writes) all += write.frames;
+  const uint64_t all = framesOf(*encoders[0]);
   EXPECT_EQ(leadingSilence(*encoders[0]), all) << "silence only";
   EXPECT_GE(all, 4800u - 1);
   EXPECT_LE(all, framesIn(awayStop - awayStart));
@@ -428,9 +424,8 @@ TEST_F(WasapiSource, AClipBegunWhileTheEndpointIsAwayIsSilenceUntilItsFirstPacke
                                   [](const auto& write) { return !write.samples.empty() && write.samples[0] != 0; });
   ASSERT_NE(sound, writes.end());
   EXPECT_EQ(sound->samples[0], 0.25f);
-  uint64_t back = 0;
-  for (const auto& write : writes) back += write.frames;
-  EXPECT_GE(back + 2, framesIn(backStop - backStart));  // the two silences each rounded down to a frame
+  EXPECT_GE(framesOf(*encoders[1]) + 2,
+            framesIn(backStop - backStart));  // the two silences each rounded down to a frame
 }
 
 TEST_F(WasapiSource, SpecialAnswersOfGetBuffer) {

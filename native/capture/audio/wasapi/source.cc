@@ -106,7 +106,8 @@ struct Source::Clip {
   const WAVEFORMATEXTENSIBLE* format = nullptr;  // the capture format the encoder takes
   uint64_t start = 0;                            // capture clock, 100 ns
   std::atomic<uint64_t> stop{0};                 // 0 while recording
-  uint64_t reached = 0;  // the capture thread only: where the sound written so far ends, 0 before any
+  uint64_t reached = 0;  // where the sound written so far ends (its start before any); the capture thread only
+  bool written() const { return reached > start; }
 };
 
 // The silence thread's share of the source: it never ends, so it must not depend on the source.
@@ -232,7 +233,7 @@ void Source::startEncode(std::string filename) {
   clip->unfinished = unfinished.hold();
   clip->format = format.load();
   clip->encoder.reset(makeEncoder(filename, clip->format));
-  clip->start = counterNow();
+  clip->start = clip->reached = counterNow();
   // A clip still recording ends where the new one begins.
   if (latest) latest->stop.store(clip->start);
   latest = clip;
@@ -261,7 +262,7 @@ void Source::record(const BYTE* data, UINT32 frames, uint64_t begin, const WAVEF
       const UINT32 first = frameAt(from), last = frameAt(to);
       if (last > first) {
         // A clip that began while its endpoint was away starts with silence up to its first packet.
-        if (!clip.reached && from > clip.start + kLateFirstPacket) writeSilence(clip, clip.start, from);
+        if (!clip.written() && from > clip.start + kLateFirstPacket) writeSilence(clip, clip.start, from);
         clip.encoder->write(data + static_cast<size_t>(first) * blockAlign, last - first, &captureFormat->Format,
                             static_cast<int64_t>(from - clip.start));
         clip.reached = to;
@@ -307,13 +308,13 @@ void Source::finishAll(bool failed) {
   for (auto it = writing.begin(); it != writing.end();) {
     Clip& clip = **it;
     const uint64_t stop = clip.stop.load();
-    if (failed && !clip.reached && !stop) {
+    if (failed && !clip.written() && !stop) {
       ++it;
       continue;
     }
     // A clip still recording ends where its sound does, or now if none reached it.
-    uint64_t end = stop ? stop : clip.reached;
-    if (!end) end = now;
+    uint64_t end = stop;
+    if (!end) end = clip.written() ? clip.reached : now;
     guarded([&] { finish(clip, end); });
     it = writing.erase(it);
   }
@@ -322,7 +323,7 @@ void Source::finishAll(bool failed) {
 // Time the endpoint never delivered (it stalled, or was away all along) is silence up to the end,
 // so that the file lasts as long as the clip all the same.
 void Source::finish(Clip& clip, uint64_t end) {
-  writeSilence(clip, clip.reached ? clip.reached : clip.start, end);
+  writeSilence(clip, clip.reached, end);
   clip.encoder->finalize();
 }
 
