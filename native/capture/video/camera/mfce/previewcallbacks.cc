@@ -5,6 +5,7 @@
 #include <cstring>
 
 #include "capture/clock.h"
+#include "capture/video/copy.h"
 #include "capture/video/camera/mfce/capturemanager.h"
 
 namespace capture::video::camera::mfce {
@@ -12,7 +13,7 @@ namespace capture::video::camera::mfce {
 void replaceFrame(capture::video::FrameQueue& queue, const uint8_t* pixels, int64_t timestamp) {
   // Copy before taking the lock: preview() holds it while it scales.
   std::unique_ptr<Frame> frame = Frame::make(queue.width, queue.height, queue.channelOrder, timestamp, queue.pixels);
-  std::memcpy(frame->data.get(), pixels, frame->size);
+  capture::video::copyPicture(frame->data.get(), pixels, frame->size);
   std::lock_guard<std::mutex> lock(queue.mutex);
   queue.frames.clear();
   queue.frames.push_back(std::move(frame));
