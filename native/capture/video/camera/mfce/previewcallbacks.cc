@@ -5,8 +5,8 @@
 #include <cstring>
 
 #include "capture/clock.h"
-#include "capture/video/copy.h"
 #include "capture/video/camera/mfce/capturemanager.h"
+#include "capture/video/copy.h"
 
 namespace capture::video::camera::mfce {
 
