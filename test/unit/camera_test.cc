@@ -309,16 +309,18 @@ TEST(CameraCaptureManager, EngineEventsSetFlagsAndSignalEveryTime) {
   EXPECT_TRUE(manager.previewing);  // an unreadable type changes nothing but still signals
   EXPECT_TRUE(signalled(manager.engineEvent));
 
-  // The error event tears the engine down; later operations find none.
+  // The error event ends preview and recording; the next operation tears the engine down, and
+  // later operations find none.
   fakeEngine(manager);
   manager.recording = true;
+  manager.previewing = true;
   handle(MF_CAPTURE_ENGINE_ERROR, E_FAIL);
-  EXPECT_FALSE(manager.engine);
-  EXPECT_EQ(nullptr, manager.engineEvent);
   EXPECT_FALSE(manager.previewing);
   EXPECT_FALSE(manager.recording);
   UINT32 width = 1, height = 2;
   EXPECT_EQ(MF_E_NOT_INITIALIZED, manager.ConfigurePreview(width, height));
+  EXPECT_FALSE(manager.engine);
+  EXPECT_EQ(nullptr, manager.engineEvent);
   EXPECT_EQ(MF_E_NOT_INITIALIZED, manager.StartPreview(nullptr));
   EXPECT_EQ(MF_E_NOT_INITIALIZED, manager.StopPreview());
   EXPECT_EQ(S_OK, manager.StopRecord());
@@ -447,6 +449,9 @@ TEST(CameraCaptureManager, AStartTheEngineRefusesOrAnEngineErrorEndsTheWait) {
   };
   EXPECT_EQ(S_OK, manager.StartPreview(nullptr));
   lost.join();
+  // The engine's thread leaves the engine to its owner, whose calls may be using it.
+  EXPECT_TRUE(manager.engine);
+  EXPECT_FALSE(manager.HasEngine());
   EXPECT_FALSE(manager.engine);
 }
 

@@ -27,13 +27,6 @@ BOOL ResetEvent(HANDLE event);
 DWORD WaitForSingleObject(HANDLE handle, DWORD milliseconds);
 BOOL CloseHandle(HANDLE handle);
 
-constexpr DWORD DUPLICATE_SAME_ACCESS = 0x2;
-// The process itself, as a pseudo handle; here only DuplicateHandle takes it.
-HANDLE GetCurrentProcess();
-// A second handle to the same object, which lives until every handle to it is closed.
-BOOL DuplicateHandle(HANDLE sourceProcess, HANDLE source, HANDLE targetProcess, HANDLE* target, DWORD access,
-                     BOOL inherit, DWORD options);
-
 constexpr ULONG POWER_REQUEST_CONTEXT_VERSION = 0;
 constexpr DWORD POWER_REQUEST_CONTEXT_SIMPLE_STRING = 0x1;
 

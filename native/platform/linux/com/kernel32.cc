@@ -144,21 +144,6 @@ BOOL CloseHandle(HANDLE handle) {
   return TRUE;
 }
 
-HANDLE GetCurrentProcess() { return INVALID_HANDLE_VALUE; }  // Windows' pseudo handle has the same value
-
-BOOL DuplicateHandle(HANDLE sourceProcess, HANDLE source, HANDLE targetProcess, HANDLE* target, DWORD, BOOL,
-                     DWORD options) {
-  // Handles of this process only, with the access they have.
-  if (sourceProcess != GetCurrentProcess() || targetProcess != GetCurrentProcess() || !target || invalid(source) ||
-      !(options & DUPLICATE_SAME_ACCESS)) {
-    SetLastError(ERROR_INVALID_PARAMETER);
-    return FALSE;
-  }
-  static_cast<KernelObject*>(source)->references.fetch_add(1, std::memory_order_relaxed);
-  *target = source;
-  return TRUE;
-}
-
 HANDLE PowerCreateRequest(PREASON_CONTEXT context) {
   if (!context || context->Version != POWER_REQUEST_CONTEXT_VERSION) {
     SetLastError(ERROR_INVALID_PARAMETER);

@@ -126,8 +126,15 @@ void CaptureManager::DestroyEngine() {
   errorId = 0;
 }
 
+// Whether there is an engine to call; one that reported an error is released first, so later
+// operations find none.
+bool CaptureManager::HasEngine() {
+  if (failed_.exchange(false)) DestroyEngine();
+  return static_cast<bool>(engine);
+}
+
 HRESULT CaptureManager::ConfigurePreview(UINT32& width, UINT32& height) {
-  if (!engine) return MF_E_NOT_INITIALIZED;
+  if (!HasEngine()) return MF_E_NOT_INITIALIZED;
   if (previewing) return S_OK;
   if (previewSink) return S_OK;
 
@@ -198,15 +205,10 @@ HRESULT CaptureManager::ConfigurePreview(UINT32& width, UINT32& height) {
   return hr;
 }
 
-CaptureManager::Mark::~Mark() {
-  if (event) CloseHandle(event);
-}
-
-void CaptureManager::mark(Mark& before) const {
+CaptureManager::Mark CaptureManager::mark() const {
+  Mark before;
   for (int kind = 0; kind < EventKinds; ++kind) before.handled[kind] = handled_[kind].load();
-  if (engineEvent && !DuplicateHandle(GetCurrentProcess(), engineEvent, GetCurrentProcess(), &before.event, 0, FALSE,
-                                      DUPLICATE_SAME_ACCESS))
-    before.event = nullptr;
+  return before;
 }
 
 // Every handled event signals engineEvent after counting itself, so a wait that finds its count
@@ -214,16 +216,15 @@ void CaptureManager::mark(Mark& before) const {
 void CaptureManager::waitFor(const Mark& before, EventKind kind) {
   while (handled_[kind].load() == before.handled[kind] &&
          handled_[EngineFailed].load() == before.handled[EngineFailed]) {
-    if (!before.event || WaitForSingleObject(before.event, INFINITE) != WAIT_OBJECT_0) return;
+    if (!engineEvent || WaitForSingleObject(engineEvent, INFINITE) != WAIT_OBJECT_0) return;
   }
 }
 
 HRESULT CaptureManager::StartPreview(capture::video::FrameQueue* queue) {
-  if (!engine) return MF_E_NOT_INITIALIZED;
+  if (!HasEngine()) return MF_E_NOT_INITIALIZED;
   if (previewing) return S_OK;
   if (!frameQueue) frameQueue = queue;
-  Mark before;
-  mark(before);
+  const Mark before = mark();
   HRESULT hr = engine->StartPreview();
   if (!powerRequestSet && powerRequest != INVALID_HANDLE_VALUE)
     powerRequestSet = PowerSetRequest(powerRequest, PowerRequestExecutionRequired) == TRUE;
@@ -233,10 +234,9 @@ HRESULT CaptureManager::StartPreview(capture::video::FrameQueue* queue) {
 }
 
 HRESULT CaptureManager::StopPreview() {
-  if (!engine) return MF_E_NOT_INITIALIZED;
+  if (!HasEngine()) return MF_E_NOT_INITIALIZED;
   if (!previewing) return S_OK;
-  Mark before;
-  mark(before);
+  const Mark before = mark();
   HRESULT hr = engine->StopPreview();
   if (FAILED(hr)) return hr;
   waitFor(before, PreviewStopped);
@@ -289,7 +289,7 @@ HRESULT CaptureManager::AddAudioRecordStream(IMFCaptureRecordSink* sink) {
 }
 
 HRESULT CaptureManager::StartRecord(LPCWSTR path) {
-  if (!engine) return MF_E_NOT_INITIALIZED;
+  if (!HasEngine()) return MF_E_NOT_INITIALIZED;
   if (recording) return MF_E_INVALIDREQUEST;
 
   // Only the name chooses the container, so only ".mp4", spelt exactly so, is taken.
@@ -313,8 +313,7 @@ HRESULT CaptureManager::StartRecord(LPCWSTR path) {
   if (SUCCEEDED(hr) && videoEncoding != GUID_NULL) hr = AddVideoRecordStream(source.Get(), recordSink.Get());
   if (SUCCEEDED(hr) && audioEncoding != GUID_NULL) hr = AddAudioRecordStream(recordSink.Get());
   if (SUCCEEDED(hr)) {
-    Mark before;
-    mark(before);
+    const Mark before = mark();
     hr = engine->StartRecord();
     if (SUCCEEDED(hr)) {
       waitFor(before, RecordStarted);
@@ -326,9 +325,8 @@ HRESULT CaptureManager::StartRecord(LPCWSTR path) {
 }
 
 HRESULT CaptureManager::StopRecord() {
-  if (!recording) return S_OK;
-  Mark before;
-  mark(before);
+  if (!HasEngine() || !recording) return S_OK;
+  const Mark before = mark();
   HRESULT hr = engine->StopRecord(TRUE, FALSE);
   if (SUCCEEDED(hr)) waitFor(before, RecordStopped);
   return hr;
@@ -360,14 +358,16 @@ HRESULT CaptureManager::HandleEngineEvent(IMFMediaEvent* event) {
       photoPending = false;
     } else if (type == MF_CAPTURE_ENGINE_ERROR) {
       if (recording) warn(411, status, "CaptureManager: the device failed while recording");
-      // Waits in progress end before the handle goes; the handle keeps its object while they do.
+      // The engine is torn down by its owner's next call (HasEngine), not here: this runs on the
+      // engine's own thread, and the owner may be calling into the engine at this moment.
+      previewing = false;
+      recording = false;
+      failed_ = true;
       ++handled_[EngineFailed];
-      SetEvent(engineEvent);
-      DestroyEngine();
     }
   }
   taken.Reset();
-  SetEvent(engineEvent);  // a null handle after an error event: nothing to signal
+  SetEvent(engineEvent);
   return status;
 }
 

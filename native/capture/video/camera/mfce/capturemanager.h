@@ -71,6 +71,7 @@ class CaptureManager {
 
   HRESULT Initialize(IUnknown* audioDevice, IUnknown* videoDevice);
   void DestroyEngine();
+  bool HasEngine();
   HRESULT ConfigurePreview(UINT32& width, UINT32& height);
   HRESULT StartPreview(capture::video::FrameQueue* queue);
   HRESULT StopPreview();
@@ -115,14 +116,9 @@ class CaptureManager {
   // The counts before a command, and a handle of the wait's own to engineEvent, so that an engine
   // error closing the manager's handle meanwhile cannot take the event from under the wait.
   struct Mark {
-    Mark() = default;
-    Mark(const Mark&) = delete;
-    Mark& operator=(const Mark&) = delete;
-    ~Mark();
     uint32_t handled[EventKinds] = {};
-    HANDLE event = nullptr;
   };
-  void mark(Mark& before) const;
+  Mark mark() const;
   void waitFor(const Mark& before, EventKind kind);
 
   HRESULT AddVideoRecordStream(IMFCaptureSource* source, IMFCaptureRecordSink* sink);
@@ -130,6 +126,7 @@ class CaptureManager {
 
   std::atomic<uint32_t> handled_[EventKinds] = {};
   std::atomic<HRESULT> recordStartStatus_{S_OK};
+  std::atomic<bool> failed_{false};  // the engine reported an error; its owner releases it
 };
 
 }  // namespace capture::video::camera::mfce

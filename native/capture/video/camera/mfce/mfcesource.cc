@@ -93,7 +93,7 @@ void MFCESource::startPreview() {
     previewHeight = height;
     frameQueue = new capture::video::FrameQueue(std::wstring(), width, height, static_cast<uint32_t>(channelOrder()));
   }
-  if (!captureManager->engine)
+  if (!captureManager->HasEngine())
     checkResult(file, 230, MF_E_NOT_INITIALIZED,
                 "MFCESource::startPreview() could not start preview: StartPreview() failed");
   if (!captureManager->IsPreviewing())
@@ -115,7 +115,7 @@ void MFCESource::stopPreview() {
 // clip makes it again, so the source records once the device is back. A device still gone
 // fails the clip's start as before, with its warning line.
 void MFCESource::reopen() {
-  if (captureManager->engine) return;
+  if (captureManager->HasEngine()) return;
   capturing = false;
   if (FAILED(captureManager->Initialize(audioDevice.Get(), videoDevice.Get()))) return;
   captureManager->eventCallback->direct = true;
