@@ -3,7 +3,8 @@
 # lint, the unit tests run plainly, under
 # AddressSanitizer + UndefinedBehaviorSanitizer and under ThreadSanitizer, then the Windows checks
 # (every Windows source compiles; the capture code links for Windows and its unit tests and start-up
-# run under Wine), then the JavaScript integration tests (each starts its own Xvfb and PulseAudio).
+# run under Wine), then the JavaScript integration tests (each starts its own Xvfb and PulseAudio),
+# and last those that drive the real back ends' threads against a ThreadSanitizer build.
 set -euo pipefail
 cd "$(dirname "$0")/.."
 jobs=$(nproc)
@@ -37,3 +38,5 @@ bash scripts/wine-tests.sh
 
 echo "== integration tests"
 node --test --test-concurrency=1 test/js/
+echo "== integration tests against the add-on built with ThreadSanitizer"
+bash scripts/tsan-integration.sh

@@ -7,8 +7,17 @@ const path = require('path');
 const root = path.resolve(__dirname, '..', '..');
 const MARK = '@@tavio-report ';
 
+// The environment of a host process: TAVIO_TEST_PRELOAD (a sanitizer's runtime, for an add-on
+// built with it) is preloaded into the host only; the host clears it again (HOST_START) so that
+// the players and tools it starts run as they are.
+function hostEnv(env) {
+  const preload = process.env.TAVIO_TEST_PRELOAD;
+  return { ...process.env, ...env, ...(preload ? { LD_PRELOAD: preload } : {}) };
+}
+const HOST_START = process.env.TAVIO_TEST_PRELOAD ? 'delete process.env.LD_PRELOAD;' : '';
+
 function prelude(callback) {
-  return `
+  return `${HOST_START}
 const addon = require(${JSON.stringify(root)});
 const events = [];
 ${callback ? 'addon.setCallback((event) => events.push(event));' : ''}
@@ -31,7 +40,7 @@ ${script}
 `;
   return new Promise((resolve) => {
     const child = spawn(process.execPath, ['-e', source], {
-      env: { ...process.env, ...env },
+      env: hostEnv(env),
       stdio: ['ignore', 'pipe', 'pipe'],
     });
     let stdout = '';
@@ -52,4 +61,4 @@ ${script}
   });
 }
 
-module.exports = { runAddon, root };
+module.exports = { runAddon, root, hostEnv, HOST_START };

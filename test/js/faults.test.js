@@ -12,7 +12,7 @@ const os = require('os');
 const path = require('path');
 const readline = require('readline');
 const { startDesktop, playTone } = require('../../scripts/desktop');
-const { root } = require('./addon');
+const { root, hostEnv, HOST_START } = require('./addon');
 const { duration: probe, decodeErrors } = require('./clips');
 
 const sleep = (ms) => new Promise((resolve) => setTimeout(resolve, ms));
@@ -20,7 +20,7 @@ const CAMERAS = 'Fault Camera=testsrc2=size=320x240:rate=30';
 
 // The host: a Node process with the add-on that takes commands on standard input
 // ("start <folder> <prefix>", "stop", "peaks") and answers each with one JSON line.
-const HOST = `
+const HOST = `${HOST_START}
 const addon = require(${JSON.stringify(root)});
 const path = require('path');
 const sources = [];
@@ -57,7 +57,7 @@ require('readline').createInterface({ input: process.stdin }).on('line', (line) 
 `;
 
 function startHost(env) {
-  const child = spawn(process.execPath, ['-e', HOST], { env: { ...process.env, ...env, TAVIO_TEST_CAMERAS: CAMERAS },
+  const child = spawn(process.execPath, ['-e', HOST], { env: hostEnv({ ...env, TAVIO_TEST_CAMERAS: CAMERAS }),
     stdio: ['pipe', 'pipe', 'pipe'] });
   const answers = [];
   const waiting = [];
