@@ -113,8 +113,7 @@ class CaptureManager {
   // handled (or the engine failed), not at the next signal of engineEvent: a signal of an earlier
   // event stays pending and would end it before the engine has answered.
   enum EventKind { PreviewStarted, PreviewStopped, RecordStarted, RecordStopped, EngineFailed, EventKinds };
-  // The counts before a command, and a handle of the wait's own to engineEvent, so that an engine
-  // error closing the manager's handle meanwhile cannot take the event from under the wait.
+  // How many events of each kind were handled before a command; its wait ends when one more is.
   struct Mark {
     uint32_t handled[EventKinds] = {};
   };
