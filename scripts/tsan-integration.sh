@@ -20,6 +20,11 @@ ln -s "$PWD/node_modules" "$copy/node_modules"
 (cd "$copy" && CFLAGS="$flags" CXXFLAGS="$flags" LDFLAGS="-fsanitize=thread" node scripts/gyp.js rebuild -j "$jobs") \
   > "$copy.log" 2>&1 || { tail -50 "$copy.log"; exit 1; }
 
+# Without the runtime first in the process the add-on does not load, and every test would fail
+# without a report: check that it loads before counting on the silence.
+[ -f "$runtime" ] || { echo "no ThreadSanitizer runtime ($runtime)"; exit 1; }
+LD_PRELOAD="$runtime" node -e "require('./$copy')" || { echo "the ThreadSanitizer build does not load"; exit 1; }
+
 reports="$PWD/$copy/reports"
 TAVIO_TEST_PRELOAD="$runtime" TSAN_OPTIONS="log_path=$reports/tsan ignore_noninstrumented_modules=1" \
   node --test --test-concurrency=1 "$copy"/test/js/{faults,camera,camera-faults,audio,recording}.test.js \
