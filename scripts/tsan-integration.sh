@@ -11,6 +11,7 @@ jobs=$(nproc)
 copy=build-tsan-addon
 runtime=$(gcc -print-file-name=libtsan.so)
 flags="-fsanitize=thread -g -O1"
+[ -f "$runtime" ] || { echo "no ThreadSanitizer runtime ($runtime)"; exit 1; }
 
 rm -rf "$copy"
 mkdir -p "$copy/reports"
@@ -22,7 +23,6 @@ ln -s "$PWD/node_modules" "$copy/node_modules"
 
 # Without the runtime first in the process the add-on does not load, and every test would fail
 # without a report: check that it loads before counting on the silence.
-[ -f "$runtime" ] || { echo "no ThreadSanitizer runtime ($runtime)"; exit 1; }
 LD_PRELOAD="$runtime" node -e "require('./$copy')" || { echo "the ThreadSanitizer build does not load"; exit 1; }
 
 reports="$PWD/$copy/reports"
