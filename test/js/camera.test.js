@@ -164,6 +164,35 @@ test('cameras and capture-device microphones', async (t) => {
     }
   });
 
+  await t.test('a camera slow to send its first picture holds up neither initialize nor a clip started at once', async () => {
+    // Its first picture comes 2 s after the device opens, as from a camera still warming up.
+    const file = path.join(dir, 'slow.mp4');
+    const { reports, code } = await runAddon(`
+      const started = Date.now();
+      addon.initialize();
+      const initialized = Date.now() - started;
+      const camera = events.find((e) => e.type === 'new source' && e.source.name === 'Slow').source;
+      const empty = addon.getPreview(camera.id, 32, 24) === undefined;
+      addon.startCapture(camera.id, ${JSON.stringify(file)});
+      await sleep(3500);
+      addon.stopCapture(camera.id);
+      report({ initialized, size: [camera.width, camera.height], empty, shown: !!addon.getPreview(camera.id, 32, 24) });
+    `, { env: { ...env, TAVIO_TEST_CAMERAS: 'Slow=testsrc2=size=320x240:rate=30,realtime,select=gte(t\\,2)' } });
+    assert.strictEqual(code, 0);
+    const [{ initialized, size, empty, shown }] = reports;
+    // Waiting for the first picture would take 2 s for each time the device is opened.
+    assert.ok(initialized < 1000, `initialize took ${initialized} ms`);
+    assert.deepStrictEqual([size, empty, shown], [[320, 240], true, true]);
+    const p = probe(file);
+    assert.ok(Math.abs(p.format.duration - 3.5) < 0.1, `${p.format.duration} s`);
+    assert.strictEqual(decodeErrors(file), '');
+    // The first picture opens the clip and lasts until the second comes, 1/30 s after it.
+    const pts = execFileSync('ffprobe', ['-v', 'error', '-select_streams', 'v', '-show_entries', 'packet=pts_time', '-of', 'csv=p=0', file],
+      { encoding: 'utf8' }).trim().split('\n').map(Number).sort((a, b) => a - b);
+    assert.strictEqual(pts[0], 0);
+    assert.ok(pts[1] > 1.5 && Math.abs(pts[2] - pts[1] - 1 / 30) < 0.002, pts.slice(0, 3).join(', '));
+  });
+
   await t.test('a ".MP4" name records nothing and still sends new-clip', async () => {
     const upper = path.join(dir, 'camera.MP4');
     const { reports, code } = await runAddon(`

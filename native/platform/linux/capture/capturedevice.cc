@@ -127,6 +127,27 @@ GUID videoSubtype(const AVCodecParameters* codec) {
   }
 }
 
+// Raw pictures and PCM sound are fully described by what the device reports on opening. Probing
+// such a stream reads its first packets: it waits for a camera that is still warming up (or for
+// ever, for one that streams nothing) and for a microphone that sends seconds at once.
+bool describedOnOpening(const AVCodecParameters* codec) {
+  if (codec->codec_type == AVMEDIA_TYPE_VIDEO)
+    return codec->codec_id == AV_CODEC_ID_RAWVIDEO && codec->width > 0 && codec->height > 0 &&
+           codec->format != AV_PIX_FMT_NONE;
+  return codec->codec_type == AVMEDIA_TYPE_AUDIO && codec->codec_id == AV_CODEC_ID_PCM_S16LE &&
+         codec->sample_rate > 0 && codec->ch_layout.nb_channels > 0;
+}
+
+// The frame rate a device declares: the stream's, else the one its time base counts (a test
+// camera's graph), else the one it was found with.
+AVRational declaredRate(const AVStream* stream, AVRational found) {
+  if (stream->avg_frame_rate.num > 0 && stream->avg_frame_rate.den > 0) return stream->avg_frame_rate;
+  if (stream->r_frame_rate.num > 0 && stream->r_frame_rate.den > 0) return stream->r_frame_rate;
+  const AVRational ticks = av_inv_q(stream->time_base);
+  if (ticks.num > 0 && ticks.den > 0 && av_cmp_q(ticks, AVRational{240, 1}) <= 0) return ticks;
+  return found;
+}
+
 }  // namespace
 
 HRESULT openInput(Device& device, std::shared_ptr<Input>& result) {
@@ -160,14 +181,14 @@ HRESULT openInput(Device& device, std::shared_ptr<Input>& result) {
   av_dict_free(&options);
   if (error < 0)
     return device.video ? MF_E_VIDEO_RECORDING_DEVICE_INVALIDATED : MF_E_AUDIO_RECORDING_DEVICE_INVALIDATED;
-  if (avformat_find_stream_info(input->format, nullptr) < 0) return MF_E_INVALID_STREAM_DATA;
+  const bool described = input->format->nb_streams == 1 && describedOnOpening(input->format->streams[0]->codecpar);
+  if (!described && avformat_find_stream_info(input->format, nullptr) < 0) return MF_E_INVALID_STREAM_DATA;
   input->stream =
       av_find_best_stream(input->format, device.video ? AVMEDIA_TYPE_VIDEO : AVMEDIA_TYPE_AUDIO, -1, -1, nullptr, 0);
   if (input->stream < 0)
     return device.video ? MF_E_CAPTURE_SOURCE_NO_VIDEO_STREAM_PRESENT : MF_E_CAPTURE_SOURCE_NO_AUDIO_STREAM_PRESENT;
   AVStream* stream = input->format->streams[input->stream];
-  AVRational rate = stream->avg_frame_rate.num ? stream->avg_frame_rate : stream->r_frame_rate;
-  if (rate.num <= 0 || rate.den <= 0) rate = device.current.rate;
+  const AVRational rate = declaredRate(stream, device.current.rate);
   input->delivered = avcodec_parameters_alloc();
   if (!input->delivered) return E_OUTOFMEMORY;
   if (device.encodesH264) {

@@ -14,9 +14,11 @@ const char* const generators[] = {"allrgb",      "allyuv",     "cellauto",   "co
                                   "smptehdbars", "testsrc",    "testsrc2",   "yuvtestsrc"};
 
 // Filters after the source that have no option naming a file: drawing (geq by expressions),
-// geometry, format and timing (format and realtime are the ones the engine appends itself).
-const char* const pictureFilters[] = {"crop", "drawbox", "drawgrid", "format", "fps",   "geq",    "hflip",     "negate",
-                                      "null", "pad",     "realtime", "rotate", "scale", "setsar", "transpose", "vflip"};
+// geometry, format and timing (format and realtime are the ones the engine appends itself;
+// select leaves pictures out, as a camera that is slow to start or drops frames does).
+const char* const pictureFilters[] = {"crop",  "drawbox", "drawgrid", "format",    "fps",      "geq",
+                                      "hflip", "negate",  "null",     "pad",       "realtime", "rotate",
+                                      "scale", "select",  "setsar",   "transpose", "vflip"};
 
 bool listed(const char* const* begin, const char* const* end, const std::string& name) {
   return std::any_of(begin, end, [&](const char* entry) { return name == entry; });
