@@ -164,33 +164,44 @@ test('cameras and capture-device microphones', async (t) => {
     }
   });
 
-  await t.test('a camera slow to send its first picture holds up neither initialize nor a clip started at once', async () => {
-    // Its first picture comes 2 s after the device opens, as from a camera still warming up.
-    const file = path.join(dir, 'slow.mp4');
-    const { reports, code } = await runAddon(`
+  await t.test('a camera slow to send its first picture, or sending none, holds nothing up and its clip lasts to the stop', async () => {
+    // Slow's first picture comes 2 s after the device opens, as from a camera still warming up;
+    // Never sends none.
+    const cameras = 'Slow=testsrc2=size=320x240:rate=30,realtime,select=gte(t\\,2);' +
+      'Never=testsrc2=size=320x240:rate=30,realtime,select=gte(t\\,1000)';
+    const files = [path.join(dir, 'slow.mp4'), path.join(dir, 'never.mp4')];
+    const { reports, code, stdout } = await runAddon(`
       const started = Date.now();
       addon.initialize();
       const initialized = Date.now() - started;
-      const camera = events.find((e) => e.type === 'new source' && e.source.name === 'Slow').source;
-      const empty = addon.getPreview(camera.id, 32, 24) === undefined;
-      addon.startCapture(camera.id, ${JSON.stringify(file)});
+      const cameras = events.filter((e) => e.type === 'new source' && e.source.type === 'mfce_video').map((e) => e.source);
+      const empty = cameras.map((c) => addon.getPreview(c.id, 32, 24) === undefined);
+      cameras.forEach((c, i) => addon.startCapture(c.id, ${JSON.stringify(files)}[i]));
       await sleep(3500);
-      addon.stopCapture(camera.id);
-      report({ initialized, size: [camera.width, camera.height], empty, shown: !!addon.getPreview(camera.id, 32, 24) });
-    `, { env: { ...env, TAVIO_TEST_CAMERAS: 'Slow=testsrc2=size=320x240:rate=30,realtime,select=gte(t\\,2)' } });
+      cameras.forEach((c) => addon.stopCapture(c.id));
+      report({ initialized, cameras: cameras.map((c) => [c.name, c.width, c.height]), empty,
+               shown: cameras.map((c) => addon.getPreview(c.id, 32, 24) !== undefined) });
+    `, { env: { ...env, TAVIO_TEST_CAMERAS: cameras } });
     assert.strictEqual(code, 0);
-    const [{ initialized, size, empty, shown }] = reports;
-    // Waiting for the first picture would take 2 s for each time the device is opened.
+    assert.ok(!stdout.includes('Warning'), stdout);
+    const [{ initialized, ...seen }] = reports;
+    // Waiting for a first picture would take 2 s for each time Slow is opened, for ever for Never.
     assert.ok(initialized < 1000, `initialize took ${initialized} ms`);
-    assert.deepStrictEqual([size, empty, shown], [[320, 240], true, true]);
-    const p = probe(file);
-    assert.ok(Math.abs(p.format.duration - 3.5) < 0.1, `${p.format.duration} s`);
-    assert.strictEqual(decodeErrors(file), '');
-    // The first picture opens the clip and lasts until the second comes, 1/30 s after it.
-    const pts = execFileSync('ffprobe', ['-v', 'error', '-select_streams', 'v', '-show_entries', 'packet=pts_time', '-of', 'csv=p=0', file],
+    assert.deepStrictEqual(seen, { cameras: [['Slow', 320, 240], ['Never', 320, 240]], empty: [true, true], shown: [true, false] });
+    for (const file of files) {
+      const p = probe(file);
+      assert.ok(Math.abs(p.format.duration - 3.5) < 0.1, `${file}: ${p.format.duration} s`);
+      assert.strictEqual(decodeErrors(file), '', file);
+    }
+    // Slow's first picture opens its clip and lasts until the second comes, 1/30 s after it.
+    const pts = execFileSync('ffprobe', ['-v', 'error', '-select_streams', 'v', '-show_entries', 'packet=pts_time', '-of', 'csv=p=0', files[0]],
       { encoding: 'utf8' }).trim().split('\n').map(Number).sort((a, b) => a - b);
     assert.strictEqual(pts[0], 0);
     assert.ok(pts[1] > 1.5 && Math.abs(pts[2] - pts[1] - 1 / 30) < 0.002, pts.slice(0, 3).join(', '));
+    // Never's clip is black.
+    const luma = execFileSync('ffprobe', ['-v', 'error', '-f', 'lavfi', '-i', `movie=${files[1]},signalstats`,
+      '-show_entries', 'frame_tags=lavfi.signalstats.YMAX', '-of', 'csv=p=0'], { encoding: 'utf8' }).trim().split('\n').map(Number);
+    assert.ok(luma.length > 0 && luma.every((y) => y <= 16), luma.join(', '));
   });
 
   await t.test('a ".MP4" name records nothing and still sends new-clip', async () => {

@@ -94,6 +94,21 @@ HRESULT fillSample(IMFMediaBuffer* buffer, DWORD length, LONGLONG time, LONGLONG
   return S_OK;
 }
 
+// The engine's I420 pictures: rows of the even width (what the encoder's stride is), chroma rows
+// rounded up.
+struct I420Layout {
+  I420Layout(int width, int height)
+      : lumaStride(evenpicture::evenSize(width)),
+        chromaStride(lumaStride / 2),
+        lumaSize(static_cast<size_t>(lumaStride) * height),
+        chromaSize(static_cast<size_t>(chromaStride) * ((height + 1) / 2)) {}
+  DWORD length() const { return static_cast<DWORD>(lumaSize + 2 * chromaSize); }
+  int lumaStride;
+  int chromaStride;
+  size_t lumaSize;
+  size_t chromaSize;
+};
+
 // A sample holding a copy of bytes, or pixels written by fill(data), in a buffer of its own.
 template <class Fill>
 HRESULT makeSample(DWORD length, LONGLONG time, LONGLONG duration, Fill fill, IMFSample** sample) {
@@ -153,6 +168,7 @@ class EngineThread {
   void stopRecording(int64_t at);
   void finishDue(bool all);
   HRESULT finish(Recording& recording);
+  static ComPtr<IMFSample> blackPicture(const Recording& recording);
   int64_t nextDeadline() const;
   bool soundCanComeBy(int64_t due) const;
   void fail(HRESULT status);
@@ -420,6 +436,10 @@ void EngineThread::finishDue(bool all) {
 // The last picture held until the stop, sound missing at the end as silence, then the file's end.
 HRESULT EngineThread::finish(Recording& recording) {
   const LONGLONG length = recording.stopAt ? (recording.stopAt - recording.startAt) * 10 : 0;
+  if (recording.hasVideo && !recording.held && !recording.videoPassthrough) {
+    // The camera sent no picture during the clip: it is black, and still lasts to the stop.
+    recording.held = blackPicture(recording);
+  }
   if (recording.held) {
     const LONGLONG rest = length - recording.heldTime;
     writeHeld(recording, rest > 0 ? rest : recording.frameDuration);
@@ -435,6 +455,32 @@ HRESULT EngineThread::finish(Recording& recording) {
   }
   const HRESULT finalized = recording.writer->Finalize();
   return FAILED(recording.failure) ? recording.failure : finalized;
+}
+
+ComPtr<IMFSample> EngineThread::blackPicture(const Recording& recording) {
+  ComPtr<IMFSample> sample;
+  if (recording.padded) {  // top-down BGRA of the device's size
+    const auto length = static_cast<DWORD>(recording.width * recording.height * 4);
+    makeSample(
+        length, 0, 0,
+        [&](BYTE* data) {
+          for (DWORD i = 0; i < length; i += 4) {
+            data[i] = data[i + 1] = data[i + 2] = 0;
+            data[i + 3] = 0xFF;
+          }
+        },
+        sample.GetAddressOf());
+  } else {  // limited-range I420, as the engine converts to
+    const I420Layout layout(recording.width, recording.height);
+    makeSample(
+        layout.length(), 0, 0,
+        [&](BYTE* data) {
+          std::fill_n(data, layout.lumaSize, 16);
+          std::fill_n(data + layout.lumaSize, 2 * layout.chromaSize, 128);
+        },
+        sample.GetAddressOf());
+  }
+  return sample;
 }
 
 void EngineThread::write(Recording& recording, DWORD stream, IMFSample* sample) {
@@ -490,12 +536,8 @@ void EngineThread::deliverVideo(AVFrame* frame, int64_t pts, AVRational timeBase
   const int width = f.width;
   const int height = f.height;
   if (width <= 0 || height <= 0 || frame->width <= 0 || frame->height <= 0) return;
-  // I420 rows of the even width (what the encoder's stride is), chroma rows rounded up.
-  const int lumaStride = evenpicture::evenSize(width);
-  const int chromaStride = lumaStride / 2;
-  const size_t lumaSize = static_cast<size_t>(lumaStride) * height;
-  const size_t chromaSize = static_cast<size_t>(chromaStride) * ((height + 1) / 2);
-  const auto i420Length = static_cast<DWORD>(lumaSize + 2 * chromaSize);
+  const I420Layout layout(width, height);
+  const DWORD i420Length = layout.length();
   const auto bgraLength = static_cast<DWORD>(width * height * 4);
   const bool sameSize = frame->width == width && frame->height == height;
   toI420_ =
@@ -514,12 +556,12 @@ void EngineThread::deliverVideo(AVFrame* frame, int64_t pts, AVRational timeBase
   IMFMediaBuffer* bgraBuffer = pooledBuffer(pictures_, bgraLength);
   if (!i420Buffer || !bgraBuffer) return;
   const uint8_t* planes[3] = {};
-  const int strides[3] = {lumaStride, chromaStride, chromaStride};
+  const int strides[3] = {layout.lumaStride, layout.chromaStride, layout.chromaStride};
   ComPtr<IMFSample> i420;
   HRESULT hr = fillSample(
       i420Buffer, i420Length, time, duration,
       [&](BYTE* data) {
-        uint8_t* to[3] = {data, data + lumaSize, data + lumaSize + chromaSize};
+        uint8_t* to[3] = {data, data + layout.lumaSize, data + layout.lumaSize + layout.chromaSize};
         sws_scale(toI420_, frame->data, frame->linesize, 0, frame->height, to, strides);
         std::copy(to, to + 3, planes);
       },
