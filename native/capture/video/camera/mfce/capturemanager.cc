@@ -335,6 +335,7 @@ HRESULT CaptureManager::StopRecord() {
 HRESULT CaptureManager::HandleEngineEvent(IMFMediaEvent* event) {
   ComPtr<IMFMediaEvent> taken = adopt(event);  // the caller's reference, let go once handled
   HRESULT status = eventStatus(event);
+  bool failed = false;
   GUID type = GUID_NULL;
   if (SUCCEEDED(event->GetExtendedType(&type))) {
     if (type == MF_CAPTURE_ENGINE_INITIALIZED) {
@@ -362,12 +363,14 @@ HRESULT CaptureManager::HandleEngineEvent(IMFMediaEvent* event) {
       // engine's own thread, and the owner may be calling into the engine at this moment.
       previewing = false;
       recording = false;
-      failed_ = true;
       ++handled_[EngineFailed];
+      failed = true;
     }
   }
   taken.Reset();
   SetEvent(engineEvent);
+  // Last: once the owner sees the failure it may close engineEvent and release the engine.
+  if (failed) failed_ = true;
   return status;
 }
 
