@@ -150,6 +150,33 @@ struct Recording {
   int64_t audioReachedAt = INT64_MIN;  // wall clock (µs) up to which sound has come
 };
 
+// What a clip shows when its camera sent no picture: black, in the form the encoder takes.
+ComPtr<IMFSample> blackPicture(const Recording& recording) {
+  ComPtr<IMFSample> sample;
+  if (recording.padded) {  // top-down BGRA of the device's size
+    const auto length = static_cast<DWORD>(recording.width * recording.height * 4);
+    makeSample(
+        length, 0, 0,
+        [&](BYTE* data) {
+          for (DWORD i = 0; i < length; i += 4) {
+            data[i] = data[i + 1] = data[i + 2] = 0;
+            data[i + 3] = 0xFF;
+          }
+        },
+        sample.GetAddressOf());
+  } else {  // limited-range I420, as the engine converts to
+    const I420Layout layout(recording.width, recording.height);
+    makeSample(
+        layout.length(), 0, 0,
+        [&](BYTE* data) {
+          std::fill_n(data, layout.lumaSize, 16);
+          std::fill_n(data + layout.lumaSize, 2 * layout.chromaSize, 128);
+        },
+        sample.GetAddressOf());
+  }
+  return sample;
+}
+
 constexpr int64_t videoGrace = 250000;     // µs after the stop to wait for the stop's picture
 constexpr int64_t soundGrace = 500000;     // and for its sound, which may come in large lumps
 constexpr int64_t soundHistory = 5000000;  // how far back the microphone's deliveries are kept
@@ -168,7 +195,6 @@ class EngineThread {
   void stopRecording(int64_t at);
   void finishDue(bool all);
   HRESULT finish(Recording& recording);
-  static ComPtr<IMFSample> blackPicture(const Recording& recording);
   int64_t nextDeadline() const;
   bool soundCanComeBy(int64_t due) const;
   void fail(HRESULT status);
@@ -455,32 +481,6 @@ HRESULT EngineThread::finish(Recording& recording) {
   }
   const HRESULT finalized = recording.writer->Finalize();
   return FAILED(recording.failure) ? recording.failure : finalized;
-}
-
-ComPtr<IMFSample> EngineThread::blackPicture(const Recording& recording) {
-  ComPtr<IMFSample> sample;
-  if (recording.padded) {  // top-down BGRA of the device's size
-    const auto length = static_cast<DWORD>(recording.width * recording.height * 4);
-    makeSample(
-        length, 0, 0,
-        [&](BYTE* data) {
-          for (DWORD i = 0; i < length; i += 4) {
-            data[i] = data[i + 1] = data[i + 2] = 0;
-            data[i + 3] = 0xFF;
-          }
-        },
-        sample.GetAddressOf());
-  } else {  // limited-range I420, as the engine converts to
-    const I420Layout layout(recording.width, recording.height);
-    makeSample(
-        layout.length(), 0, 0,
-        [&](BYTE* data) {
-          std::fill_n(data, layout.lumaSize, 16);
-          std::fill_n(data + layout.lumaSize, 2 * layout.chromaSize, 128);
-        },
-        sample.GetAddressOf());
-  }
-  return sample;
 }
 
 void EngineThread::write(Recording& recording, DWORD stream, IMFSample* sample) {
