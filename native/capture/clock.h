@@ -11,4 +11,12 @@ inline int64_t currentTimeMillis() {
   return std::chrono::duration_cast<Ticks>(std::chrono::system_clock::now().time_since_epoch()).count() / 10000;
 }
 
+// Milliseconds of a clock that only runs forward, from an unspecified moment. Pictures and clips
+// are timed by it: a step of the system clock (a time service, a user, a virtual machine's time
+// sync) must neither stretch a clip nor stall its recording.
+inline int64_t steadyMillis() {
+  return std::chrono::duration_cast<std::chrono::milliseconds>(std::chrono::steady_clock::now().time_since_epoch())
+      .count();
+}
+
 }  // namespace capture

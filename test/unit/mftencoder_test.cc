@@ -16,7 +16,7 @@
 
 namespace {
 
-using capture::currentTimeMillis;
+using capture::steadyMillis;
 using capture::video::Clip;
 using capture::video::Frame;
 using capture::video::FrameQueue;
@@ -57,7 +57,7 @@ void stop(FrameQueue& queue, Clip& clip, int64_t at) {
 }
 
 void sleepUntil(int64_t ms) {
-  std::this_thread::sleep_until(std::chrono::system_clock::time_point(std::chrono::milliseconds(ms)));
+  std::this_thread::sleep_until(std::chrono::steady_clock::time_point(std::chrono::milliseconds(ms)));
 }
 
 // A recording on its own thread, as a display's recording thread runs it.
@@ -86,13 +86,13 @@ bool near(const std::vector<uint8_t>& got, const uint8_t* want) {
 TEST(MFTEncoder, AStillPictureIsRecordedFromTheStartToTheStopAndTheFileEndsAtOnce) {
   media::TempFolder folder;
   FrameQueue queue(L"display", 320, 240, 0);
-  const int64_t start = currentTimeMillis();
+  const int64_t start = steadyMillis();
   // The picture current at the start was captured long before it.
   auto clip = std::make_shared<Clip>(platform::widen(folder.file("still.mp4")), start, frameAt(queue, start - 5000));
   push(queue, frameAt(queue, start - 5000));
   Recording recording(queue, clip);
   sleepUntil(start + 400);
-  const int64_t end = currentTimeMillis();
+  const int64_t end = steadyMillis();
   stop(queue, *clip, end);
   // Nothing more comes from the screen; the file is finished all the same.
   ASSERT_EQ(recording.done.wait_for(std::chrono::seconds(5)), std::future_status::ready);
@@ -114,7 +114,7 @@ TEST(MFTEncoder, AStillPictureIsRecordedFromTheStartToTheStopAndTheFileEndsAtOnc
 TEST(MFTEncoder, NewPicturesKeepTheirCaptureTimesAndThePictureCurrentAtTheStopEndsTheClip) {
   media::TempFolder folder;
   FrameQueue queue(L"display", 160, 120, 0);
-  const int64_t start = currentTimeMillis();
+  const int64_t start = steadyMillis();
   auto clip = std::make_shared<Clip>(platform::widen(folder.file("times.mp4")), start, frameAt(queue, start - 20));
   Recording recording(queue, clip);
   push(queue, frameAt(queue, start + 33));
@@ -152,7 +152,7 @@ TEST(MFTEncoder, NewPicturesKeepTheirCaptureTimesAndThePictureCurrentAtTheStopEn
 TEST(MFTEncoder, AClipWithoutAPictureAtItsStartBeginsWithTheFirstOneAtTimeZero) {
   media::TempFolder folder;
   FrameQueue queue(L"display", 1920, 1080, 0);
-  const int64_t start = currentTimeMillis();
+  const int64_t start = steadyMillis();
   auto clip = std::make_shared<Clip>(platform::widen(folder.file("fullhd.mp4")), start, nullptr);
   Recording recording(queue, clip);
   push(queue, frameAt(queue, start + 50));
@@ -175,7 +175,7 @@ TEST(MFTEncoder, AFailureAfterStartUpShutsMediaFoundationDownBeforeItLeaves) {
   media::TempFolder folder;
   FrameQueue queue(L"display", 64, 64, 0);
   MFTEncoder encoder(
-      std::make_shared<Clip>(platform::widen(folder.file("missing/clip.mp4")), currentTimeMillis(), frameAt(queue, 1)));
+      std::make_shared<Clip>(platform::widen(folder.file("missing/clip.mp4")), steadyMillis(), frameAt(queue, 1)));
   const std::string text = testsupport::failureOf([&] { encoder.encode(&queue); });
   EXPECT_NE(text.find("\tnative/capture/video/encoder/mftencoder(54): 0x80070003: Could not create sink. "
                       "(The system cannot find the path specified.)"),

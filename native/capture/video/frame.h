@@ -22,7 +22,7 @@ struct Frame {
   uint64_t rowPixels = 0;     // equal to width: rows are packed
   uint32_t channelOrder = 0;  // 0 display, 1 camera
   Pixels data;                // top-down rows, bytes B, G, R, A
-  int64_t timestamp = 0;      // ms since 1970 when the frame was built
+  int64_t timestamp = 0;      // steadyMillis() when the frame was built
 
   // A frame of width x height pixels with uninitialised pixel bytes, from pool when it is given
   // and of that size.
@@ -66,15 +66,15 @@ struct FrameQueue {
 };
 
 // One recording of a display: what its recording thread needs besides the queue. A clip covers
-// the wall-clock time from its start to its stop, whatever the picture does in between.
+// the time from its start to its stop, whatever the picture does in between.
 struct Clip {
   Clip(std::wstring path, int64_t start, std::unique_ptr<Frame> first)
       : path(std::move(path)), start(start), first(std::move(first)) {}
 
   const std::wstring path;
-  const int64_t start;           // ms since 1970, when the file was accepted
+  const int64_t start;           // steadyMillis() when the file was accepted
   std::unique_ptr<Frame> first;  // the picture current at the start; null when there was none yet
-  std::atomic<int64_t> stop{0};  // ms since 1970 of the stop request, 0 while recording
+  std::atomic<int64_t> stop{0};  // steadyMillis() of the stop request, 0 while recording
 };
 
 }  // namespace capture::video

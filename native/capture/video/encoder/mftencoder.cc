@@ -33,8 +33,8 @@ constexpr int64_t stillMilliseconds = 34;
 LONGLONG slotOf(LONGLONG time) { return (time * slotsPerSecond + 5000000) / 10000000; }
 LONGLONG timeOfSlot(LONGLONG slot) { return slot * 10000000 / slotsPerSecond; }
 
-std::chrono::system_clock::time_point atMillis(int64_t ms) {
-  return std::chrono::system_clock::time_point(std::chrono::milliseconds(ms));
+std::chrono::steady_clock::time_point atMillis(int64_t ms) {
+  return std::chrono::steady_clock::time_point(std::chrono::milliseconds(ms));
 }
 
 }  // namespace
@@ -76,7 +76,7 @@ void MFTEncoder::record() {
       write(std::move(picture), time);
     } else if (repeat) {
       // Behind the clock (a busy machine), the repeats skip ahead instead of piling up.
-      const LONGLONG now = (currentTimeMillis() - clip->start) * ticksPerMillisecond;
+      const LONGLONG now = (steadyMillis() - clip->start) * ticksPerMillisecond;
       const LONGLONG time = timeOfSlot(slotOf(std::max(lastTime + frameInterval, now - 2 * frameInterval)));
       writeFrame(*last, time);
       lastTime = time;
@@ -103,7 +103,7 @@ std::unique_ptr<Frame> MFTEncoder::nextPicture(bool& repeat) {
     // A repeat is written one interval late, so that none is ever placed past a stop that
     // comes in the meantime: the picture held to the stop fills that last stretch.
     if (last) due = std::min(due, clip->start + (lastTime + 2 * frameInterval) / ticksPerMillisecond + 1);
-    if (due != INT64_MAX && currentTimeMillis() >= due) {
+    if (due != INT64_MAX && steadyMillis() >= due) {
       if (unwritten) return newest->clone();
       repeat = true;
       return nullptr;

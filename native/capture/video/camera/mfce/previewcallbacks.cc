@@ -110,7 +110,7 @@ HRESULT CaptureManager::CaptureEngineVideoPreviewCB::OnSample(IMFSample* sample)
   DWORD length = 0;
   if (lockSample(sample, buffer, &data, &length) != S_OK) return S_FALSE;
   // The engine delivers whole ARGB32 pictures of the queue's size; the length is not compared.
-  replaceFrame(*manager->frameQueue, data, capture::currentTimeMillis());
+  replaceFrame(*manager->frameQueue, data, capture::steadyMillis());
   return unlockSample(buffer.Get());
 }
 

@@ -106,7 +106,7 @@ void Source::capture() {
   hr = context->Map(stagingTexture.Get(), 0, D3D11_MAP_READ, 0, &mapped);
   capture::checkResult("native/capture/video/screen/dxgi/source", 94, hr, "Could not map device context for image.");
 
-  auto frame = capture::video::Frame::make(outputWidth, outputHeight, 0, capture::currentTimeMillis(), queue->pixels);
+  auto frame = capture::video::Frame::make(outputWidth, outputHeight, 0, capture::steadyMillis(), queue->pixels);
   // Rows are taken as packed at outputWidth * 4 bytes; RowPitch is not consulted.
   capture::video::copyPicture(frame->data.get(), mapped.pData, frame->size);
   if (captureMouse) drawPointer(pointer, *frame);
@@ -137,7 +137,7 @@ void Source::startEncode(std::string filename) {
   std::shared_ptr<capture::video::Clip> started;
   {
     std::lock_guard<std::mutex> lock(queue->mutex);
-    const int64_t now = capture::currentTimeMillis();
+    const int64_t now = capture::steadyMillis();
     if (clip && clip->stop.load() == 0) clip->stop = now;
     queue->path = capture::toWide(filename);
     started = std::make_shared<capture::video::Clip>(queue->path, now,
@@ -152,7 +152,7 @@ void Source::startEncode(std::string filename) {
 void Source::stopEncode() {
   {
     std::lock_guard<std::mutex> lock(queue->mutex);
-    if (clip && clip->stop.load() == 0) clip->stop = capture::currentTimeMillis();
+    if (clip && clip->stop.load() == 0) clip->stop = capture::steadyMillis();
     queue->stopped = true;
   }
   queue->changed.notify_all();
