@@ -29,7 +29,7 @@ DeviceReader::DeviceReader(std::shared_ptr<Input> input, Deliver deliver, bool w
     while (!shared->stop.load()) {
       AVPacket* packet = av_packet_alloc();
       const int error = packet ? av_read_frame(input->format, packet) : AVERROR(ENOMEM);
-      const int64_t readAt = av_gettime();
+      const int64_t readAt = av_gettime_relative();
       if (shared->stop.load()) {
         av_packet_free(&packet);
         break;

@@ -17,9 +17,9 @@ namespace platform::capturedevice {
 
 class DeviceReader {
  public:
-  // Called on the reader's thread for each packet read (the callee owns it), with the wall clock
-  // (µs) at which the read returned; a failed read comes as a null packet and its error, and ends
-  // the thread.
+  // Called on the reader's thread for each packet read (the callee owns it), with the time
+  // (av_gettime_relative, µs) at which the read returned; a failed read comes as a null packet and
+  // its error, and ends the thread.
   using Deliver = std::function<void(AVPacket* packet, int64_t readAt, int error)>;
 
   // waitOnStop: the destructor waits (a second at most) for the read in progress to end and the

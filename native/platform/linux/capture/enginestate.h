@@ -35,7 +35,7 @@ enum class Command { StartPreview, StopPreview, StartRecord, StopRecord, Quit };
 struct Order {
   Order(Command command, int64_t at) : command(command), at(at) {}
   Command command;
-  int64_t at;  // av_gettime() of the call
+  int64_t at;  // av_gettime_relative() of the call
   std::string path;
   std::vector<SinkStream> streams;
 };

@@ -6,6 +6,7 @@
 // commands, and since the thread never reads a device itself, it takes them between two packets.
 // A camera that sends H.264 is recorded as it sends it when the record stream asks for H.264
 // without a bit rate of its own; its pictures are still decoded for the preview.
+// Engine time is av_gettime_relative(): a step of the system clock moves no clip's start or stop.
 extern "C" {
 #include <libavcodec/avcodec.h>
 #include <libavformat/avformat.h>
@@ -18,6 +19,7 @@ extern "C" {
 #include <algorithm>
 #include <cstdint>
 #include <condition_variable>
+#include <cstdlib>
 #include <cstring>
 #include <deque>
 #include <memory>
@@ -119,14 +121,14 @@ HRESULT makeSample(DWORD length, LONGLONG time, LONGLONG duration, Fill fill, IM
 }
 
 // One clip: the record sink's writer and its converters, from record start until the file is
-// finished. A clip covers the wall-clock interval from the StartRecord call to the StopRecord
-// call: what the devices captured in it goes in, a picture lasts until the next one (the last one
-// until the stop), and sound missing at the ends is silence.
+// finished. A clip covers the interval from the StartRecord call to the StopRecord call: what the
+// devices captured in it goes in, a picture lasts until the next one (the last one until the
+// stop), and sound missing at the ends is silence.
 struct Recording {
   ~Recording() { swr_free(&resampler); }
-  LONGLONG sinceStart(int64_t at) const { return (at - startAt) * 10; }  // wall clock (µs) to media time
+  LONGLONG sinceStart(int64_t at) const { return (at - startAt) * 10; }  // engine time (µs) to media time
   ComPtr<IMFSinkWriter> writer;
-  int64_t startAt = 0;     // wall clock (µs) of the StartRecord call
+  int64_t startAt = 0;     // engine time (µs) of the StartRecord call
   int64_t stopAt = 0;      // of the StopRecord call; 0 while it records
   HRESULT failure = S_OK;  // the first write that failed; nothing is written after it
   DWORD videoStream = 0;
@@ -147,7 +149,7 @@ struct Recording {
   int audioRate = 0;
   int audioChannels = 0;
   LONGLONG audioSamples = 0;
-  int64_t audioReachedAt = INT64_MIN;  // wall clock (µs) up to which sound has come
+  int64_t audioReachedAt = INT64_MIN;  // engine time (µs) up to which sound has come
 };
 
 // What a clip shows when its camera sent no picture: black, in the form the encoder takes.
@@ -180,6 +182,11 @@ ComPtr<IMFSample> blackPicture(const Recording& recording) {
 constexpr int64_t videoGrace = 250000;     // µs after the stop to wait for the stop's picture
 constexpr int64_t soundGrace = 500000;     // and for its sound, which may come in large lumps
 constexpr int64_t soundHistory = 5000000;  // how far back the microphone's deliveries are kept
+// The pulse input stamps sound by the system clock, smoothed over its recent buffers: after a step
+// of that clock its stamps stray by up to the step for about a second. Until they have settled,
+// sound is timed by when it was read.
+constexpr int64_t clockStep = 10000;        // µs the system clock moved against engine time
+constexpr int64_t stampSettling = 3000000;  // µs after a step before stamps are believed again
 
 class EngineThread {
  public:
@@ -230,8 +237,10 @@ class EngineThread {
   LONGLONG lastPictureTime_ = 0;
   int64_t lastPictureReadAt_ = 0;
   AVFrame* lastSound_ = nullptr;       // the microphone's last buffer
-  int64_t lastSoundAt_ = 0;            // when its first sample was captured (wall clock, µs)
-  std::deque<int64_t> soundArrivals_;  // when its buffers were read (wall clock, µs), oldest first
+  int64_t lastSoundAt_ = 0;            // when its first sample was captured (engine time, µs)
+  std::deque<int64_t> soundArrivals_;  // when its buffers were read (engine time, µs), oldest first
+  int64_t wallOffset_ = 0;             // system clock minus engine time at its last buffer; 0: none yet
+  int64_t stampsFrom_ = 0;             // engine time from which its stamps are believed
 };
 
 void EngineThread::send(const GUID& type, HRESULT status) {
@@ -291,6 +300,8 @@ void EngineThread::closeDevices() {
   lastI420_ = ComPtr<IMFSample>();
   av_frame_unref(lastSound_);
   soundArrivals_.clear();
+  wallOffset_ = 0;
+  stampsFrom_ = 0;
   sws_freeContext(toI420_);
   toI420_ = nullptr;
   sws_freeContext(toBgra_);
@@ -418,7 +429,7 @@ void EngineThread::stopRecording(int64_t at) {
   finishDue(false);
 }
 
-// When the next stopped clip must be finished whatever has come (wall clock, µs); 0: none waits.
+// When the next stopped clip must be finished whatever has come (engine time, µs); 0: none waits.
 int64_t EngineThread::nextDeadline() const {
   int64_t next = 0;
   for (const auto& recording : finishing_) {
@@ -442,7 +453,7 @@ bool EngineThread::soundCanComeBy(int64_t due) const {
 // whose grace has run out (all: every one, now), and answers each StopRecord once its file is
 // complete.
 void EngineThread::finishDue(bool all) {
-  const int64_t now = av_gettime();
+  const int64_t now = av_gettime_relative();
   for (auto it = finishing_.begin(); it != finishing_.end();) {
     Recording& recording = **it;
     const int64_t due = recording.stopAt + (recording.hasAudio ? soundGrace : videoGrace);
@@ -495,7 +506,7 @@ void EngineThread::write(Recording& recording, DWORD stream, IMFSample* sample) 
 // as the device recorded.
 void EngineThread::fail(HRESULT status) {
   if (current_) {
-    current_->stopAt = std::max(av_gettime(), current_->startAt);
+    current_->stopAt = std::max(av_gettime_relative(), current_->startAt);
     finishing_.push_back(std::move(current_));
   }
   for (auto& recording : finishing_) finish(*recording);
@@ -657,12 +668,17 @@ void EngineThread::deliverAudio(AVFrame* frame, int64_t pts, AVRational timeBase
   const DWORD length = static_cast<DWORD>(frame->nb_samples * channels * 2);
   const LONGLONG duration = av_rescale(frame->nb_samples, ticksPerSecond, f.sampleRate);
 
-  // The pulse input stamps a packet with the wall clock (µs) of its first sample, from the stream's
-  // latency. A new stream's first packet has come stamped as if captured from its arrival on
-  // (PulseAudio's sine source: a two-second lump ahead of the clock); sound cannot end after it
+  // The pulse input stamps a packet with the system clock (µs) of its first sample, from the
+  // stream's latency. A new stream's first packet has come stamped as if captured from its arrival
+  // on (PulseAudio's sine source: a two-second lump ahead of the clock); sound cannot end after it
   // was read.
   const int64_t span = frame->sample_rate > 0 ? av_rescale(frame->nb_samples, 1000000, frame->sample_rate) : 0;
-  const int64_t stamped = pts == AV_NOPTS_VALUE ? INT64_MAX : av_rescale_q(pts, timeBase, AVRational{1, 1000000});
+  const int64_t wallOffset = av_gettime() - av_gettime_relative();
+  if (wallOffset_ && std::llabs(wallOffset - wallOffset_) > clockStep) stampsFrom_ = readAt + stampSettling;
+  wallOffset_ = wallOffset;
+  const int64_t stamped = pts == AV_NOPTS_VALUE || readAt < stampsFrom_
+                              ? INT64_MAX
+                              : av_rescale_q(pts, timeBase, AVRational{1, 1000000}) - wallOffset;
   const int64_t capturedAt = std::min(stamped, readAt - span);
   // Kept for a clip that starts while this buffer's sound is still current.
   av_frame_unref(lastSound_);
@@ -922,7 +938,8 @@ void EngineThread::run() {
       auto ready = [this] { return !state_->commands.empty() || !state_->arrivals.empty(); };
       const int64_t deadline = nextDeadline();
       if (deadline)
-        state_->changed.wait_for(lock, std::chrono::microseconds(std::max<int64_t>(0, deadline - av_gettime())), ready);
+        state_->changed.wait_for(
+            lock, std::chrono::microseconds(std::max<int64_t>(0, deadline - av_gettime_relative())), ready);
       else
         state_->changed.wait(lock, ready);
       orders.swap(state_->commands);
@@ -949,7 +966,7 @@ void EngineThread::run() {
     if (!previewing && !current_ && finishing_.empty()) closeDevices();
   }
   if (current_) {
-    current_->stopAt = av_gettime();
+    current_->stopAt = av_gettime_relative();
     finishing_.push_back(std::move(current_));
   }
   finishDue(true);

@@ -213,7 +213,7 @@ class CaptureEngine : public ComObject<IMFCaptureEngine, IID_IMFCaptureEngine> {
     if (!thread_.joinable()) return MF_E_NOT_INITIALIZED;
     {
       std::lock_guard<std::mutex> lock(state_->mutex);
-      Order order(command, av_gettime());
+      Order order(command, av_gettime_relative());
       if (command == Command::StartRecord) {
         order.path = state_->recordPath;
         order.streams = state_->recordStreams;
