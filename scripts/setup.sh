@@ -11,7 +11,7 @@ packages=(
   libpulse-dev libdbus-1-dev
   xvfb x11-xserver-utils xdotool pulseaudio pulseaudio-utils ffmpeg sox
   gstreamer1.0-tools gstreamer1.0-plugins-base gstreamer1.0-plugins-good gstreamer1.0-libav
-  gstreamer1.0-plugins-base-apps mediainfo
+  gstreamer1.0-plugins-base-apps mediainfo libfaketime
   g++-mingw-w64-x86-64-posix mingw-w64-x86-64-dev
   chromium
   wine wine64
