@@ -63,8 +63,9 @@ for (const step of ['+30', '-30']) {
     assert.strictEqual(code, 0, stdout + stderr);
     const [{ walls, stopMs }] = reports;
     assert.deepStrictEqual(Object.keys(walls).sort(), ['dxgi', 'mfce_audio', 'mfce_video', 'wasapi']);
-    // A microphone that sends two seconds at once is waited for up to half a second.
-    assert.ok(stopMs < 700, `stopping took ${stopMs} ms`);
+    // A microphone that sends two seconds at once is waited for up to half a second; a stop that
+    // waits for the system clock to come back takes the whole step.
+    assert.ok(stopMs < 1500, `stopping took ${stopMs} ms`);
     for (const [type, wall] of Object.entries(walls)) {
       const file = path.join(dir, `${type}${step}.mp4`);
       const seconds = probe(file);
