@@ -33,6 +33,12 @@ constexpr int64_t kDriftLimit = 2000000;
 // with what it rendered before. Loopback on Windows delivers packets all along while the
 // silence stream plays, so time that passes this long without data is handed out as silence.
 constexpr int64_t kStallLimit = 2000000;
+// A capture thread that was held up itself (a stopped or starved process) finds the sound the sink
+// played meanwhile still queued, in the server and here, and it comes over in pieces, so the queue
+// here does not tell its age: for a second after such a pause packets follow the sample count, and
+// a stall counts from the first empty poll after it.
+constexpr int64_t kHeldUp = 2500000;  // a pause between two polls, which normally come every 5 ms
+constexpr int64_t kCatchUp = 10000000;
 
 // Everything the audio client and its services share; it outlives whichever of them goes last.
 struct Stream {
@@ -62,6 +68,9 @@ struct Stream {
   UINT64 anchorPosition = 0;
   bool synthesized = false;  // the held packet is silence made here, not the server's
   bool filled = false;       // the last packet released was such silence
+  UINT64 emptySince = 0;     // the first of the polls in a row that found no data; 0 after data
+  UINT64 lastPoll = 0;
+  UINT64 countOnlyUntil = 0;  // the end of a catch-up after the capture thread was held up
 
   // The capture time of the frame at `frames` on the current time line.
   UINT64 timeOf(UINT64 frames) const {
@@ -116,10 +125,16 @@ class CaptureClient : public ComObject<IAudioCaptureClient, IID_IAudioCaptureCli
     // Most polls find the queue empty; those need not ask libpulse.
     if (s_->readable > 0 && pa_stream_peek(s_->stream, &bytes, &size) < 0) return AUDCLNT_E_DEVICE_INVALIDATED;
     const UINT64 now = performanceCounterPosition();
+    if (s_->lastPoll && now - s_->lastPoll > kHeldUp) {
+      s_->countOnlyUntil = now + kCatchUp;
+      s_->emptySince = 0;  // the polls before the pause saw nothing of it
+    }
+    s_->lastPoll = now;
     if (devicePosition) *devicePosition = s_->position;
     if (size == 0) {
+      if (!s_->emptySince) s_->emptySince = now;
       const UINT64 covered = s_->timeOf(s_->position);
-      if (!s_->started || !s_->anchored || now < covered + kStallLimit) {
+      if (!s_->started || !s_->anchored || now < std::max(covered, s_->emptySince) + kStallLimit) {
         if (qpcPosition) *qpcPosition = now;
         return AUDCLNT_S_BUFFER_EMPTY;
       }
@@ -137,6 +152,7 @@ class CaptureClient : public ComObject<IAudioCaptureClient, IID_IAudioCaptureCli
       s_->synthesized = true;
       return S_OK;
     }
+    s_->emptySince = 0;
     const uint32_t count = static_cast<uint32_t>(size / s_->frameBytes);
     if (bytes) {
       *data = static_cast<BYTE*>(const_cast<void*>(bytes));
@@ -160,7 +176,7 @@ class CaptureClient : public ComObject<IAudioCaptureClient, IID_IAudioCaptureCli
       s_->anchorPosition = s_->position;
     }
     const int64_t drift = static_cast<int64_t>(measured - time);
-    if (!s_->anchored || drift > kDriftLimit || drift < -kDriftLimit) {
+    if (!s_->anchored || (now >= s_->countOnlyUntil && (drift > kDriftLimit || drift < -kDriftLimit))) {
       if (s_->anchored) *flags |= AUDCLNT_BUFFERFLAGS_DATA_DISCONTINUITY;
       s_->anchored = true;
       s_->anchorTime = time = measured;
