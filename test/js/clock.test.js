@@ -59,29 +59,36 @@ after(() => {
   fs.rmSync(dir, { recursive: true, force: true });
 });
 
+// A host that records every source into `<dir>/<prefix><type>.mp4`, runs `during` one second in,
+// and stops each source in turn once `during` has resolved; it reports the seconds from the start
+// to each source's stop (by performance.now(): Date.now() may be the stepped clock) and how long
+// the stops took, as { walls, stopMs }.
+function recordAll(prefix, during) {
+  return `
+    addon.initialize();
+    const sources = events.filter((e) => e.type === 'new source').map((e) => e.source);
+    await sleep(1000);
+    const started = performance.now();
+    for (const s of sources) addon.startCapture(s.id, ${JSON.stringify(`${dir}/${prefix}`)} + s.type + '.mp4');
+    await sleep(1000);
+    ${during}
+    const walls = {};
+    const stopping = performance.now();
+    for (const s of sources) {
+      walls[s.type] = (performance.now() - started) / 1000;
+      addon.stopCapture(s.id);
+    }
+    const stopMs = performance.now() - stopping;
+    await sleep(1500);
+    report({ walls, stopMs });`;
+}
+
 for (const step of ['+30', '-30']) {
   test(`the system clock stepped by ${step} s mid-clip: every clip lasts its start to its stop`, async () => {
     const offsetFile = path.join(dir, `offset${step}`);
     fs.writeFileSync(offsetFile, '+0\n');
-    const { reports, code, stdout, stderr } = await runAddon(`
-      addon.initialize();
-      const sources = events.filter((e) => e.type === 'new source').map((e) => e.source);
-      await sleep(1000);
-      // Date.now() is the stepped clock; performance.now() runs on.
-      const started = performance.now();
-      for (const s of sources) addon.startCapture(s.id, ${JSON.stringify(dir)} + '/' + s.type + '${step}.mp4');
-      await sleep(1000);
-      require('fs').writeFileSync(${JSON.stringify(offsetFile)}, '${step}\\n');
-      await sleep(1500);
-      const walls = {};
-      const stopping = performance.now();
-      for (const s of sources) {
-        walls[s.type] = (performance.now() - started) / 1000;
-        addon.stopCapture(s.id);
-      }
-      const stopMs = performance.now() - stopping;
-      await sleep(1500);
-      report({ walls, stopMs });`, {
+    const during = `require('fs').writeFileSync(${JSON.stringify(offsetFile)}, '${step}\\n'); await sleep(1500);`;
+    const { reports, code, stdout, stderr } = await runAddon(recordAll(`step${step}-`, during), {
       env: {
         ...desktop.env, TAVIO_TEST_CAMERAS: CAMERAS, LD_PRELOAD: FAKETIME, FAKETIME_TIMESTAMP_FILE: offsetFile,
         FAKETIME_NO_CACHE: '1', FAKETIME_DONT_FAKE_MONOTONIC: '1', FAKETIME_DONT_RESET: '1',
@@ -93,7 +100,7 @@ for (const step of ['+30', '-30']) {
     // A microphone that sends two seconds at once is waited for up to half a second; a stop that
     // waits for the system clock to come back takes the whole step.
     assert.ok(stopMs < 1500, `stopping took ${stopMs} ms`);
-    assertClips(walls, (type) => path.join(dir, `${type}${step}.mp4`));
+    assertClips(walls, (type) => path.join(dir, `step${step}-${type}.mp4`));
     assert.doesNotMatch(stdout, /Warning/);
   });
 }
@@ -101,27 +108,17 @@ for (const step of ['+30', '-30']) {
 test('a host held up for four seconds mid-clip: every clip lasts its start to its stop, the endpoint\'s tone without a gap', async (t) => {
   const tone = playTone(desktop.env, { sink: 'tavio_speakers' });
   t.after(() => tone.kill());
-  const { reports, code, stdout, stderr } = await runAddon(`
-    addon.initialize();
-    const sources = events.filter((e) => e.type === 'new source').map((e) => e.source);
-    await sleep(1000);
-    const started = performance.now();
-    for (const s of sources) addon.startCapture(s.id, ${JSON.stringify(dir)} + '/held-' + s.type + '.mp4');
-    await sleep(1000);
-    const stopAt = performance.now() + 6000;  // two seconds after the host goes on
+  // Stopped by a shell it starts; the stops come two seconds after it goes on.
+  const during = `
+    const stopAt = performance.now() + 6000;
     require('child_process').spawn('sh', ['-c', 'kill -STOP ' + process.pid + '; sleep 4; kill -CONT ' + process.pid],
       { stdio: 'ignore', detached: true });
-    while (performance.now() < stopAt) await sleep(50);
-    const walls = {};
-    for (const s of sources) {
-      walls[s.type] = (performance.now() - started) / 1000;
-      addon.stopCapture(s.id);
-    }
-    await sleep(1500);
-    report(walls);`, { env: { ...desktop.env, TAVIO_TEST_CAMERAS: CAMERAS }, timeoutMs: 30000 });
+    while (performance.now() < stopAt) await sleep(50);`;
+  const { reports, code, stdout, stderr } = await runAddon(recordAll('held-', during),
+    { env: { ...desktop.env, TAVIO_TEST_CAMERAS: CAMERAS }, timeoutMs: 30000 });
   assert.strictEqual(code, 0, stdout + stderr);
   const file = (type) => path.join(dir, `held-${type}.mp4`);
-  assertClips(reports[0], file);
+  assertClips(reports[0].walls, file);
   // The sink may hold its first sound back a while; from then on the tone plays throughout.
   const quiet = silences(file('wasapi'));
   const first = quiet.findIndex((at, i) => Math.round(at * 20) !== i);
