@@ -37,8 +37,8 @@ constexpr int64_t kStallLimit = 2000000;
 // played meanwhile still queued, in the server and here, and it comes over in pieces, so the queue
 // here does not tell its age: for a second after such a pause packets follow the sample count, and
 // a stall counts from the first empty poll after it.
-constexpr int64_t kHeldUp = 2500000;  // a pause between two polls, which normally come every 5 ms
-constexpr int64_t kCatchUp = 10000000;
+constexpr int64_t kHeldUp = 2500000;    // a pause between two polls, which normally come every 5 ms
+constexpr int64_t kCatchUp = 10000000;  // a second of following the sample count
 
 // Everything the audio client and its services share; it outlives whichever of them goes last.
 struct Stream {
@@ -66,10 +66,10 @@ struct Stream {
   bool anchored = false;
   UINT64 anchorTime = 0;
   UINT64 anchorPosition = 0;
-  bool synthesized = false;  // the held packet is silence made here, not the server's
-  bool filled = false;       // the last packet released was such silence
-  UINT64 emptySince = 0;     // the first of the polls in a row that found no data; 0 after data
-  UINT64 lastPoll = 0;
+  bool synthesized = false;   // the held packet is silence made here, not the server's
+  bool filled = false;        // the last packet released was such silence
+  UINT64 emptySince = 0;      // the first of the polls in a row that found no data; 0 after data
+  UINT64 lastPoll = 0;        // when GetBuffer last ran
   UINT64 countOnlyUntil = 0;  // the end of a catch-up after the capture thread was held up
 
   // The capture time of the frame at `frames` on the current time line.
