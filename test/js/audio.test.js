@@ -8,7 +8,7 @@ const fs = require('fs');
 const os = require('os');
 const path = require('path');
 const { runAddon } = require('./addon');
-const { probe } = require('./clips');
+const { probe, decode } = require('./clips');
 const { startDesktop } = require('../../scripts/desktop');
 
 const SINKS = [
@@ -43,12 +43,6 @@ function power(samples, rate, frequency) {
     s1 = s0;
   }
   return (s1 * s1 + s2 * s2 - k * s1 * s2) / (samples.length * samples.length);
-}
-
-function decode(file, rate) {
-  const raw = execFileSync('ffmpeg', ['-v', 'error', '-i', file, '-f', 'f32le', '-ac', '1', '-ar', String(rate), '-'],
-    { maxBuffer: 1 << 28 });
-  return new Float32Array(raw.buffer, raw.byteOffset, raw.length / 4);
 }
 
 test('audio endpoints', async (t) => {

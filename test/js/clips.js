@@ -20,6 +20,13 @@ function decodeErrors(file) {
   return spawnSync('ffmpeg', ['-v', 'error', '-i', file, '-f', 'null', '-'], { encoding: 'utf8' }).stderr.trim();
 }
 
+// The file's sound as FFmpeg decodes it, mixed to one channel at `rate`: 32-bit float samples.
+function decode(file, rate = 48000) {
+  const raw = execFileSync('ffmpeg', ['-v', 'error', '-i', file, '-f', 'f32le', '-ac', '1', '-ar', String(rate), '-'],
+    { maxBuffer: 1 << 28 });
+  return new Float32Array(raw.buffer, raw.byteOffset, raw.length / 4);
+}
+
 // What two other players make of the file: GStreamer plays it to the end without an error
 // (`played`), and GStreamer's and MediaInfo's durations in seconds (NaN when they find none).
 function otherPlayers(file) {
@@ -35,4 +42,4 @@ function otherPlayers(file) {
   };
 }
 
-module.exports = { probe, duration, decodeErrors, otherPlayers };
+module.exports = { probe, duration, decodeErrors, decode, otherPlayers };

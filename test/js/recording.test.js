@@ -12,7 +12,7 @@ const os = require('os');
 const path = require('path');
 const { startDesktop } = require('../../scripts/desktop');
 const { runAddon, root } = require('./addon');
-const { duration: probe, decodeErrors, otherPlayers } = require('./clips');
+const { duration: probe, decodeErrors, decode, otherPlayers } = require('./clips');
 
 let dir;
 let flashbeep;
@@ -47,8 +47,7 @@ function flashTime(file) {
 
 // Seconds into the clip of the first sample louder than 0.1.
 function beepTime(file) {
-  const raw = execFileSync('ffmpeg', ['-v', 'error', '-i', file, '-ac', '1', '-ar', '48000', '-f', 'f32le', '-'], { maxBuffer: 1 << 28 });
-  const samples = new Float32Array(raw.buffer, raw.byteOffset, raw.length / 4);
+  const samples = decode(file);
   const index = samples.findIndex((v) => Math.abs(v) > 0.1);
   return index < 0 ? NaN : index / 48000;
 }
