@@ -237,12 +237,9 @@ NAN_METHOD(mouseCapture) {
 // runs, each source stops its clip and the files are finished, for a few seconds at the most.
 void finishEveryClip() {
   const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(3);
-  // Clips that stop at once stop first: a camera's stop may wait for its microphone's last sound,
-  // and the clips of the other sources would run on meanwhile.
-  for (size_t i = 0; i < sources.size(); ++i) {
-    const int32_t type = sources[i]->type();
-    if (type == capture::Screen || type == capture::AudioEndpoint) sources[i]->stopEncode();
-  }
+  // Every clip ends at this moment, before any file is waited for: a camera's stop may wait for
+  // its microphone's last sound, and clips stopped after it would run on meanwhile.
+  for (const auto& source : sources) source->endClip();
   for (size_t i = 0; i < sources.size(); ++i) {
     try {
       sources[i]->finishClips(deadline);

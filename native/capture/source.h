@@ -27,8 +27,10 @@ class Source {
   virtual void stopCapturing() = 0;
   virtual void startEncode(std::string filename) = 0;
   virtual void stopEncode() = 0;
-  // Stops the clip that records and returns once every clip of this source is in its file, or at
-  // the deadline; for a host that ends while it records.
+  // For a host that ends while it records: endClip ends the clip that records at this moment,
+  // without waiting for its file; finishClips stops it if it still records and returns once every
+  // clip of this source is in its file, or at the deadline.
+  virtual void endClip() { stopEncode(); }
   virtual void finishClips(std::chrono::steady_clock::time_point /*deadline*/) {}
   virtual bool selected() = 0;
 };

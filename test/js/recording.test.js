@@ -225,13 +225,17 @@ test('a host that ends while recording (process.exit, an uncaught exception, a s
         if (how === 'exit') process.exit(0);
         if (how === 'throw') setTimeout(() => { throw new Error('a host that fails'); });
         else process.kill(process.pid, how.split(',')[0]);
-        await sleep(5000);`, { env: { ...env, TAVIO_TEST_CAMERAS: 'Exit Camera=testsrc2=size=320x240:rate=30' } });
+        await sleep(5000);`, { env: { ...env, TAVIO_TEST_CAMERAS: 'Exit Camera=testsrc2=size=320x240:rate=1' } });
       // The process still ends as it would have without the add-on.
       assert.deepStrictEqual({ code, signal }, { exit: { code: 0, signal: null }, throw: { code: 1, signal: null },
         SIGINT: { code: null, signal: 'SIGINT' }, SIGTERM: { code: null, signal: 'SIGTERM' },
         'SIGINT, handled': { code: 0, signal: null } }[how], how);
       const { clips, seconds } = reports[0];
       assert.deepStrictEqual([...new Set(clips.map((c) => c.type))].sort(), ['dxgi', 'mfce_audio', 'mfce_video', 'wasapi']);
+      // Every clip ends at the same moment, also those after a camera whose stop waits for its next
+      // picture (one a second here, waited for up to a quarter of a second).
+      const durations = clips.map((c) => probe(c.file));
+      assert.ok(Math.max(...durations) - Math.min(...durations) <= 0.12, `${how}: ${durations.join(' s, ')} s`);
       for (const { type, file } of clips) {
         // Up to the moment the host ended; before, the last unfinished piece of every file was lost.
         const duration = probe(file);

@@ -325,11 +325,23 @@ HRESULT CaptureManager::StartRecord(LPCWSTR path) {
 }
 
 HRESULT CaptureManager::StopRecord() {
-  if (!HasEngine() || !recording) return S_OK;
-  const Mark before = mark();
-  HRESULT hr = engine->StopRecord(TRUE, FALSE);
-  if (SUCCEEDED(hr)) waitFor(before, RecordStopped);
+  const HRESULT hr = BeginStopRecord();
+  FinishStopRecord();
   return hr;
+}
+
+HRESULT CaptureManager::BeginStopRecord() {
+  if (stopPending_ || !HasEngine() || !recording) return S_OK;
+  stopMark_ = mark();
+  const HRESULT hr = engine->StopRecord(TRUE, FALSE);
+  stopPending_ = SUCCEEDED(hr);
+  return hr;
+}
+
+void CaptureManager::FinishStopRecord() {
+  if (!stopPending_) return;
+  stopPending_ = false;
+  waitFor(stopMark_, RecordStopped);
 }
 
 HRESULT CaptureManager::HandleEngineEvent(IMFMediaEvent* event) {

@@ -77,6 +77,10 @@ class CaptureManager {
   HRESULT StopPreview();
   HRESULT StartRecord(LPCWSTR path);
   HRESULT StopRecord();
+  // StopRecord in two halves, so that several engines end their clips at one moment: the engine
+  // is told to stop now, and FinishStopRecord waits until the file is written.
+  HRESULT BeginStopRecord();
+  void FinishStopRecord();
   HRESULT HandleEngineEvent(IMFMediaEvent* event);
 
   bool IsPreviewing() const { return previewing; }
@@ -126,6 +130,8 @@ class CaptureManager {
   std::atomic<uint32_t> handled_[EventKinds] = {};
   std::atomic<HRESULT> recordStartStatus_{S_OK};
   std::atomic<bool> failed_{false};  // the engine reported an error; its owner releases it
+  Mark stopMark_;                    // events handled before a stop that is not waited for yet
+  bool stopPending_ = false;
 };
 
 }  // namespace capture::video::camera::mfce

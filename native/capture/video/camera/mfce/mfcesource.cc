@@ -168,7 +168,11 @@ void MFCESource::stopEncode() {
   }
 }
 
-// The engine's stop already waits until the file is written.
+// The engine ends the clip now; finishClips (the stop's wait) returns once the file is written.
+void MFCESource::endClip() {
+  if (capturing && captureManager) captureManager->BeginStopRecord();
+}
+
 void MFCESource::finishClips(std::chrono::steady_clock::time_point) {
   if (capturing) stopEncode();
 }

@@ -27,6 +27,7 @@ class MFCESource : public capture::video::Source, public capture::audio::Source 
   void stopCapturing() override {}
   void startEncode(std::string filename) override;
   void stopEncode() override;
+  void endClip() override;
   void finishClips(std::chrono::steady_clock::time_point deadline) override;
   bool selected() override { return isSelected; }
 
