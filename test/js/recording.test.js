@@ -10,7 +10,7 @@ const { execFileSync, spawnSync } = require('child_process');
 const fs = require('fs');
 const os = require('os');
 const path = require('path');
-const { startDesktop } = require('../../scripts/desktop');
+const { startDesktop, startAnimation } = require('../../scripts/desktop');
 const { runAddon, root } = require('./addon');
 const { duration: probe, decodeErrors, decode, otherPlayers } = require('./clips');
 
@@ -276,5 +276,33 @@ test('a host killed while recording leaves files that play up to a second before
       assert.ok(Math.abs(others.gstreamer - duration) < 0.1, `${kind}: GStreamer ${others.gstreamer} s, FFmpeg ${duration} s`);
       assert.ok(Math.abs(others.mediainfo - duration) < 0.1, `${kind}: MediaInfo ${others.mediainfo} s, FFmpeg ${duration} s`);
     }
+  });
+});
+
+test('a host recording clip after clip keeps its memory, threads and open files', async () => {
+  await withDesktop(async (env) => {
+    const animation = startAnimation(env);
+    const { reports, code, stdout, stderr } = await runAddon(`${FIND}
+      const fs = require('fs');
+      const path = require('path');
+      const usage = () => ({
+        rss: Number(/VmRSS:\\s+(\\d+)/.exec(fs.readFileSync('/proc/self/status', 'utf8'))[1]) / 1024,
+        threads: fs.readdirSync('/proc/self/task').length,
+        files: fs.readdirSync('/proc/self/fd').length,
+      });
+      const seen = [];
+      for (let i = 0; i < 40; i++) {
+        sources.forEach((s) => addon.startCapture(s.id, path.join(${JSON.stringify(dir)}, 'cycle-' + s.id + '-' + (i % 2) + '.mp4')));
+        await sleep(300);
+        for (const s of sources) addon.stopCapture(s.id);
+        if (i === 4 || i === 39) seen.push(usage());
+      }
+      report(seen);`, { env: { ...env, TAVIO_TEST_CAMERAS: 'Cycle Camera=testsrc2=size=1280x720:rate=30' }, timeoutMs: 120000 });
+    animation.kill();
+    assert.strictEqual(code, 0, stderr);
+    assert.ok(!/Warning:/.test(stdout), stdout);
+    const [early, late] = reports[0];
+    assert.deepStrictEqual([late.threads, late.files], [early.threads, early.files]);
+    assert.ok(late.rss - early.rss <= 100, `${early.rss.toFixed(0)} MB after 5 rounds of clips, ${late.rss.toFixed(0)} MB after 40`);
   });
 });
