@@ -5,6 +5,7 @@
 #include <cstring>
 #include <fstream>
 #include <functional>
+#include <iterator>
 #include <random>
 #include <ostream>
 #include <string>
@@ -65,6 +66,23 @@ ComPtr<IMFSinkWriter> videoWriter(const std::string& path, UINT32 width, UINT32 
   EXPECT_EQ(writer->SetInputMediaType(*stream, in.Get(), nullptr), S_OK);
   EXPECT_EQ(writer->BeginWriting(), S_OK);
   return writer;
+}
+
+// The length the header gives the movie's fragments (mehd), in seconds of the movie header's time
+// scale; -1 without one. Browsers show a fragmented file as long as this before they have read it.
+double fragmentsLength(const std::string& path) {
+  std::ifstream in(path, std::ios::binary);
+  const std::string bytes((std::istreambuf_iterator<char>(in)), std::istreambuf_iterator<char>());
+  const size_t mvhd = bytes.find("mvhd"), mehd = bytes.find("mehd");
+  if (mvhd == std::string::npos || mehd == std::string::npos || mehd + 16 > bytes.size()) return -1;
+  auto read = [&](size_t at, int count) {
+    uint64_t value = 0;
+    for (int i = 0; i < count; ++i) value = value << 8 | static_cast<uint8_t>(bytes[at + i]);
+    return value;
+  };
+  const uint64_t timescale = read(mvhd + (bytes[mvhd + 4] == 1 ? 24 : 16), 4);
+  const uint64_t length = bytes[mehd + 4] == 1 ? read(mehd + 8, 8) : read(mehd + 8, 4);
+  return timescale ? static_cast<double>(length) / static_cast<double>(timescale) : -1;
 }
 
 ComPtr<IMFSample> sampleOf(const void* bytes, DWORD length, LONGLONG time, LONGLONG duration, bool timed = true) {
@@ -236,6 +254,7 @@ TEST_F(SinkWriter, H264IsReallyMainWithTheTypesSizeRateAndBitRate) {
   const double bitsPerSecond = video.bytes * 8 / seconds;
   EXPECT_NEAR(bitsPerSecond, 10485760, 10485760 * 0.15);
   EXPECT_NEAR(file.duration, seconds, 0.001);  // packet durations set: not one frame short
+  EXPECT_NEAR(fragmentsLength(path), seconds, 0.001);
 
   const media::Decoded decoded = media::decode(path, AVMEDIA_TYPE_VIDEO);
   EXPECT_EQ(decoded.errors, 0);

@@ -49,6 +49,39 @@ void forEachBox(const std::vector<uint8_t>& data, size_t begin, size_t end, Visi
   }
 }
 
+// Puts an empty movie extends header (mehd) first into the mvex box of the movie box `head`. The
+// muxer writes none into a fragmented file, and without it Firefox shows such a file as long as
+// the part it has read. The room comes from the udta box after mvex (the muxer's name), which
+// becomes a free box: the movie box keeps its size, since the fragments after it cannot move.
+// Returns false when there is no room.
+bool addMehd(std::vector<uint8_t>& head) {
+  constexpr size_t mehdSize = 20;  // version 1: a 64-bit duration
+  size_t mvex = 0, mvexSize = 0, udta = 0, udtaSize = 0;
+  forEachBox(head, 8, head.size(), [&](const std::string& type, size_t offset, size_t size) {
+    if (type == "mvex") mvex = offset, mvexSize = size;
+    if (type == "udta" && mvexSize) udta = offset, udtaSize = size;
+  });
+  if (!mvexSize) return false;
+  bool present = false;
+  forEachBox(head, mvex + 8, mvex + mvexSize,
+             [&](const std::string& type, size_t, size_t) { present = present || type == "mehd"; });
+  if (present) return true;
+  if (udtaSize < mehdSize + 8) return false;
+  std::vector<uint8_t> room(mehdSize, 0);
+  write32(&room[0], mehdSize);
+  std::memcpy(&room[4], "mehd", 4);
+  room[8] = 1;
+  head.erase(head.begin() + static_cast<std::ptrdiff_t>(udta + udtaSize - mehdSize),
+             head.begin() + static_cast<std::ptrdiff_t>(udta + udtaSize));
+  write32(&head[udta], static_cast<uint32_t>(udtaSize - mehdSize));
+  std::memcpy(&head[udta + 4], "free", 4);
+  std::fill(head.begin() + static_cast<std::ptrdiff_t>(udta + 8),
+            head.begin() + static_cast<std::ptrdiff_t>(udta + udtaSize - mehdSize), 0);
+  head.insert(head.begin() + static_cast<std::ptrdiff_t>(mvex + 8), room.begin(), room.end());
+  write32(&head[mvex], static_cast<uint32_t>(mvexSize + mehdSize));
+  return true;
+}
+
 }  // namespace
 
 Mp4File::Mp4File(const std::string& path) {
@@ -164,6 +197,7 @@ void Mp4File::stampDurations() {
     else
       write32(&head[field], static_cast<uint32_t>(std::min<uint64_t>(units, UINT32_MAX)));
   };
+  if (!hasMehd_) hasMehd_ = addMehd(head);
   size_t track = 0;
   forEachBox(head, 8, moovSize, [&](const std::string& type, size_t offset, size_t size) {
     if (type == "mvhd" && size >= 32) {
@@ -179,6 +213,10 @@ void Mp4File::stampDurations() {
         const bool wide = head[at + 8] == 1;
         if (wide && length < 44) return;
         stamp(at + (wide ? 36 : 28), wide, seconds);
+      });
+    } else if (type == "mvex" && timescale) {
+      forEachBox(head, offset + 8, offset + size, [&](const std::string& inner, size_t at, size_t length) {
+        if (inner == "mehd" && length >= 16) stamp(at + 12, head[at + 8] == 1 && length >= 20, movieSeconds);
       });
     }
   });
