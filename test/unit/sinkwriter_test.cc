@@ -200,6 +200,13 @@ TEST_F(SinkWriter, CreatesTheFileAtOnceAndTakesTheContainerFromTheAttribute) {
   ComPtr<IMFMediaType> in = rgb32Type(64, 64);
   ASSERT_EQ(writer->SetInputMediaType(stream, in.Get(), nullptr), S_OK);
   ASSERT_EQ(writer->BeginWriting(), S_OK);
+  // From here on the file is an MP4 file with its stream, empty until the first fragment: a host
+  // killed now leaves one.
+  const media::File empty = media::probe(path);
+  ASSERT_TRUE(empty.opened);
+  ASSERT_EQ(empty.streams.size(), 1u);
+  EXPECT_EQ(empty.streams[0].codec, "h264");
+  EXPECT_EQ(empty.streams[0].packets.size(), 0u);
   const auto pixels = bands(64, 64, true);
   for (int i = 0; i < 3; ++i) EXPECT_EQ(writeBytes(writer, stream, pixels, i * 333333LL, 333333), S_OK);
   EXPECT_EQ(writer->Finalize(), S_OK);

@@ -112,9 +112,15 @@ class SinkWriter : public ComObject<IMFSinkWriter, IID_IMFSinkWriter> {
       if (!slot.encoder) return MF_E_TRANSFORM_TYPE_NOT_SET;
     AVDictionary* options = nullptr;
     if (fragmented_) {
-      // The header waits for the first fragment (delay_moov) so that a stream whose parameter
-      // sets come with its first key frame has them in the header too.
-      av_dict_set(&options, "movflags", "empty_moov+delay_moov+default_base_moof", 0);
+      // The header goes out now, so that a host killed before the first fragment leaves an empty
+      // MP4 file rather than an empty file. Only H.264 passed through without its parameter sets
+      // makes it wait for the first fragment (delay_moov), whose first key frame brings them.
+      bool parameterSetsLater = false;
+      for (const StreamSlot& slot : streams_)
+        parameterSetsLater = parameterSetsLater || (slot.stream->codecpar->codec_type == AVMEDIA_TYPE_VIDEO &&
+                                                    slot.stream->codecpar->extradata_size == 0);
+      av_dict_set(&options, "movflags",
+                  parameterSetsLater ? "empty_moov+delay_moov+default_base_moof" : "empty_moov+default_base_moof", 0);
       av_dict_set(&options, "frag_duration", "900000", 0);
     }
     av_dict_set(&options, "flush_packets", "1", 0);
