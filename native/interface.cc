@@ -240,9 +240,9 @@ void finishEveryClip() {
   // Every clip ends at this moment, before any file is waited for: a camera's stop may wait for
   // its microphone's last sound, and clips stopped after it would run on meanwhile.
   for (const auto& source : sources) source->endClip();
-  for (size_t i = 0; i < sources.size(); ++i) {
+  for (const auto& source : sources) {
     try {
-      sources[i]->finishClips(deadline);
+      source->finishClips(deadline);
     } catch (const std::exception& e) {
       capture::logWarning(e.what());
     }

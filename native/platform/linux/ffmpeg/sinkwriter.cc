@@ -112,8 +112,8 @@ class SinkWriter : public ComObject<IMFSinkWriter, IID_IMFSinkWriter> {
       if (!slot.encoder) return MF_E_TRANSFORM_TYPE_NOT_SET;
     AVDictionary* options = nullptr;
     if (fragmented_) {
-      // The header goes out now, so that a host killed before the first fragment leaves an empty
-      // MP4 file rather than an empty file. Only H.264 passed through without its parameter sets
+      // The header goes out now, so that a host killed before the first fragment leaves an MP4
+      // file without media rather than a file of no bytes. Only H.264 passed through without its parameter sets
       // makes it wait for the first fragment (delay_moov), whose first key frame brings them.
       bool parameterSetsLater = false;
       for (const StreamSlot& slot : streams_)

@@ -168,7 +168,7 @@ void MFCESource::stopEncode() {
   }
 }
 
-// The engine ends the clip now; finishClips (the stop's wait) returns once the file is written.
+// The engine ends the clip now; finishClips (the rest of the stop) returns once the file is written.
 void MFCESource::endClip() {
   if (capturing && captureManager) captureManager->BeginStopRecord();
 }
