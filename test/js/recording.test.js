@@ -292,7 +292,8 @@ test('a host recording clip after clip keeps its memory, threads and open files'
       });
       const seen = [];
       for (let i = 0; i < 40; i++) {
-        sources.forEach((s) => addon.startCapture(s.id, path.join(${JSON.stringify(dir)}, 'cycle-' + s.id + '-' + (i % 2) + '.mp4')));
+        // A name of its own per clip: a display's file is finished after its stop returns.
+        sources.forEach((s) => addon.startCapture(s.id, path.join(${JSON.stringify(dir)}, 'cycle-' + s.id + '-' + i + '.mp4')));
         await sleep(300);
         for (const s of sources) addon.stopCapture(s.id);
         if (i === 4 || i === 39) seen.push(usage());
