@@ -303,7 +303,7 @@ test('a host recording clip after clip keeps its memory, threads and open files'
       };
       const seen = [];
       for (let i = 0; i < 40; i++) {
-        // A name of its own per clip: a display's file is finished after its stop returns.
+        // A name of its own per clip, for the same reason.
         sources.forEach((s) => addon.startCapture(s.id, path.join(${JSON.stringify(dir)}, 'cycle-' + s.id + '-' + i + '.mp4')));
         await sleep(300);
         for (const s of sources) addon.stopCapture(s.id);

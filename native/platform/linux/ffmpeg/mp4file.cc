@@ -53,20 +53,20 @@ void forEachBox(const std::vector<uint8_t>& data, size_t begin, size_t end, Visi
 // muxer writes none into a fragmented file, and without it Firefox shows such a file as long as
 // the part it has read. The room comes from the udta box after mvex (the muxer's name), which
 // becomes a free box: the movie box keeps its size, since the fragments after it cannot move.
-// Returns false when there is no room.
-bool addMehd(std::vector<uint8_t>& head) {
+// Without room it does nothing.
+void addMehd(std::vector<uint8_t>& head) {
   constexpr size_t mehdSize = 20;  // version 1: a 64-bit duration
   size_t mvex = 0, mvexSize = 0, udta = 0, udtaSize = 0;
   forEachBox(head, 8, head.size(), [&](const std::string& type, size_t offset, size_t size) {
     if (type == "mvex") mvex = offset, mvexSize = size;
     if (type == "udta" && mvexSize) udta = offset, udtaSize = size;
   });
-  if (!mvexSize) return false;
+  if (!mvexSize) return;
   bool present = false;
   forEachBox(head, mvex + 8, mvex + mvexSize,
              [&](const std::string& type, size_t, size_t) { present = present || type == "mehd"; });
-  if (present) return true;
-  if (udtaSize < mehdSize + 8) return false;
+  if (present) return;
+  if (udtaSize < mehdSize + 8) return;
   std::vector<uint8_t> room(mehdSize, 0);
   write32(&room[0], mehdSize);
   std::memcpy(&room[4], "mehd", 4);
@@ -79,7 +79,6 @@ bool addMehd(std::vector<uint8_t>& head) {
             head.begin() + static_cast<std::ptrdiff_t>(udta + udtaSize - mehdSize), 0);
   head.insert(head.begin() + static_cast<std::ptrdiff_t>(mvex + 8), room.begin(), room.end());
   write32(&head[mvex], static_cast<uint32_t>(mvexSize + mehdSize));
-  return true;
 }
 
 }  // namespace
@@ -197,7 +196,7 @@ void Mp4File::stampDurations() {
     else
       write32(&head[field], static_cast<uint32_t>(std::min<uint64_t>(units, UINT32_MAX)));
   };
-  if (!hasMehd_) hasMehd_ = addMehd(head);
+  addMehd(head);
   size_t track = 0;
   forEachBox(head, 8, moovSize, [&](const std::string& type, size_t offset, size_t size) {
     if (type == "mvhd" && size >= 32) {

@@ -34,7 +34,7 @@ class Mp4File {
   // Track `track` holds `seconds` of media in what the file holds now.
   void setTrackEnd(size_t track, double seconds);
   // Writes the tracks' lengths into their headers (tkhd) and the longest into the movie header
-  // (mvhd) and the movie extends header (mehd, made at the first call), in the header's own time
+  // (mvhd) and the movie extends header (mehd, made if the header has none), in the header's own time
   // scale. Does nothing while the file has no MP4 header yet.
   void stampDurations();
   // Flushes and closes; returns 0 or a negative AVERROR.
@@ -51,7 +51,6 @@ class Mp4File {
   int64_t end_ = 0;       // the file's length
   int64_t committed_ = 0;
   std::vector<double> trackEnds_;
-  bool hasMehd_ = false;
 };
 
 }  // namespace platform
