@@ -34,7 +34,13 @@ void discoverSources(SourceList& sources) {
     CoUninitialize();
   }
 
-  append(sources, audio::wasapi::CaptureMethod().sources());
+  // A machine without a playback endpoint (no sound server, or one without sinks) costs the
+  // endpoints only: the cameras found above and the displays below are started and announced.
+  try {
+    append(sources, audio::wasapi::CaptureMethod().sources());
+  } catch (const std::runtime_error& e) {
+    logWarning(e.what());
+  }
 
   // Sources of an earlier initialize already run; starting them again from here would race
   // the screen pump on displays, so only this call's sources are started.

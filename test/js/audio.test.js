@@ -8,7 +8,7 @@ const fs = require('fs');
 const os = require('os');
 const path = require('path');
 const { runAddon } = require('./addon');
-const { probe, decode } = require('./clips');
+const { probe, decode, duration } = require('./clips');
 const { startDesktop } = require('../../scripts/desktop');
 
 const SINKS = [
@@ -148,10 +148,30 @@ test('a sink that goes away ends its capture thread with a warning', async () =>
   }
 });
 
-test('without a sound server there is no default endpoint', async () => {
-  const { stdout } = await runAddon('addon.initialize(); report(events);',
-    { env: { PULSE_SERVER: `unix:${os.tmpdir()}/no-such-pulse-server`, DISPLAY: '' } });
-  assert.match(stdout, /native\/capture\/audio\/wasapi\/capturemethod\(30\): 0x80070490: Could not get the default device\./);
+test('without a sound server the endpoints are missing, and the cameras and displays record as usual', async () => {
+  const desktop = await startDesktop({ audio: false });
+  const dir = fs.mkdtempSync(path.join(os.tmpdir(), 'tavio-nosound-'));
+  try {
+    const { reports, stdout } = await runAddon(`
+      addon.initialize();
+      const found = events.map((e) => e.source);
+      await sleep(500);
+      for (const s of found) addon.startCapture(s.id, ${JSON.stringify(dir)} + '/' + s.type + '.mp4');
+      await sleep(1000);
+      for (const s of found) addon.stopCapture(s.id);
+      await sleep(1000);
+      report(found.map((s) => s.type));`,
+    { env: { ...desktop.env, PULSE_SERVER: `unix:${dir}/no-such-pulse-server`, TAVIO_TEST_CAMERAS: 'Cam=testsrc2=size=320x240:rate=30' } });
+    assert.match(stdout, /Warning: .*\n\tnative\/capture\/audio\/wasapi\/capturemethod\(30\): 0x80070490: Could not get the default device\./);
+    assert.deepStrictEqual(reports[0], ['mfce_video', 'dxgi']);
+    for (const type of reports[0]) {
+      const length = duration(path.join(dir, `${type}.mp4`));
+      assert.ok(length > 0.9 && length < 1.2, `${type}: ${length} s`);
+    }
+  } finally {
+    desktop.stop();
+    fs.rmSync(dir, { recursive: true, force: true });
+  }
 });
 
 // Pro-audio sinks (PipeWire's pro-audio profile and the like) have channels without speaker
