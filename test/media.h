@@ -4,6 +4,7 @@
 #include <cmath>
 #include <cstdint>
 #include <cstdlib>
+#include <cstring>
 #include <filesystem>
 #include <string>
 #include <vector>
@@ -160,14 +161,18 @@ inline Decoded decode(const std::string& path, AVMediaType kind) {
       ++out.frames;
       if (kind == AVMEDIA_TYPE_VIDEO) {
         out.width = frame->width;
-        out.lastPicture.resize(static_cast<size_t>(frame->width) * frame->height * 4);
         SwsContext* sws =
             sws_getContext(frame->width, frame->height, static_cast<AVPixelFormat>(frame->format), frame->width,
                            frame->height, AV_PIX_FMT_BGRA, SWS_POINT, nullptr, nullptr, nullptr);
-        uint8_t* planes[1] = {out.lastPicture.data()};
-        int strides[1] = {frame->width * 4};
+        // swscale writes whole blocks: rows of a multiple of 64 bytes, and a spare row.
+        const size_t row = static_cast<size_t>(frame->width) * 4, paddedRow = (row + 63) & ~size_t{63};
+        std::vector<uint8_t> padded(paddedRow * (frame->height + 1));
+        uint8_t* planes[1] = {padded.data()};
+        int strides[1] = {static_cast<int>(paddedRow)};
         sws_scale(sws, frame->data, frame->linesize, 0, frame->height, planes, strides);
         sws_freeContext(sws);
+        out.lastPicture.resize(row * frame->height);
+        for (int y = 0; y < frame->height; ++y) std::memcpy(&out.lastPicture[y * row], &padded[y * paddedRow], row);
         if (out.firstPicture.empty()) out.firstPicture = out.lastPicture;
       } else if (kind == AVMEDIA_TYPE_AUDIO) {
         if (!resampler) {

@@ -328,6 +328,31 @@ INSTANTIATE_TEST_SUITE_P(Inputs, PictureLayout,
                                                      FF_PROFILE_H264_BASELINE}),
                          [](const testing::TestParamInfo<PictureCase>& info) { return std::string(info.param.name); });
 
+// libx264 takes no odd sizes: a red display picture whose last column and row are blue.
+TEST_F(SinkWriter, OddPicturesAreEncodedAtTheNextEvenSizeWithTheirLastColumnAndRowRepeated) {
+  const int width = 161, height = 121;
+  const std::string path = folder.file("odd.mp4");
+  DWORD stream = 0;
+  ComPtr<IMFSinkWriter> writer = videoWriter(path, width, height, &stream);
+  ASSERT_TRUE(writer);
+  std::vector<uint8_t> pixels(static_cast<size_t>(width) * height * 4);
+  for (int y = 0; y < height; ++y)
+    for (int x = 0; x < width; ++x) {
+      const bool edge = x == width - 1 || y == 0;        // bottom-up: the first row in memory is the last
+      pixels[(y * width + x) * 4] = edge ? 255 : 0;      // blue
+      pixels[(y * width + x) * 4 + 2] = edge ? 0 : 255;  // red
+    }
+  for (int i = 0; i < 3; ++i) ASSERT_EQ(writeBytes(writer, stream, pixels, i * 333333LL, 333333), S_OK);
+  ASSERT_EQ(writer->Finalize(), S_OK);
+  const media::Decoded decoded = media::decode(path, AVMEDIA_TYPE_VIDEO);
+  ASSERT_EQ(decoded.frames, 3);
+  ASSERT_EQ(decoded.width, 162);
+  ASSERT_EQ(decoded.firstPicture.size(), 162u * 122 * 4);
+  const auto at = [&](int x, int y) { return colourAt(decoded, x, y); };
+  EXPECT_EQ(std::string() + at(80, 60) + at(158, 60) + at(160, 60) + at(161, 60), "rrbb");    // along a row
+  EXPECT_EQ(std::string() + at(80, 118) + at(80, 120) + at(80, 121) + at(161, 121), "rbbb");  // down, the corner
+}
+
 TEST_F(SinkWriter, SampleTimesAndDurationsBecomePacketTimes) {
   const std::string path = folder.file("times.mp4");
   DWORD stream = 0;

@@ -17,4 +17,10 @@ void pad(const uint8_t* source, int width, int height, uint8_t* dst) {
   if (evenSize(height) > height) std::memcpy(dst + height * paddedRow, dst + (height - 1) * paddedRow, paddedRow);
 }
 
+void repeatEdges(uint8_t* plane, ptrdiff_t stride, int width, int height) {
+  if (width & 1)
+    for (int y = 0; y < height; ++y) plane[y * stride + width] = plane[y * stride + width - 1];
+  if (height & 1) std::memcpy(plane + height * stride, plane + (height - 1) * stride, evenSize(width));
+}
+
 }  // namespace platform::evenpicture

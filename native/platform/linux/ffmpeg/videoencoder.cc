@@ -13,6 +13,7 @@ extern "C" {
 }
 
 #include "platform/linux/ffmpeg/colorconvert.h"
+#include "platform/linux/ffmpeg/evenpicture.h"
 #include "platform/linux/ffmpeg/streamencoder.h"
 
 namespace platform::sinkwriter {
@@ -69,9 +70,17 @@ class VideoEncoder : public StreamEncoder {
     const int64_t bitRate = get32(output, MF_MT_AVG_BITRATE, 0);
     const UINT32 profile = get32(output, MF_MT_MPEG2_PROFILE, eAVEncH264VProfile_Base);
 
+    // 4:2:0 encoders take no odd sizes: an odd picture is encoded at the next even size, its
+    // last column and row repeated into the added ones.
+    width_ = static_cast<int>(width);
+    height_ = static_cast<int>(height);
+    const auto codedWidth = static_cast<UINT32>(evenpicture::evenSize(width_));
+    const auto codedHeight = static_cast<UINT32>(evenpicture::evenSize(height_));
     bool opened = false;
-    if (hardware) opened = openNvenc(width, height, bitRate, profile) || openVaapi(width, height, bitRate, profile);
-    if (!opened && !openX264(width, height, bitRate, profile)) return MF_E_INVALIDMEDIATYPE;
+    if (hardware)
+      opened =
+          openNvenc(codedWidth, codedHeight, bitRate, profile) || openVaapi(codedWidth, codedHeight, bitRate, profile);
+    if (!opened && !openX264(codedWidth, codedHeight, bitRate, profile)) return MF_E_INVALIDMEDIATYPE;
 
     const AVPixelFormat target = hardwareFrames_ ? AV_PIX_FMT_NV12 : context_->pix_fmt;
     const bool sameSize = inWidth_ == static_cast<int>(width) && inHeight_ == static_cast<int>(height);
@@ -80,7 +89,7 @@ class VideoEncoder : public StreamEncoder {
       // costs a fraction of swscale's, which matters at 60 frames a second.
       conversion_ = Conversion::bgrxToI420;
     } else if (picture_.format == AV_PIX_FMT_YUV420P && target == AV_PIX_FMT_YUV420P && sameSize &&
-               std::strcmp(context_->codec->name, "libx264") == 0) {
+               codedWidth == width && codedHeight == height && std::strcmp(context_->codec->name, "libx264") == 0) {
       // I420 at the output's size is the camera path: libx264 copies each picture into its own
       // frames while it is handed over, so it can read the caller's planes where they lie.
       conversion_ = Conversion::borrowI420;
@@ -96,8 +105,8 @@ class VideoEncoder : public StreamEncoder {
     if (conversion_ != Conversion::borrowI420) {
       frame_.reset(av_frame_alloc());
       frame_->format = target;
-      frame_->width = static_cast<int>(width);
-      frame_->height = static_cast<int>(height);
+      frame_->width = context_->width;
+      frame_->height = context_->height;
       if (av_frame_get_buffer(frame_.get(), 0) < 0) return E_OUTOFMEMORY;
     }
     return describe();
@@ -123,6 +132,9 @@ class VideoEncoder : public StreamEncoder {
     } else {
       sws_scale(scaler_.get(), planes, strides, 0, inHeight_, frame_->data, frame_->linesize);
     }
+    // Both conversions give an odd picture's chroma its last half-filled column and row already.
+    if (!borrowed && (frame_->width != width_ || frame_->height != height_))
+      evenpicture::repeatEdges(frame_->data[0], frame_->linesize[0], width_, height_);
     AVFrame* send = borrowed ? borrowed.get() : frame_.get();
 
     // The encoder counts frames at the declared rate; the packets get the samples' own times back.
@@ -307,6 +319,8 @@ class VideoEncoder : public StreamEncoder {
   }
 
   InputPicture picture_{};
+  int width_ = 0;  // the picture's size; the encoder's is the next even one
+  int height_ = 0;
   int inWidth_ = 0;
   int inHeight_ = 0;
   int stride_ = 0;
