@@ -8,7 +8,7 @@ const fs = require('fs');
 const os = require('os');
 const path = require('path');
 const { runAddon } = require('./addon');
-const { probe, decode, duration } = require('./clips');
+const { probe, decode, duration, power } = require('./clips');
 const { startDesktop } = require('../../scripts/desktop');
 
 const SINKS = [
@@ -31,19 +31,6 @@ function tone(dir, { frequency = 440, seconds = 5, volume = 0.5, rate = 48000, c
 const play = (file, sink) => `require('child_process').spawn('paplay', ['--device=${sink}', ${JSON.stringify(file)}], { stdio: 'ignore' })`;
 
 const wasapi = (events) => events.filter((e) => e.source.type === 'wasapi').map((e) => e.source);
-
-// Relative power of one frequency in mono float samples (Goertzel).
-function power(samples, rate, frequency) {
-  const k = 2 * Math.cos((2 * Math.PI * frequency) / rate);
-  let s1 = 0;
-  let s2 = 0;
-  for (const x of samples) {
-    const s0 = x + k * s1 - s2;
-    s2 = s1;
-    s1 = s0;
-  }
-  return (s1 * s1 + s2 * s2 - k * s1 * s2) / (samples.length * samples.length);
-}
 
 test('audio endpoints', async (t) => {
   const desktop = await startDesktop({ display: false, sinks: SINKS });

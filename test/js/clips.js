@@ -27,6 +27,19 @@ function decode(file, rate = 48000) {
   return new Float32Array(raw.buffer, raw.byteOffset, raw.length / 4);
 }
 
+// Relative power of one frequency in mono float samples (Goertzel).
+function power(samples, rate, frequency) {
+  const k = 2 * Math.cos((2 * Math.PI * frequency) / rate);
+  let s1 = 0;
+  let s2 = 0;
+  for (const x of samples) {
+    const s0 = x + k * s1 - s2;
+    s2 = s1;
+    s1 = s0;
+  }
+  return (s1 * s1 + s2 * s2 - k * s1 * s2) / (samples.length * samples.length);
+}
+
 // What two other players make of the file: GStreamer plays it to the end without an error
 // (`played`), and GStreamer's and MediaInfo's durations in seconds (NaN when they find none).
 function otherPlayers(file) {
@@ -42,4 +55,4 @@ function otherPlayers(file) {
   };
 }
 
-module.exports = { probe, duration, decodeErrors, decode, otherPlayers };
+module.exports = { probe, duration, decodeErrors, decode, power, otherPlayers };

@@ -13,7 +13,7 @@ const path = require('path');
 const readline = require('readline');
 const { startDesktop, playTone } = require('../../scripts/desktop');
 const { root, hostEnv, HOST_START } = require('./addon');
-const { duration: probe, decodeErrors } = require('./clips');
+const { duration: probe, decodeErrors, decode, power } = require('./clips');
 
 const sleep = (ms) => new Promise((resolve) => setTimeout(resolve, ms));
 const CAMERAS = 'Fault Camera=testsrc2=size=320x240:rate=30';
@@ -132,7 +132,7 @@ async function restartPulse(dir, env) {
 // in the sine source's two-second lumps (unless the case asks for the default desktop).
 const DESKTOP = { microphone: null, remappedMicrophone: { name: 'tavio_live_mic', description: 'Tavio Live Microphone' } };
 
-async function faultCase({ folder, broken, fault, repair, desktopOptions = DESKTOP }) {
+async function faultCase({ folder, broken, fault, check = () => {}, repair, desktopOptions = DESKTOP }) {
   const desktop = await startDesktop(desktopOptions);
   const env = desktop.env;
   const helpers = [playTone(env)];
@@ -163,6 +163,7 @@ async function faultCase({ folder, broken, fault, repair, desktopOptions = DESKT
       const expected = (faultAt - first.started) / 1000 - (broken.includes(type) ? 1 : 0);
       assert.ok(duration >= expected, `${name}: ${duration} s, expected at least ${expected} s`);
     }
+    check(first);
     assert.match(warnedAfterFault, /Warning: /, 'the fault is reported');
     assert.deepStrictEqual(busy, [], 'no thread spins while the device is gone');
 
@@ -211,22 +212,47 @@ test('the sound server killed and started again', async () => {
   }
 });
 
+const pactl = (env, ...args) => execFileSync('pactl', args, { env: { ...process.env, ...env }, encoding: 'utf8' });
+function unload(env, argument) {
+  const line = pactl(env, 'list', 'short', 'modules').split('\n').find((l) => l.includes(argument));
+  pactl(env, 'unload-module', line.split('\t')[0]);
+}
+
 test('the sink unloaded and loaded again', async () => {
   const folder = folderFor('sink');
-  const pactl = (env, ...args) => execFileSync('pactl', args, { env: { ...process.env, ...env }, encoding: 'utf8' });
   try {
     await faultCase({
       folder,
       broken: ['wasapi'],
-      fault: ({ env }) => {
-        const line = pactl(env, 'list', 'short', 'modules').split('\n').find((l) => l.includes('sink_name=tavio_speakers'));
-        pactl(env, 'unload-module', line.split('\t')[0]);
-      },
+      fault: ({ env }) => unload(env, 'sink_name=tavio_speakers'),
       repair: async ({ env, helpers }) => {
         pactl(env, 'load-module', 'module-null-sink', 'sink_name=tavio_speakers', 'rate=48000', 'channels=2',
           'sink_properties="device.description=\'Tavio Speakers\'"');
         pactl(env, 'set-default-sink', 'tavio_speakers');
         helpers.push(playTone(env));
+      },
+    });
+  } finally {
+    fs.rmSync(folder, { recursive: true, force: true });
+  }
+});
+
+// The server moves the stream of a source that goes to another source (the speakers' monitor,
+// with their 440 Hz tone) instead of ending it: the microphone's clip must end at the loss.
+test('the microphone unplugged and plugged in again', async () => {
+  const folder = folderFor('microphone');
+  try {
+    await faultCase({
+      folder,
+      broken: ['mfce_audio'],
+      fault: ({ env }) => unload(env, 'source_name=tavio_live_mic'),
+      check: ({ files }) => {
+        const samples = decode(Object.entries(files).find(([name]) => name.startsWith('mfce_audio'))[1]);
+        assert.ok(power(samples, 48000, 440) < power(samples, 48000, 880) / 100, 'no other source is recorded');
+      },
+      repair: ({ env }) => {
+        pactl(env, 'load-module', 'module-remap-source', 'master=tavio_live_mic_feed.monitor', 'source_name=tavio_live_mic',
+          'source_properties="device.description=\'Tavio Live Microphone\'"');
       },
     });
   } finally {

@@ -157,6 +157,9 @@ HRESULT openInput(Device& device, std::shared_ptr<Input>& result) {
   AVDictionary* options = nullptr;
   std::string url = device.url;
   if (device.formatName == "pulse") {
+    // A microphone whose source is gone would be connected to the default one instead.
+    input->watch = std::make_unique<pulse::SourceWatch>(device.url);
+    if (!input->watch->present()) return MF_E_AUDIO_RECORDING_DEVICE_INVALIDATED;
     av_dict_set_int(&options, "sample_rate", device.rate, 0);
     av_dict_set_int(&options, "channels", device.channels, 0);
     // 20 ms fragments: the server's default is a buffer of seconds, far too late for peaks.
@@ -179,7 +182,7 @@ HRESULT openInput(Device& device, std::shared_ptr<Input>& result) {
     error = avformat_open_input(&input->format, url.c_str(), format, &options);
   }
   av_dict_free(&options);
-  if (error < 0)
+  if (error < 0 || (input->watch && !input->watch->present()))
     return device.video ? MF_E_VIDEO_RECORDING_DEVICE_INVALIDATED : MF_E_AUDIO_RECORDING_DEVICE_INVALIDATED;
   const bool described = input->format->nb_streams == 1 && describedOnOpening(input->format->streams[0]->codecpar);
   if (!described && avformat_find_stream_info(input->format, nullptr) < 0) return MF_E_INVALID_STREAM_DATA;

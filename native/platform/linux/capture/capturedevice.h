@@ -13,6 +13,7 @@ extern "C" {
 #include <string>
 
 #include "platform/linux/mf.h"
+#include "platform/linux/pulse/sourcewatch.h"
 
 namespace platform::capturedevice {
 
@@ -42,7 +43,8 @@ struct Input {
   AVCodecParameters* delivered = nullptr;  // the stream's, or the device encoder's
   AVRational timeBase{1, 1};               // of the delivered packets
   AVCodecContext* decoder = nullptr;
-  bool keyFrameSeen = false;  // H.264 joined between key frames cannot be decoded before the next
+  bool keyFrameSeen = false;                  // H.264 joined between key frames cannot be decoded before the next
+  std::unique_ptr<pulse::SourceWatch> watch;  // microphones: whether their source is still there
 };
 
 struct Device {

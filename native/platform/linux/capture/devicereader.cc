@@ -28,8 +28,10 @@ DeviceReader::DeviceReader(std::shared_ptr<Input> input, Deliver deliver, bool w
     pthread_setname_np(pthread_self(), "tavio-reader");
     while (!shared->stop.load()) {
       AVPacket* packet = av_packet_alloc();
-      const int error = packet ? av_read_frame(input->format, packet) : AVERROR(ENOMEM);
+      int error = packet ? av_read_frame(input->format, packet) : AVERROR(ENOMEM);
       const int64_t readAt = av_gettime_relative();
+      // A microphone whose source has gone reads another source's sound now: its device is lost.
+      if (error >= 0 && input->watch && !input->watch->present()) error = AVERROR(ENODEV);
       if (shared->stop.load()) {
         av_packet_free(&packet);
         break;
