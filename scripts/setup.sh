@@ -9,7 +9,7 @@ packages=(
   libavformat-dev libavcodec-dev libavdevice-dev libavutil-dev libswscale-dev libswresample-dev
   libxcb1-dev libxcb-shm0-dev libxcb-damage0-dev libxcb-xfixes0-dev libxcb-randr0-dev libxcb-render0-dev
   libpulse-dev libdbus-1-dev
-  xvfb x11-xserver-utils xdotool pulseaudio pulseaudio-utils ffmpeg sox
+  xvfb x11-xserver-utils xdotool pulseaudio pulseaudio-utils pipewire-pulse wireplumber dbus-daemon ffmpeg sox
   gstreamer1.0-tools gstreamer1.0-plugins-base gstreamer1.0-plugins-good gstreamer1.0-libav
   gstreamer1.0-plugins-base-apps mediainfo libfaketime
   g++-mingw-w64-x86-64-posix mingw-w64-x86-64-dev

@@ -10,6 +10,7 @@ const path = require('path');
 const { runAddon } = require('./addon');
 const { probe, decode, duration, power } = require('./clips');
 const { startDesktop } = require('../../scripts/desktop');
+const { startPipeWire } = require('./pipewire');
 
 const SINKS = [
   { name: 'tavio_left', description: 'Tavio Left Speaker', rate: 48000, channels: 2 },
@@ -215,4 +216,56 @@ test('sinks whose channels have no speaker positions record and preview what the
       assert.doesNotMatch(stdout, /Warning/);
     });
   }
+});
+
+// Debian 12's desktops run PipeWire, whose PulseAudio server serves the endpoints and microphones.
+// Like PulseAudio it would move an unplugged microphone's stream to another source.
+test('PipeWire: endpoints and microphones record what plays; an unplugged microphone ends its clip', async (t) => {
+  const pipewire = await startPipeWire({
+    sinks: [{ name: 'pw_speakers', description: 'PipeWire Speakers' }],
+    microphone: { name: 'pw_mic', description: 'PipeWire Microphone' },
+  });
+  const dir = fs.mkdtempSync(path.join(os.tmpdir(), 'tavio-pipewire-clips-'));
+  t.after(() => {
+    pipewire.stop();
+    fs.rmSync(dir, { recursive: true, force: true });
+  });
+  const files = Object.fromEntries(['endpoint', 'microphone', 'unplugged'].map((n) => [n, path.join(dir, `${n}.mp4`)]));
+  const [low, high] = [440, 880].map((frequency) => tone(dir, { frequency, seconds: 10 }));
+  const { reports, stdout, stderr } = await runAddon(`
+    const { execFileSync } = require('child_process');
+    const files = ${JSON.stringify(files)};
+    const players = [${play(low, 'pw_speakers')}, ${play(high, 'pw_mic_feed')}];
+    addon.initialize();
+    const found = events.map((e) => e.source);
+    const speakers = found.find((s) => s.type === 'wasapi' && s.selected);
+    const mic = found.find((s) => s.type === 'mfce_audio');
+    await sleep(500);
+    addon.startCapture(speakers.id, files.endpoint);
+    addon.startCapture(mic.id, files.microphone);
+    await sleep(1500);
+    addon.stopCapture(speakers.id);
+    addon.stopCapture(mic.id);
+    addon.startCapture(mic.id, files.unplugged);
+    await sleep(1000);
+    const module = execFileSync('pactl', ['list', 'short', 'modules'], { encoding: 'utf8' })
+      .split('\\n').find((l) => l.includes('source_name=pw_mic')).split('\\t')[0];
+    execFileSync('pactl', ['unload-module', module]);
+    await sleep(1000);
+    addon.stopCapture(mic.id);
+    players.forEach((p) => p.kill());
+    report(found.map((s) => [s.type, s.name]));`, { env: pipewire.env });
+  assert.deepStrictEqual(reports[0], [['mfce_audio', 'PipeWire Microphone'], ['wasapi', 'PipeWire Speakers'],
+    ['wasapi', 'PipeWire Microphone Feed']], stdout + stderr);
+  const heard = (file, frequency, other) => {
+    const samples = decode(file);
+    return power(samples, 48000, frequency) > 100 * power(samples, 48000, other);
+  };
+  for (const [name, frequency, other] of [['endpoint', 440, 880], ['microphone', 880, 440]]) {
+    assert.ok(Math.abs(duration(files[name]) - 1.5) < 0.15, `${name}: ${duration(files[name])} s`);
+    assert.ok(heard(files[name], frequency, other), `${name} holds its own tone only`);
+  }
+  assert.ok(Math.abs(duration(files.unplugged) - 1) < 0.2, `the unplugged clip ends at the loss: ${duration(files.unplugged)} s`);
+  assert.ok(heard(files.unplugged, 880, 440), 'the unplugged microphone\'s clip holds no other source');
+  assert.match(stdout, /capturemanager\(411\): 0xc00d3ea1: CaptureManager: the device failed while recording/);
 });
