@@ -43,8 +43,9 @@ struct Input {
   AVCodecParameters* delivered = nullptr;  // the stream's, or the device encoder's
   AVRational timeBase{1, 1};               // of the delivered packets
   AVCodecContext* decoder = nullptr;
-  bool keyFrameSeen = false;                  // H.264 joined between key frames cannot be decoded before the next
-  std::unique_ptr<pulse::SourceWatch> watch;  // microphones: whether their source is still there
+  bool keyFrameSeen = false;  // H.264 joined between key frames cannot be decoded before the next
+  // Microphones: whether their source is still there.
+  std::unique_ptr<pulse::SourceWatch> watch;
 };
 
 struct Device {
