@@ -12,7 +12,7 @@ const sleep = (ms) => new Promise((resolve) => setTimeout(resolve, ms));
 
 /**
  * sinks: [{name, description}], the first the default; microphone: {name, description}, fed by a
- * sink "<name>_feed". Resolves with { env (PULSE_SERVER), pactl(...args), stop() }.
+ * sink "<name>_feed". Resolves with { env (PULSE_SERVER), stop() }.
  */
 async function startPipeWire({ sinks, microphone }) {
   const dir = fs.mkdtempSync(path.join(os.tmpdir(), 'tavio-pipewire-'));
@@ -45,7 +45,7 @@ async function startPipeWire({ sinks, microphone }) {
       `source_properties="device.description='${microphone.description}'"`);
     // The session manager links new nodes a moment after they appear.
     await sleep(500);
-    return { env: server, pactl, stop };
+    return { env: server, stop };
   } catch (error) {
     stop();
     throw error;
