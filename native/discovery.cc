@@ -17,6 +17,16 @@ void append(SourceList& sources, SourceList found) {
   for (auto& source : found) sources.push_back(std::move(source));
 }
 
+// A step that fails is a warning line and costs only what it would have done.
+template <class Step>
+void orWarn(Step step) {
+  try {
+    step();
+  } catch (const std::runtime_error& e) {
+    logWarning(e.what());
+  }
+}
+
 }  // namespace
 
 void discoverSources(SourceList& sources) {
@@ -36,35 +46,19 @@ void discoverSources(SourceList& sources) {
 
   // A machine without a playback endpoint (no sound server, or one without sinks) costs the
   // endpoints only: the cameras found above and the displays below are started and announced.
-  try {
-    append(sources, audio::wasapi::CaptureMethod().sources());
-  } catch (const std::runtime_error& e) {
-    logWarning(e.what());
-  }
+  orWarn([&] { append(sources, audio::wasapi::CaptureMethod().sources()); });
 
   // Sources of an earlier initialize already run; starting them again from here would race
   // the screen pump on displays, so only this call's sources are started.
   for (size_t i = firstNew; i < sources.size(); ++i) {
     std::shared_ptr<Source> source = sources[i];
-    try {
-      source->capture();
-    } catch (const std::runtime_error& e) {
-      logWarning(e.what());
-    }
-    try {
-      source->startPreview();
-    } catch (const std::runtime_error& e) {
-      logWarning(e.what());
-    }
+    orWarn([&] { source->capture(); });
+    orWarn([&] { source->startPreview(); });
   }
 
   // A display the grab cannot handle costs the displays, not the cameras and endpoints found
   // above: they are announced all the same.
-  try {
-    append(sources, video::screen::dxgi::CaptureMethod().sources());
-  } catch (const std::runtime_error& e) {
-    logWarning(e.what());
-  }
+  orWarn([&] { append(sources, video::screen::dxgi::CaptureMethod().sources()); });
 }
 
 }  // namespace capture

@@ -3,7 +3,6 @@
 #include <dirent.h>
 #include <fcntl.h>
 #include <linux/videodev2.h>
-#include <pulse/pulseaudio.h>
 #include <sys/ioctl.h>
 #include <unistd.h>
 
@@ -19,6 +18,7 @@
 #include "platform/linux/mf/mfattributes.h"
 #include "platform/linux/mfcapture.h"
 #include "platform/linux/capture/testcameragraph.h"
+#include "platform/linux/pulse/blockingconnection.h"
 
 namespace platform {
 
@@ -94,44 +94,20 @@ std::vector<Device> videoDevices() {
   return devices;
 }
 
-struct SourceList {
-  std::vector<Device> devices;
-  bool done = false;
-};
-
-void onSource(pa_context*, const pa_source_info* info, int eol, void* userdata) {
-  auto* list = static_cast<SourceList*>(userdata);
-  if (eol != 0 || !info) {
-    list->done = true;
-    return;
-  }
+void onSource(pa_context*, const pa_source_info* info, int eol, void* devices) {
+  if (eol != 0 || !info) return;
   if (info->monitor_of_sink != PA_INVALID_INDEX) return;  // what a sink plays is no microphone
-  list->devices.push_back({widen(info->description ? info->description : info->name), widen(info->name),
-                           info->sample_spec.rate, info->sample_spec.channels});
+  static_cast<std::vector<Device>*>(devices)->push_back({widen(info->description ? info->description : info->name),
+                                                         widen(info->name), info->sample_spec.rate,
+                                                         info->sample_spec.channels});
 }
 
 // Sources of the PulseAudio server; none when no server answers (no autospawn).
 std::vector<Device> audioDevices() {
-  SourceList list;
-  pa_mainloop* loop = pa_mainloop_new();
-  if (!loop) return {};
-  pa_context* context = pa_context_new(pa_mainloop_get_api(loop), "tavio_capture devices");
-  if (context && pa_context_connect(context, nullptr, PA_CONTEXT_NOAUTOSPAWN, nullptr) >= 0) {
-    pa_context_state_t state;
-    while ((state = pa_context_get_state(context)) != PA_CONTEXT_READY && PA_CONTEXT_IS_GOOD(state))
-      if (pa_mainloop_iterate(loop, 1, nullptr) < 0) break;
-    if (pa_context_get_state(context) == PA_CONTEXT_READY) {
-      if (pa_operation* operation = pa_context_get_source_info_list(context, onSource, &list)) {
-        while (!list.done && pa_operation_get_state(operation) == PA_OPERATION_RUNNING)
-          if (pa_mainloop_iterate(loop, 1, nullptr) < 0) break;
-        pa_operation_unref(operation);
-      }
-    }
-    pa_context_disconnect(context);
-  }
-  if (context) pa_context_unref(context);
-  pa_mainloop_free(loop);
-  return list.devices;
+  std::vector<Device> devices;
+  pulse::BlockingConnection connection("tavio_capture devices");
+  if (connection.connected()) connection.run(pa_context_get_source_info_list(connection.context(), onSource, &devices));
+  return devices;
 }
 
 }  // namespace

@@ -4,32 +4,27 @@
 // other device's sound and never learn that its own was lost.
 #pragma once
 
-#include <pulse/pulseaudio.h>
-
 #include <string>
+
+#include "platform/linux/pulse/blockingconnection.h"
 
 namespace platform::pulse {
 
-// A connection of its own without a thread: the server's events are read when present() asks,
-// on the thread that asks. Used by one thread at a time.
+// The server's events are read when present() asks, on the thread that asks. Used by one thread
+// at a time.
 class SourceWatch {
  public:
   // Connects and looks the source up by name.
   explicit SourceWatch(const std::string& name);
-  ~SourceWatch();
-  SourceWatch(const SourceWatch&) = delete;
-  SourceWatch& operator=(const SourceWatch&) = delete;
 
   // False once the source has gone or the server has, and when there was none to begin with.
   bool present();
 
  private:
-  pa_mainloop* loop_ = nullptr;
-  pa_context* context_ = nullptr;
+  BlockingConnection connection_{"tavio_capture microphone"};
   uint32_t index_ = PA_INVALID_INDEX;
   bool gone_ = false;
 
-  bool runUntilDone(pa_operation* operation);
   static void onSource(pa_context*, const pa_source_info* info, int eol, void* watch);
   static void onEvent(pa_context*, pa_subscription_event_type_t type, uint32_t index, void* watch);
 };
