@@ -51,10 +51,15 @@ struct Stream {
   uint32_t frameBytes = 0;
   uint32_t bufferFrames = 0;
   bool started = false;
-  // A packet handed out by GetBuffer and not yet released.
+  // The packet GetBuffer handed out, in `bytes`: capture packets are copies, so that no block of
+  // the server's memory is held past the loop lock (libpulse, freeing a dead server's memory,
+  // waits for such a block with the lock held, and its release would wait for the lock). A
+  // packet released unread (`kept`) comes again with the next GetBuffer.
   bool holding = false;
+  bool kept = false;
   uint32_t heldFrames = 0;
-  size_t heldBytes = 0;
+  DWORD heldFlags = 0;
+  UINT64 heldTime = 0;
   std::vector<uint8_t> bytes;
   // What libpulse would report, kept under the loop lock: the record queue's length, set by the
   // read callback and lowered by our drops; the bytes the server asked for, set by the write
@@ -120,6 +125,41 @@ class CaptureClient : public ComObject<IAudioCaptureClient, IID_IAudioCaptureCli
     Lock lock(*s_->connection);
     if (s_->invalid()) return AUDCLNT_E_DEVICE_INVALIDATED;
     if (s_->holding) return AUDCLNT_E_OUT_OF_ORDER;
+    if (devicePosition) *devicePosition = s_->position;
+    if (!s_->kept) {
+      const HRESULT taken = takePacket(qpcPosition);
+      if (taken != S_OK) return taken;
+    }
+    s_->kept = false;
+    s_->holding = true;
+    *data = s_->bytes.data();
+    *frames = s_->heldFrames;
+    *flags = s_->heldFlags;
+    if (qpcPosition) *qpcPosition = s_->heldTime;
+    return S_OK;
+  }
+
+  HRESULT ReleaseBuffer(UINT32 framesRead) override {
+    Lock lock(*s_->connection);
+    // Releasing nothing keeps the packet for the next GetBuffer.
+    if (framesRead == 0) {
+      s_->kept = s_->kept || s_->holding;
+      s_->holding = false;
+      return S_OK;
+    }
+    if (!s_->holding) return AUDCLNT_E_OUT_OF_ORDER;
+    if (framesRead != s_->heldFrames) return AUDCLNT_E_INVALID_SIZE;
+    s_->holding = false;
+    if (s_->invalid()) return AUDCLNT_E_DEVICE_INVALIDATED;
+    s_->filled = s_->synthesized;
+    s_->position += framesRead;
+    return S_OK;
+  }
+
+ private:
+  // Takes the next packet into `bytes` and times it. When there is none yet (AUDCLNT_S_BUFFER_EMPTY)
+  // `qpcPosition` gets the time of the poll.
+  HRESULT takePacket(UINT64* qpcPosition) {
     const void* bytes = nullptr;
     size_t size = 0;
     // Most polls find the queue empty; those need not ask libpulse.
@@ -130,41 +170,23 @@ class CaptureClient : public ComObject<IAudioCaptureClient, IID_IAudioCaptureCli
       s_->emptySince = 0;  // the polls before the pause saw nothing of it
     }
     s_->lastPoll = now;
-    if (devicePosition) *devicePosition = s_->position;
-    if (size == 0) {
-      if (!s_->emptySince) s_->emptySince = now;
-      const UINT64 covered = s_->timeOf(s_->position);
-      if (!s_->started || !s_->anchored || now < std::max(covered, s_->emptySince) + kStallLimit) {
-        if (qpcPosition) *qpcPosition = now;
-        return AUDCLNT_S_BUFFER_EMPTY;
-      }
-      // Up to a fragment before now: data that arrives late still follows on.
-      const UINT64 missing = (now - covered - kRecordFragment) * s_->sampleSpec.rate / kUnitsPerSecond;
-      const uint32_t count = static_cast<uint32_t>(std::min<UINT64>(missing, s_->bufferFrames));
-      *flags |= AUDCLNT_BUFFERFLAGS_SILENT;
-      s_->bytes.assign(static_cast<size_t>(count) * s_->frameBytes, 0);
-      *data = s_->bytes.data();
-      if (qpcPosition) *qpcPosition = covered;
-      *frames = count;
-      s_->holding = true;
-      s_->heldFrames = count;
-      s_->heldBytes = 0;  // nothing of the server's queue
-      s_->synthesized = true;
-      return S_OK;
-    }
+    if (size == 0) return fillStall(now, qpcPosition);
     s_->emptySince = 0;
-    const uint32_t count = static_cast<uint32_t>(size / s_->frameBytes);
+    s_->synthesized = false;
+    s_->heldFrames = static_cast<uint32_t>(size / s_->frameBytes);
+    s_->heldFlags = 0;
     if (bytes) {
-      *data = static_cast<BYTE*>(const_cast<void*>(bytes));
+      s_->bytes.assign(static_cast<const uint8_t*>(bytes), static_cast<const uint8_t*>(bytes) + size);
     } else {
       // A hole in the stream: the sink played nothing there.
-      *flags |= AUDCLNT_BUFFERFLAGS_SILENT;
+      s_->heldFlags |= AUDCLNT_BUFFERFLAGS_SILENT;
       s_->bytes.assign(size, 0);
-      *data = s_->bytes.data();
     }
-    // The first frame of this packet arrived as long ago as everything queued behind it lasts.
+    // The first frame of this packet arrived as long ago as everything queued, itself included,
+    // lasts.
     const size_t queued = pa_stream_readable_size(s_->stream);
-    s_->readable = queued;
+    pa_stream_drop(s_->stream);
+    s_->readable = pa_stream_readable_size(s_->stream);
     const int64_t queuedUnits = static_cast<int64_t>(queued / s_->frameBytes) * kUnitsPerSecond / s_->sampleSpec.rate;
     const UINT64 measured = now - static_cast<UINT64>(std::max<int64_t>(queuedUnits, 0));
     UINT64 time = s_->timeOf(s_->position);
@@ -177,44 +199,33 @@ class CaptureClient : public ComObject<IAudioCaptureClient, IID_IAudioCaptureCli
     }
     const int64_t drift = static_cast<int64_t>(measured - time);
     if (!s_->anchored || (now >= s_->countOnlyUntil && (drift > kDriftLimit || drift < -kDriftLimit))) {
-      if (s_->anchored) *flags |= AUDCLNT_BUFFERFLAGS_DATA_DISCONTINUITY;
+      if (s_->anchored) s_->heldFlags |= AUDCLNT_BUFFERFLAGS_DATA_DISCONTINUITY;
       s_->anchored = true;
       s_->anchorTime = time = measured;
       s_->anchorPosition = s_->position;
     }
-    if (qpcPosition) *qpcPosition = time;
-    *frames = count;
-    s_->holding = true;
-    s_->heldFrames = count;
-    s_->heldBytes = size;
+    s_->heldTime = time;
     return S_OK;
   }
 
-  HRESULT ReleaseBuffer(UINT32 framesRead) override {
-    Lock lock(*s_->connection);
-    // Releasing nothing keeps the packet for the next GetBuffer.
-    if (framesRead == 0) {
-      s_->holding = false;
-      s_->synthesized = false;
-      return S_OK;
+  // A sink that has delivered nothing for kStallLimit: silence up to a fragment before now, so
+  // that data arriving late still follows on. AUDCLNT_S_BUFFER_EMPTY while the wait goes on.
+  HRESULT fillStall(UINT64 now, UINT64* qpcPosition) {
+    if (!s_->emptySince) s_->emptySince = now;
+    const UINT64 covered = s_->timeOf(s_->position);
+    if (!s_->started || !s_->anchored || now < std::max(covered, s_->emptySince) + kStallLimit) {
+      if (qpcPosition) *qpcPosition = now;
+      return AUDCLNT_S_BUFFER_EMPTY;
     }
-    if (!s_->holding) return AUDCLNT_E_OUT_OF_ORDER;
-    if (framesRead != s_->heldFrames) return AUDCLNT_E_INVALID_SIZE;
-    s_->holding = false;
-    if (s_->invalid()) return AUDCLNT_E_DEVICE_INVALIDATED;
-    if (s_->synthesized) {
-      s_->synthesized = false;
-      s_->filled = true;
-      s_->position += framesRead;
-      return S_OK;
-    }
-    pa_stream_drop(s_->stream);
-    s_->readable -= std::min(s_->readable, s_->heldBytes);
-    s_->position += framesRead;
+    const UINT64 missing = (now - covered - kRecordFragment) * s_->sampleSpec.rate / kUnitsPerSecond;
+    s_->heldFrames = static_cast<uint32_t>(std::min<UINT64>(missing, s_->bufferFrames));
+    s_->heldFlags = AUDCLNT_BUFFERFLAGS_SILENT;
+    s_->heldTime = covered;
+    s_->bytes.assign(static_cast<size_t>(s_->heldFrames) * s_->frameBytes, 0);
+    s_->synthesized = true;
     return S_OK;
   }
 
- private:
   std::shared_ptr<Stream> s_;
 };
 
@@ -339,7 +350,7 @@ class AudioClient : public ComObject<IAudioClient, IID_IAudioClient> {
     Lock lock(*s_->connection);
     if (s_->invalid()) return AUDCLNT_E_DEVICE_INVALIDATED;
     if (s_->loopback) {
-      *frames = static_cast<UINT32>(pa_stream_readable_size(s_->stream) / s_->frameBytes);
+      *frames = s_->kept ? s_->heldFrames : static_cast<UINT32>(pa_stream_readable_size(s_->stream) / s_->frameBytes);
     } else {
       const size_t writable = s_->writable / s_->frameBytes;
       *frames = s_->bufferFrames - static_cast<UINT32>(std::min<size_t>(writable, s_->bufferFrames));
@@ -375,6 +386,7 @@ class AudioClient : public ComObject<IAudioClient, IID_IAudioClient> {
     if (s_->holding) return AUDCLNT_E_BUFFER_OPERATION_PENDING;
     if (s_->invalid()) return AUDCLNT_E_DEVICE_INVALIDATED;
     s_->connection->wait(pa_stream_flush(s_->stream, nullptr, nullptr));
+    s_->kept = false;
     if (s_->loopback)
       s_->readable = pa_stream_readable_size(s_->stream);
     else
