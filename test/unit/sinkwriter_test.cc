@@ -559,6 +559,8 @@ struct AudioCase {
   WORD tag;
   WORD bits;
   DWORD mask;
+  UINT32 fileRate = 0;  // the file's rate when AAC does not take the input's
+  bool mixed = false;   // channels mixed into another layout: the tone is there, at some level
 };
 void PrintTo(const AudioCase& c, std::ostream* out) { *out << c.name; }
 
@@ -578,11 +580,12 @@ TEST_P(AacFile, KeepsRateChannelsDurationAndTheTone) {
   }
   ASSERT_EQ(writer->Finalize(), S_OK);
 
+  const int rate = static_cast<int>(c.fileRate ? c.fileRate : c.rate);
   const media::File file = media::probe(path);
   ASSERT_TRUE(file.opened);
   ASSERT_EQ(file.streams.size(), 1u);
   EXPECT_EQ(file.streams[0].codec, "aac");
-  EXPECT_EQ(file.streams[0].sampleRate, static_cast<int>(c.rate));
+  EXPECT_EQ(file.streams[0].sampleRate, rate);
   EXPECT_EQ(file.streams[0].channels, static_cast<int>(c.channels));
   EXPECT_NEAR(file.duration, 2.0, 2.0 * 0.03);
   const double bitsPerSecond = file.streams[0].bytes * 8 / 2.0;
@@ -594,24 +597,30 @@ TEST_P(AacFile, KeepsRateChannelsDurationAndTheTone) {
   for (int ch = 0; ch < decoded.channels; ++ch) {
     if (decoded.channels == 6 && ch == 3) continue;  // the LFE channel is low-passed by design
     std::vector<float> mono = media::channel(decoded.samples, decoded.channels, ch);
-    ASSERT_GT(mono.size(), c.rate);
-    mono.assign(mono.begin() + c.rate / 2, mono.begin() + c.rate / 2 + c.rate);  // one second from the middle
-    const double tone = media::power(mono, 440, static_cast<int>(c.rate));
-    EXPECT_NEAR(std::sqrt(tone) * 2, 0.5, 0.05) << "channel " << ch;  // the amplitude comes back
+    ASSERT_GT(mono.size(), static_cast<size_t>(rate));
+    mono.assign(mono.begin() + rate / 2, mono.begin() + rate / 2 + rate);  // one second from the middle
+    const double tone = media::power(mono, 440, rate);
+    if (c.mixed)
+      EXPECT_GT(std::sqrt(tone) * 2, 0.1) << "channel " << ch;
+    else
+      EXPECT_NEAR(std::sqrt(tone) * 2, 0.5, 0.05) << "channel " << ch;  // the amplitude comes back
     for (double other : {220.0, 660.0, 1000.0, 3000.0})
-      EXPECT_LT(media::power(mono, other, static_cast<int>(c.rate)), tone / 1000) << other << " Hz, channel " << ch;
+      EXPECT_LT(media::power(mono, other, rate), tone / 1000) << other << " Hz, channel " << ch;
   }
 }
 
 INSTANTIATE_TEST_SUITE_P(
     SampleKinds, AacFile,
-    testing::Values(AudioCase{"Float48kStereo", 48000, 2, WAVE_FORMAT_IEEE_FLOAT, 32,
-                              SPEAKER_FRONT_LEFT | SPEAKER_FRONT_RIGHT},
-                    AudioCase{"Pcm16At44kMono", 44100, 1, WAVE_FORMAT_PCM, 16, SPEAKER_FRONT_CENTER},
-                    AudioCase{"Pcm24Stereo", 48000, 2, WAVE_FORMAT_PCM, 24, 0},
-                    AudioCase{"Pcm32Stereo", 48000, 2, WAVE_FORMAT_PCM, 32, 0},
-                    AudioCase{"Float5_1", 48000, 6, WAVE_FORMAT_IEEE_FLOAT, 32, 0x3F},
-                    AudioCase{"Float5_1WithSideSpeakers", 48000, 6, WAVE_FORMAT_IEEE_FLOAT, 32, 0x60F}),
+    testing::Values(
+        AudioCase{"Float48kStereo", 48000, 2, WAVE_FORMAT_IEEE_FLOAT, 32, SPEAKER_FRONT_LEFT | SPEAKER_FRONT_RIGHT},
+        AudioCase{"Pcm16At44kMono", 44100, 1, WAVE_FORMAT_PCM, 16, SPEAKER_FRONT_CENTER},
+        AudioCase{"Pcm24Stereo", 48000, 2, WAVE_FORMAT_PCM, 24, 0},
+        AudioCase{"Pcm32Stereo", 48000, 2, WAVE_FORMAT_PCM, 32, 0},
+        AudioCase{"Float5_1", 48000, 6, WAVE_FORMAT_IEEE_FLOAT, 32, 0x3F},
+        AudioCase{"Float5_1WithSideSpeakers", 48000, 6, WAVE_FORMAT_IEEE_FLOAT, 32, 0x60F},
+        AudioCase{"Pcm16At192kIsWrittenAt96k", 192000, 2, WAVE_FORMAT_PCM, 16, 3, 96000},
+        // PulseAudio's own map for six channels: FL FR FC FLC FRC BC.
+        AudioCase{"Float6ChannelsOfNoAacLayoutAreMixedInto5_1", 48000, 6, WAVE_FORMAT_IEEE_FLOAT, 32, 0x1C7, 0, true}),
     [](const testing::TestParamInfo<AudioCase>& info) { return std::string(info.param.name); });
 
 TEST_F(SinkWriter, AudioGapsInSampleTimesBecomeSilence) {

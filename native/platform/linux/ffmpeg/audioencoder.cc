@@ -1,5 +1,6 @@
 // AAC through FFmpeg's own encoder: any PCM or float input is resampled to the encoder's format
-// and cut into its frame size.
+// (a rate or layout it does not take becomes the nearest one it does) and cut into its frame size.
+#include <cstdlib>
 #include <cstring>
 
 extern "C" {
@@ -54,12 +55,12 @@ class AudioEncoder : public StreamEncoder {
   }
 
   HRESULT open(IMFMediaType* output, IMFMediaType* input) {
-    const UINT32 rate = get32(output, MF_MT_AUDIO_SAMPLES_PER_SECOND, 0);
+    const UINT32 asked = get32(output, MF_MT_AUDIO_SAMPLES_PER_SECOND, 0);
     const UINT32 channels = get32(output, MF_MT_AUDIO_NUM_CHANNELS, 0);
     const UINT32 inRate = get32(input, MF_MT_AUDIO_SAMPLES_PER_SECOND, 0);
     const UINT32 inChannels = get32(input, MF_MT_AUDIO_NUM_CHANNELS, 0);
     bits_ = get32(input, MF_MT_AUDIO_BITS_PER_SAMPLE, 0);
-    if (!rate || !channels || !inRate || !inChannels || !bits_) return MF_E_INVALIDMEDIATYPE;
+    if (!asked || !channels || !inRate || !inChannels || !bits_) return MF_E_INVALIDMEDIATYPE;
     if (!inputSamples(getGuid(input, MF_MT_SUBTYPE), bits_, &inFormat_)) return MF_E_INVALIDMEDIATYPE;
     blockAlign_ = get32(input, MF_MT_AUDIO_BLOCK_ALIGNMENT, inChannels * bits_ / 8);
     if (blockAlign_ < inChannels * bits_ / 8) return MF_E_INVALIDMEDIATYPE;
@@ -67,6 +68,7 @@ class AudioEncoder : public StreamEncoder {
 
     const AVCodec* codec = avcodec_find_encoder(AV_CODEC_ID_AAC);
     if (!codec) return MF_E_INVALIDMEDIATYPE;
+    const UINT32 rate = encoderRate(codec, asked);
     const UINT32 mask = get32(input, MF_MT_AUDIO_CHANNEL_MASK, 0);
     channelLayout(mask, inChannels, &inLayout_);
     // The output keeps the input's layout when the encoder takes it, else the encoder's layout
@@ -86,15 +88,17 @@ class AudioEncoder : public StreamEncoder {
       av_channel_layout_copy(&outLayout_, chosen);
     }
 
-    CodecContextPtr context(avcodec_alloc_context3(codec));
-    context->sample_fmt = AV_SAMPLE_FMT_FLTP;
-    context->sample_rate = static_cast<int>(rate);
-    av_channel_layout_copy(&context->ch_layout, &outLayout_);
-    const UINT32 bytesPerSecond = get32(output, MF_MT_AUDIO_AVG_BYTES_PER_SECOND, 16000);
-    context->bit_rate = static_cast<int64_t>(bytesPerSecond) * 8;
-    context->time_base = {1, static_cast<int>(rate)};
-    if (format_->oformat->flags & AVFMT_GLOBALHEADER) context->flags |= AV_CODEC_FLAG_GLOBAL_HEADER;
-    if (avcodec_open2(context.get(), codec, nullptr) < 0) return MF_E_INVALIDMEDIATYPE;
+    const int64_t bitRate = static_cast<int64_t>(get32(output, MF_MT_AUDIO_AVG_BYTES_PER_SECOND, 16000)) * 8;
+    // The first try is quiet: its failure is not the recording's.
+    CodecContextPtr context = openContext(codec, rate, bitRate, AV_LOG_INFO - AV_LOG_ERROR);
+    if (!context) {
+      // A layout the encoder does not write (FFmpeg 5's AAC lists none, and takes few beyond its
+      // own): the channels are mixed by name into the default layout of their count.
+      av_channel_layout_uninit(&outLayout_);
+      av_channel_layout_default(&outLayout_, static_cast<int>(channels));
+      context = openContext(codec, rate, bitRate, 0);
+    }
+    if (!context) return MF_E_INVALIDMEDIATYPE;
     context_ = std::move(context);
     rate_ = rate;
 
@@ -173,6 +177,31 @@ class AudioEncoder : public StreamEncoder {
   void flush() override { av_audio_fifo_reset(fifo_.get()); }
 
  private:
+  // The rate nearest to `asked` that the encoder takes (AAC's end at 96 kHz).
+  static UINT32 encoderRate(const AVCodec* codec, UINT32 asked) {
+    if (!codec->supported_samplerates) return asked;
+    int64_t best = 0;
+    for (const int* r = codec->supported_samplerates; *r; ++r)
+      if (!best || std::abs(*r - static_cast<int64_t>(asked)) < std::abs(best - static_cast<int64_t>(asked))) best = *r;
+    return static_cast<UINT32>(best);
+  }
+
+  // The encoder opened on outLayout_, or none; `logOffset` raises the level of what it logs.
+  CodecContextPtr openContext(const AVCodec* codec, UINT32 rate, int64_t bitRate, int logOffset) {
+    CodecContextPtr context(avcodec_alloc_context3(codec));
+    if (!context) return nullptr;
+    context->log_level_offset = logOffset;
+    context->sample_fmt = AV_SAMPLE_FMT_FLTP;
+    context->sample_rate = static_cast<int>(rate);
+    av_channel_layout_copy(&context->ch_layout, &outLayout_);
+    context->bit_rate = bitRate;
+    context->time_base = {1, static_cast<int>(rate)};
+    if (format_->oformat->flags & AVFMT_GLOBALHEADER) context->flags |= AV_CODEC_FLAG_GLOBAL_HEADER;
+    if (avcodec_open2(context.get(), codec, nullptr) < 0) return nullptr;
+    context->log_level_offset = 0;
+    return context;
+  }
+
   HRESULT convert(const uint8_t** in, int frames) {
     const int capacity = swr_get_out_samples(resampler_.get(), frames);
     if (capacity <= 0) return S_OK;
