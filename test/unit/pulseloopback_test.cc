@@ -32,7 +32,8 @@ class PulseServer {
  public:
   PulseServer() {
     char folder[] = "/tmp/tavio-pulse-XXXXXX";
-    dir_ = mkdtemp(folder);
+    if (!mkdtemp(folder)) return;  // no server: the tests find no endpoint and say so
+    dir_ = folder;
     std::ofstream(dir_ + "/conf.pa") << "load-module module-native-protocol-unix auth-anonymous=1 socket=" << dir_
                                      << "/native\n"
                                      << "load-module module-null-sink sink_name=test_speakers\n"
@@ -54,7 +55,7 @@ class PulseServer {
 
   ~PulseServer() {
     kill();
-    std::filesystem::remove_all(dir_);
+    if (!dir_.empty()) std::filesystem::remove_all(dir_);
   }
 
   void kill() {
@@ -106,8 +107,6 @@ struct Loopback {
       packets.Reset();
   }
 
-  // Polls until a packet of the sine comes (not silence made up while the sink is slow to
-  // deliver), and holds it. Packets before it are released.
   struct Packet {
     BYTE* data = nullptr;
     UINT32 frames = 0;
@@ -115,6 +114,8 @@ struct Loopback {
     UINT64 position = 0;
     UINT64 time = 0;
   };
+  // Polls until a packet of the sine comes (not silence made up while the sink is slow to
+  // deliver), and holds it. Packets before it are released.
   bool holdSound(Packet& p) {
     bool holding = false;
     return eventually([&] {

@@ -177,7 +177,7 @@ class AudioEncoder : public StreamEncoder {
   void flush() override { av_audio_fifo_reset(fifo_.get()); }
 
  private:
-  // The rate nearest to `asked` that the encoder takes (AAC's end at 96 kHz).
+  // The rate the encoder takes nearest to `asked`: AAC's go up to 96 kHz.
   static UINT32 encoderRate(const AVCodec* codec, UINT32 asked) {
     if (!codec->supported_samplerates) return asked;
     int64_t best = 0;
