@@ -128,12 +128,20 @@ struct Loopback {
   }
 };
 
-TEST(PulseLoopback, APacketReleasedUnreadComesAgainAndTheNextFollowsIt) {
+// Each test begins holding a packet of the sine.
+class PulseLoopback : public testing::Test {
+ protected:
+  void SetUp() override {
+    ASSERT_TRUE(loopback.packets) << "no loopback client on the test's server";
+    ASSERT_TRUE(loopback.holdSound(held));
+  }
+
   PulseServer server;
-  Loopback loopback(server);
-  ASSERT_TRUE(loopback.packets) << "no loopback client on the test's server";
+  Loopback loopback{server};
   Loopback::Packet held;
-  ASSERT_TRUE(loopback.holdSound(held));
+};
+
+TEST_F(PulseLoopback, APacketReleasedUnreadComesAgainAndTheNextFollowsIt) {
   const std::vector<BYTE> sound(held.data, held.data + held.frames * loopback.frameBytes);
 
   ASSERT_EQ(loopback.packets->ReleaseBuffer(0), S_OK);
@@ -154,13 +162,7 @@ TEST(PulseLoopback, APacketReleasedUnreadComesAgainAndTheNextFollowsIt) {
 // libpulse frees a dead server's memory holding the main loop's lock and waits until no block of
 // it is in use; a packet that still pointed into that memory would keep the release below (which
 // needs the lock) waiting for ever, and the capture thread with it.
-TEST(PulseLoopback, APacketHeldWhenTheServerDiesIsReleasedAndTheDeviceIsLost) {
-  PulseServer server;
-  Loopback loopback(server);
-  ASSERT_TRUE(loopback.packets) << "no loopback client on the test's server";
-  Loopback::Packet held;
-  ASSERT_TRUE(loopback.holdSound(held));
-
+TEST_F(PulseLoopback, APacketHeldWhenTheServerDiesIsReleasedAndTheDeviceIsLost) {
   server.kill();
   // Time for the client's main loop to see the connection end.
   std::this_thread::sleep_for(std::chrono::milliseconds(300));
