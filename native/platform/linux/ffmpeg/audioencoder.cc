@@ -71,29 +71,14 @@ class AudioEncoder : public StreamEncoder {
     const UINT32 rate = encoderRate(codec, asked);
     const UINT32 mask = get32(input, MF_MT_AUDIO_CHANNEL_MASK, 0);
     channelLayout(mask, inChannels, &inLayout_);
-    // The output keeps the input's layout when the encoder takes it, else the encoder's layout
-    // of the same channel count.
+    // The output keeps the input's layout when the encoder takes it (tried first, quietly: that
+    // failure is not the recording's), else the channels are mixed by name into the default
+    // layout of their count. AAC takes few layouts beyond its own, and FFmpeg 5 lists none.
     channelLayout(channels == inChannels ? mask : 0, channels, &outLayout_);
-    if (codec->ch_layouts) {
-      const AVChannelLayout* chosen = nullptr;
-      for (const AVChannelLayout* l = codec->ch_layouts; l->nb_channels; ++l) {
-        if (!av_channel_layout_compare(l, &outLayout_)) {
-          chosen = l;
-          break;
-        }
-        if (!chosen && l->nb_channels == static_cast<int>(channels)) chosen = l;
-      }
-      if (!chosen) return MF_E_INVALIDMEDIATYPE;
-      av_channel_layout_uninit(&outLayout_);
-      av_channel_layout_copy(&outLayout_, chosen);
-    }
 
     const int64_t bitRate = static_cast<int64_t>(get32(output, MF_MT_AUDIO_AVG_BYTES_PER_SECOND, 16000)) * 8;
-    // The first try is quiet: its failure is not the recording's.
     CodecContextPtr context = openContext(codec, rate, bitRate, AV_LOG_INFO - AV_LOG_ERROR);
     if (!context) {
-      // A layout the encoder does not write (FFmpeg 5's AAC lists none, and takes few beyond its
-      // own): the channels are mixed by name into the default layout of their count.
       av_channel_layout_uninit(&outLayout_);
       av_channel_layout_default(&outLayout_, static_cast<int>(channels));
       context = openContext(codec, rate, bitRate, 0);
