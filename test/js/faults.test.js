@@ -41,15 +41,18 @@ require('readline').createInterface({ input: process.stdin }).on('line', (line) 
     for (const s of sources) addon.stopCapture(s.id);
     say({ stopped: Date.now() });
   } else if (command === 'peaks') {
-    // The loudest of ten readings over a second, as a meter shows it.
-    const uid = sources.find((s) => s.type === 'wasapi' && s.selected).id;
-    let loudest = 0;
+    // The loudest of ten readings over a second, as a meter shows it: the endpoint's left channel
+    // and the microphone's.
+    const endpoint = sources.find((s) => s.type === 'wasapi' && s.selected).id;
+    const microphone = sources.find((s) => s.type === 'mfce_audio').id;
+    const loudest = { left: 0, microphone: 0 };
     let readings = 0;
     const timer = setInterval(() => {
-      loudest = Math.max(loudest, addon.getPreview(uid).left);
+      loudest.left = Math.max(loudest.left, addon.getPreview(endpoint).left);
+      loudest.microphone = Math.max(loudest.microphone, addon.getPreview(microphone).left);
       if (++readings === 10) {
         clearInterval(timer);
-        say({ peaks: { left: loudest } });
+        say({ peaks: loudest });
       }
     }, 100);
   }
@@ -132,7 +135,8 @@ async function restartPulse(dir, env) {
 // in the sine source's two-second lumps (unless the case asks for the default desktop).
 const DESKTOP = { microphone: null, remappedMicrophone: { name: 'tavio_live_mic', description: 'Tavio Live Microphone' } };
 
-async function faultCase({ folder, broken, fault, check = () => {}, repair, desktopOptions = DESKTOP }) {
+// `silent`: the audio sources whose device the fault takes away; their meters read 0 meanwhile.
+async function faultCase({ folder, broken, silent = [], fault, check = () => {}, repair, desktopOptions = DESKTOP }) {
   const desktop = await startDesktop(desktopOptions);
   const env = desktop.env;
   const helpers = [playTone(env)];
@@ -151,6 +155,7 @@ async function faultCase({ folder, broken, fault, check = () => {}, repair, desk
     // recording meanwhile (an endpoint's capture thread takes 3 to 4 % of a core here, more on a slower
     // machine), so the bound sits well above their work and far below a spin.
     const busy = loads.filter((t) => t.load > spinning && !t.name.startsWith('node'));
+    const { peaks: away } = await host.ask('peaks');
     const stop = await host.ask('stop');
     await sleep(1500);
     const warnedAfterFault = host.output();
@@ -166,6 +171,10 @@ async function faultCase({ folder, broken, fault, check = () => {}, repair, desk
     check(first);
     assert.match(warnedAfterFault, /Warning: /, 'the fault is reported');
     assert.deepStrictEqual(busy, [], 'no thread spins while the device is gone');
+    // A meter of a device that is gone shows nothing; the endpoint's goes on while it stays.
+    if (silent.includes('wasapi')) assert.strictEqual(away.left, 0, 'the endpoint\'s meter while it is away');
+    else assert.ok(away.left > 0.3, `the endpoint's meter while another device is away: ${away.left}`);
+    if (silent.includes('mfce_audio')) assert.strictEqual(away.microphone, 0, 'the microphone\'s meter while it is away');
 
     await repair({ env, dir: desktop.dir, helpers });
     await sleep(3000);
@@ -201,6 +210,7 @@ test('the sound server killed and started again', async () => {
       folder,
       desktopOptions: {},
       broken: ['wasapi'],
+      silent: ['wasapi', 'mfce_audio'],
       fault: ({ dir }) => process.kill(pulsePid(dir), 'SIGKILL'),
       repair: async ({ env, dir, helpers }) => {
         await restartPulse(dir, env);
@@ -224,6 +234,7 @@ test('the sink unloaded and loaded again', async () => {
     await faultCase({
       folder,
       broken: ['wasapi'],
+      silent: ['wasapi'],
       fault: ({ env }) => unload(env, 'sink_name=tavio_speakers'),
       repair: async ({ env, helpers }) => {
         pactl(env, 'load-module', 'module-null-sink', 'sink_name=tavio_speakers', 'rate=48000', 'channels=2',
@@ -245,6 +256,7 @@ test('the microphone unplugged and plugged in again', async () => {
     await faultCase({
       folder,
       broken: ['mfce_audio'],
+      silent: ['mfce_audio'],
       fault: ({ env }) => unload(env, 'source_name=tavio_live_mic'),
       check: ({ files }) => {
         const samples = decode(Object.entries(files).find(([name]) => name.startsWith('mfce_audio'))[1]);

@@ -309,14 +309,18 @@ TEST(CameraCaptureManager, EngineEventsSetFlagsAndSignalEveryTime) {
   EXPECT_TRUE(manager.previewing);  // an unreadable type changes nothing but still signals
   EXPECT_TRUE(signalled(manager.engineEvent));
 
-  // The error event ends preview and recording; the next operation tears the engine down, and
-  // later operations find none.
+  // The error event ends preview and recording and silences the meter; the next operation tears
+  // the engine down, and later operations find none.
   fakeEngine(manager);
   manager.recording = true;
   manager.previewing = true;
+  manager.leftPeak.store(0.5);
+  manager.rightPeak.store(0.25);
   handle(MF_CAPTURE_ENGINE_ERROR, E_FAIL);
   EXPECT_FALSE(manager.previewing);
   EXPECT_FALSE(manager.recording);
+  EXPECT_EQ(manager.leftPeak.load(), 0.0);
+  EXPECT_EQ(manager.rightPeak.load(), 0.0);
   UINT32 width = 1, height = 2;
   EXPECT_EQ(MF_E_NOT_INITIALIZED, manager.ConfigurePreview(width, height));
   EXPECT_FALSE(manager.engine);

@@ -473,15 +473,19 @@ void PrintTo(const Failure& failure, std::ostream* out) { *out << failure.text; 
 
 class WasapiSourceFailure : public WasapiSource, public testing::WithParamInterface<Failure> {};
 
-TEST_P(WasapiSourceFailure, FinishesTheClipWarnsOnceAndCapturesAgain) {
+TEST_P(WasapiSourceFailure, FinishesTheClipWarnsOnceSilencesTheMeterAndCapturesAgain) {
   startCapture();
+  source->startPreview();
   source->startEncode("cut.mp4");
   feed(floats(tone(480), clockNow()));
+  ASSERT_TRUE(eventually([&] { return source->peak(0) == 0.25; }));
   Output output;
   audio->push(answer(GetParam().result));
   audio->push(answer(GetParam().result));  // the same failure again on the next try
   // What was recorded up to the failure stays: the clip is finished.
   ASSERT_TRUE(finished(0));
+  EXPECT_TRUE(eventually([&] { return source->peak(0) == 0.0 && source->peak(1) == 0.0; }))
+      << "the meter still shows the sound of an endpoint that is away";
   // Half a second later the thread opens the endpoint again, by itself, twice.
   ASSERT_TRUE(eventually([&] {
     std::lock_guard<std::mutex> lock(audio->mutex);

@@ -209,6 +209,11 @@ void Source::capture() {
                [&] {
                  // What was recorded up to a failure is kept: the clips end there.
                  self->finishAll(true);
+                 // The meter falls silent while the endpoint is away.
+                 {
+                   std::lock_guard<std::mutex> hold(self->peakLock);
+                   std::fill(self->peaks.begin(), self->peaks.end(), 0.0);
+                 }
                  // The failed try's clients go before the next (unless a newer capture thread has
                  // put its own in their place), so a device that stays away costs no memory.
                  IAudioCaptureClient* ownPackets = packets;

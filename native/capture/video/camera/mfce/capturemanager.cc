@@ -375,6 +375,9 @@ HRESULT CaptureManager::HandleEngineEvent(IMFMediaEvent* event) {
       // engine's own thread, and the owner may be calling into the engine at this moment.
       previewing = false;
       recording = false;
+      // A meter must not go on showing the sound of a device that is gone.
+      leftPeak.store(0.0);
+      rightPeak.store(0.0);
       ++handled_[EngineFailed];
       failed = true;
     }
