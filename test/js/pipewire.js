@@ -33,18 +33,18 @@ async function startPipeWire({ sinks, microphone }) {
     const server = { PULSE_SERVER: `unix:${dir}/pulse/native` };
     const pactl = (...args) => execFileSync('pactl', args, { env: { ...process.env, ...server }, encoding: 'utf8' });
     // A pactl command that fails until a program started above is ready, tried for five seconds.
-    const once = async (args, failure) => {
+    const retried = async (args, failure) => {
       for (let i = 0; spawnSync('pactl', args, { env: { ...process.env, ...server } }).status !== 0; i++) {
         if (i === 100) throw new Error(failure);
         await sleep(50);
       }
     };
-    await once(['info'], 'PipeWire\'s PulseAudio server did not answer');
+    await retried(['info'], 'PipeWire\'s PulseAudio server did not answer');
     const sink = ({ name, description }) => pactl('load-module', 'module-null-sink', `sink_name=${name}`,
       `sink_properties="device.description='${description}'"`);
     sinks.forEach(sink);
     // The session manager keeps the default; until it is ready the server answers "Not supported".
-    await once(['set-default-sink', sinks[0].name], `PipeWire did not take ${sinks[0].name} as its default sink`);
+    await retried(['set-default-sink', sinks[0].name], `PipeWire did not take ${sinks[0].name} as its default sink`);
     sink({ name: `${microphone.name}_feed`, description: `${microphone.description} Feed` });
     pactl('load-module', 'module-remap-source', `master=${microphone.name}_feed.monitor`, `source_name=${microphone.name}`,
       `source_properties="device.description='${microphone.description}'"`);

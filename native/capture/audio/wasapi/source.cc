@@ -206,26 +206,27 @@ void Source::capture() {
     IAudioClient* client = nullptr;
     IAudioCaptureClient* packets = nullptr;
     keepTrying([&] { self->runCapture(client, packets); }, [&] { return self->capturing.load(); },
-               [&] {
-                 // What was recorded up to a failure is kept: the clips end there.
-                 self->finishAll(true);
-                 // The meter falls silent while the endpoint is away.
-                 {
-                   std::lock_guard<std::mutex> hold(self->peakLock);
-                   std::fill(self->peaks.begin(), self->peaks.end(), 0.0);
-                 }
-                 // The failed try's clients go before the next (unless a newer capture thread has
-                 // put its own in their place), so a device that stays away costs no memory.
-                 IAudioCaptureClient* ownPackets = packets;
-                 if (packets && self->captureClient.compare_exchange_strong(ownPackets, nullptr)) packets->Release();
-                 IAudioClient* ownClient = client;
-                 if (client && self->audioClient.compare_exchange_strong(ownClient, nullptr)) client->Release();
-                 client = nullptr;
-                 packets = nullptr;
-               });
+               [&] { self->endFailedTry(client, packets); });
     // Capture stopped: every clip ends now, also one still waiting for an endpoint that is away.
     self->finishAll(false);
   }).detach();
+}
+
+// What was recorded up to a failure is kept: the clips end there. The meter falls silent while
+// the endpoint is away. The failed try's clients go before the next (unless a newer capture
+// thread has put its own in their place), so a device that stays away costs no memory.
+void Source::endFailedTry(IAudioClient*& client, IAudioCaptureClient*& packets) {
+  finishAll(true);
+  {
+    std::lock_guard<std::mutex> hold(peakLock);
+    std::fill(peaks.begin(), peaks.end(), 0.0);
+  }
+  IAudioCaptureClient* ownPackets = packets;
+  if (packets && captureClient.compare_exchange_strong(ownPackets, nullptr)) packets->Release();
+  IAudioClient* ownClient = client;
+  if (client && audioClient.compare_exchange_strong(ownClient, nullptr)) client->Release();
+  client = nullptr;
+  packets = nullptr;
 }
 
 void Source::startEncode(std::string filename) {

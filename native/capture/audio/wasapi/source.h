@@ -50,6 +50,8 @@ class Source : public capture::audio::Source, public std::enable_shared_from_thi
 
   // One try at capturing; it hands out the clients it made, for the caller to release if it fails.
   void runCapture(IAudioClient*& client, IAudioCaptureClient*& packets);
+  // After a failed try: finishes the clips, zeroes the peaks and lets go of the try's clients.
+  void endFailedTry(IAudioClient*& client, IAudioCaptureClient*& packets);
   // Gives every clip its part of the packet that covers [begin, begin + frames / rate) on the
   // capture clock, and finishes the clips that have reached their stop.
   void record(const BYTE* data, UINT32 frames, uint64_t begin, const WAVEFORMATEXTENSIBLE* captureFormat);

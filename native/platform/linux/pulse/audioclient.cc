@@ -62,8 +62,8 @@ struct Stream {
   UINT64 heldTime = 0;
   std::vector<uint8_t> bytes;
   // What libpulse would report, kept under the loop lock: the record queue's length, set by the
-  // read callback and read again after each of our drops; the bytes the server asked for, set by the write
-  // callback and lowered by our writes.
+  // read callback and read again after each of our drops; the bytes the server asked for, set by
+  // the write callback and lowered by our writes.
   size_t readable = 0;
   size_t writable = 0;
   // Capture timing: frames released so far, and the time line they lie on.
