@@ -7,32 +7,20 @@
 // A camera that sends H.264 is recorded as it sends it when the record stream asks for H.264
 // without a bit rate of its own; its pictures are still decoded for the preview.
 // Engine time is av_gettime_relative(): a step of the system clock moves no clip's start or stop.
+#include "platform/linux/capture/enginethread.h"
+
 extern "C" {
 #include <libavcodec/avcodec.h>
-#include <libavformat/avformat.h>
-#include <libavutil/opt.h>
 #include <libavutil/time.h>
-#include <libswresample/swresample.h>
-#include <libswscale/swscale.h>
 }
 
 #include <algorithm>
-#include <cstdint>
 #include <condition_variable>
-#include <cstdlib>
-#include <cstring>
-#include <deque>
 #include <memory>
 #include <mutex>
 #include <string>
-#include <thread>
 #include <vector>
 
-#include "platform/com.h"
-#include "platform/linux/capture/devicereader.h"
-#include "platform/linux/capture/enginestate.h"
-#include "platform/linux/capture/pictureslots.h"
-#include "platform/linux/ffmpeg/evenpicture.h"
 #include "platform/linux/mf/mfattributes.h"
 
 namespace platform::engine {
@@ -43,8 +31,6 @@ using capturedevice::DeviceFormat;
 using capturedevice::Input;
 using capturedevice::openInput;
 using capturedevice::requestKeyFrame;
-
-constexpr LONGLONG ticksPerSecond = 10000000;  // media times are in 100 ns units
 
 class MediaEvent : public Attributes<IMFMediaEvent, IID_IMFMediaEvent> {
  public:
@@ -75,173 +61,11 @@ int64_t timeOf(const AVFrame* frame) {
   return frame->best_effort_timestamp != AV_NOPTS_VALUE ? frame->best_effort_timestamp : frame->pts;
 }
 
-// A sample over buffer, whose first length bytes fill(data) writes.
-template <class Fill>
-HRESULT fillSample(IMFMediaBuffer* buffer, DWORD length, LONGLONG time, LONGLONG duration, Fill fill,
-                   IMFSample** sample) {
-  BYTE* data = nullptr;
-  HRESULT hr = buffer->Lock(&data, nullptr, nullptr);
-  if (SUCCEEDED(hr)) {
-    fill(data);
-    buffer->Unlock();
-    hr = buffer->SetCurrentLength(length);
-  }
-  ComPtr<IMFSample> made;
-  if (SUCCEEDED(hr)) hr = MFCreateSample(made.GetAddressOf());
-  if (SUCCEEDED(hr)) hr = made->AddBuffer(buffer);
-  if (SUCCEEDED(hr)) hr = made->SetSampleTime(time);
-  if (SUCCEEDED(hr)) hr = made->SetSampleDuration(duration);
-  if (FAILED(hr)) return hr;
-  *sample = made.Detach();
-  return S_OK;
-}
-
-// The engine's I420 pictures: rows of the even width (what the encoder's stride is), chroma rows
-// rounded up.
-struct I420Layout {
-  I420Layout(int width, int height)
-      : lumaStride(evenpicture::evenSize(width)),
-        chromaStride(lumaStride / 2),
-        lumaSize(static_cast<size_t>(lumaStride) * height),
-        chromaSize(static_cast<size_t>(chromaStride) * ((height + 1) / 2)) {}
-  DWORD length() const { return static_cast<DWORD>(lumaSize + 2 * chromaSize); }
-  int lumaStride;
-  int chromaStride;
-  size_t lumaSize;
-  size_t chromaSize;
-};
-
-// A sample holding a copy of bytes, or pixels written by fill(data), in a buffer of its own.
-template <class Fill>
-HRESULT makeSample(DWORD length, LONGLONG time, LONGLONG duration, Fill fill, IMFSample** sample) {
-  ComPtr<IMFMediaBuffer> buffer;
-  HRESULT hr = MFCreateMemoryBuffer(length, buffer.GetAddressOf());
-  if (FAILED(hr)) return hr;
-  return fillSample(buffer.Get(), length, time, duration, fill, sample);
-}
-
-// One clip: the record sink's writer and its converters, from record start until the file is
-// finished. A clip covers the interval from the StartRecord call to the StopRecord call: what the
-// devices captured in it goes in, a picture lasts until the next one (the last one until the
-// stop), and sound missing at the ends is silence.
-struct Recording {
-  ~Recording() { swr_free(&resampler); }
-  LONGLONG sinceStart(int64_t at) const { return (at - startAt) * 10; }  // engine time (µs) to media time
-  ComPtr<IMFSinkWriter> writer;
-  int64_t startAt = 0;     // engine time (µs) of the StartRecord call
-  int64_t stopAt = 0;      // of the StopRecord call; 0 while it records
-  HRESULT failure = S_OK;  // the first write that failed; nothing is written after it
-  DWORD videoStream = 0;
-  DWORD audioStream = 0;
-  bool hasVideo = false;
-  bool hasAudio = false;
-  bool videoPassthrough = false;  // the device's H.264 packets go into the file as they are
-  bool padded = false;            // an odd-sized picture is encoded at the next even size
-  int width = 0;                  // the device's picture size
-  int height = 0;
-  LONGLONG frameDuration = 0;  // at the device's frame rate
-  // The last picture, written when the next one shows how long it lasted.
-  ComPtr<IMFSample> held;
-  LONGLONG heldTime = 0;
-  pictureslots::PictureSlots slots;  // opened by the clip's first picture that has a device time
-  bool videoDone = false;            // a picture from after the stop has come
-  SwrContext* resampler = nullptr;
-  int audioRate = 0;
-  int audioChannels = 0;
-  LONGLONG audioSamples = 0;
-  int64_t audioReachedAt = INT64_MIN;  // engine time (µs) up to which sound has come
-};
-
-// What a clip shows when its camera sent no picture: black, in the form the encoder takes.
-ComPtr<IMFSample> blackPicture(const Recording& recording) {
-  ComPtr<IMFSample> sample;
-  if (recording.padded) {  // top-down BGRA of the device's size
-    const auto length = static_cast<DWORD>(recording.width * recording.height * 4);
-    makeSample(
-        length, 0, 0,
-        [&](BYTE* data) {
-          for (DWORD i = 0; i < length; i += 4) {
-            data[i] = data[i + 1] = data[i + 2] = 0;
-            data[i + 3] = 0xFF;
-          }
-        },
-        sample.GetAddressOf());
-  } else {  // limited-range I420, as the engine converts to
-    const I420Layout layout(recording.width, recording.height);
-    makeSample(
-        layout.length(), 0, 0,
-        [&](BYTE* data) {
-          std::fill_n(data, layout.lumaSize, 16);
-          std::fill_n(data + layout.lumaSize, 2 * layout.chromaSize, 128);
-        },
-        sample.GetAddressOf());
-  }
-  return sample;
-}
-
 constexpr int64_t videoGrace = 250000;     // µs after the stop to wait for the stop's picture
 constexpr int64_t soundGrace = 500000;     // and for its sound, which may come in large lumps
 constexpr int64_t soundHistory = 5000000;  // how far back the microphone's deliveries are kept
-// The pulse input stamps sound by the system clock, smoothed over its recent buffers: after a step
-// of that clock its stamps stray by up to the step for about a second. Until they have settled,
-// sound is timed by when it was read.
-constexpr int64_t clockStep = 10000;        // µs the system clock moved against engine time
-constexpr int64_t stampSettling = 3000000;  // µs after a step before stamps are believed again
 
-class EngineThread {
- public:
-  explicit EngineThread(std::shared_ptr<EngineState> state) : state_(std::move(state)) {}
-  void run();
-
- private:
-  void send(const GUID& type, HRESULT status);
-  HRESULT openDevices();
-  void closeDevices();
-  void execute(Order& order);
-  HRESULT startRecording(const Order& order);
-  void stopRecording(int64_t at);
-  void finishDue(bool all);
-  HRESULT finish(Recording& recording);
-  int64_t nextDeadline() const;
-  bool soundCanComeBy(int64_t due) const;
-  void fail(HRESULT status);
-  void arrive(Arrival& arrival);
-  void receive(Device& device, AVPacket* packet, int64_t readAt);
-  void passThrough(Recording& recording, const AVPacket* packet, AVRational timeBase, int64_t readAt);
-  static IMFMediaBuffer* pooledBuffer(std::vector<ComPtr<IMFMediaBuffer>>& pool, DWORD length);
-  void deliverVideo(AVFrame* frame, int64_t pts, AVRational timeBase, int64_t readAt);
-  void deliverAudio(AVFrame* frame, int64_t pts, AVRational timeBase, int64_t readAt);
-  void recordPicture(Recording& recording, IMFSample* bgra, IMFSample* i420, LONGLONG deviceTime, int64_t readAt);
-  void writeHeld(Recording& recording, LONGLONG duration);
-  void recordSound(Recording& recording, AVFrame* frame, int64_t capturedAt);
-  void writeSound(Recording& recording, const uint8_t* data, int samples);
-  void write(Recording& recording, DWORD stream, IMFSample* sample);
-  std::vector<Recording*> recordings();
-
-  std::shared_ptr<EngineState> state_;
-  std::unique_ptr<Recording> current_;                       // the clip being recorded
-  std::vector<std::unique_ptr<Recording>> finishing_;        // stopped clips waiting for their last data
-  std::unique_ptr<capturedevice::DeviceReader> readers_[2];  // video, audio
-  uint64_t generations_[2] = {0, 0};
-  SwsContext* toI420_ = nullptr;  // the device's pictures into I420 at the device's size
-  SwsContext* toBgra_ = nullptr;  // and those into the preview's BGRA
-  AVFrame* frame_ = nullptr;
-  // Picture buffers (BGRA, I420), used again when nothing else holds them any more (the preview
-  // copies a picture, the sink writer encodes it at once): a new one for each picture costs the
-  // kernel a fresh zeroed page for every 4 KB of it.
-  std::vector<ComPtr<IMFMediaBuffer>> pictures_;
-  std::vector<ComPtr<IMFMediaBuffer>> i420Pictures_;
-  // The picture current now, which a clip starting now opens with.
-  ComPtr<IMFSample> lastPicture_;
-  ComPtr<IMFSample> lastI420_;
-  LONGLONG lastPictureTime_ = 0;
-  int64_t lastPictureReadAt_ = 0;
-  AVFrame* lastSound_ = nullptr;       // the microphone's last buffer
-  int64_t lastSoundAt_ = 0;            // when its first sample was captured (engine time, µs)
-  std::deque<int64_t> soundArrivals_;  // when its buffers were read (engine time, µs), oldest first
-  int64_t wallOffset_ = 0;             // system clock minus engine time at its last buffer; 0: none yet
-  int64_t stampsFrom_ = 0;             // engine time from which its stamps are believed
-};
+}  // namespace
 
 void EngineThread::send(const GUID& type, HRESULT status) {
   ComPtr<IMFCaptureEngineOnEventCallback> callback;
@@ -439,16 +263,6 @@ int64_t EngineThread::nextDeadline() const {
   return next;
 }
 
-// Whether the microphone's next delivery may come by `due`: it is expected one of its recent
-// longest pauses after its last. One that sends seconds at once is not waited for when its next
-// lump is due after the grace, since the clip would get silence there all the same.
-bool EngineThread::soundCanComeBy(int64_t due) const {
-  int64_t longest = 0;
-  for (size_t i = 1; i < soundArrivals_.size(); ++i)
-    longest = std::max(longest, soundArrivals_[i] - soundArrivals_[i - 1]);
-  return soundArrivals_.empty() || soundArrivals_.back() + longest <= due;
-}
-
 // Finishes the stopped clips whose last picture and sound have come (or cannot come in time), or
 // whose grace has run out (all: every one, now), and answers each StopRecord once its file is
 // complete.
@@ -518,302 +332,6 @@ void EngineThread::fail(HRESULT status) {
   }
   closeDevices();
   send(MF_CAPTURE_ENGINE_ERROR, status);
-}
-
-// A buffer of the pool that nothing else holds any more and that is large enough, else a new one;
-// null if none could be made.
-IMFMediaBuffer* EngineThread::pooledBuffer(std::vector<ComPtr<IMFMediaBuffer>>& pool, DWORD length) {
-  for (auto& buffer : pool) {
-    DWORD room = 0;
-    if (heldOnlyBy(buffer) && SUCCEEDED(buffer->GetMaxLength(&room)) && room >= length) return buffer.Get();
-  }
-  ComPtr<IMFMediaBuffer> made;
-  if (FAILED(MFCreateMemoryBuffer(length, made.GetAddressOf()))) return nullptr;
-  // A clip holds a picture until the next, the engine the current one, a preview one more.
-  if (pool.size() < 4)
-    pool.push_back(made);
-  else
-    pool[pool.size() - 1] = made;
-  return made.Get();
-}
-
-// Pictures go to the preview and into the clips at the size the device was found with: a device
-// that changes its size mid-stream is scaled back to it. Each picture is converted once, into
-// I420, which the encoder takes as it is (as it would take the device's own pictures); the
-// preview's BGRA is made from that. swscale turns packed 4:2:2 (YUY2) into I420 with a fast
-// unscaled path, and I420 into BGRA with its SIMD converter.
-void EngineThread::deliverVideo(AVFrame* frame, int64_t pts, AVRational timeBase, int64_t readAt) {
-  const DeviceFormat& f = state_->video->current;
-  const int width = f.width;
-  const int height = f.height;
-  if (width <= 0 || height <= 0 || frame->width <= 0 || frame->height <= 0) return;
-  const I420Layout layout(width, height);
-  const DWORD i420Length = layout.length();
-  const auto bgraLength = static_cast<DWORD>(width * height * 4);
-  const bool sameSize = frame->width == width && frame->height == height;
-  toI420_ =
-      sws_getCachedContext(toI420_, frame->width, frame->height, static_cast<AVPixelFormat>(frame->format), width,
-                           height, AV_PIX_FMT_YUV420P, sameSize ? SWS_POINT : SWS_BILINEAR, nullptr, nullptr, nullptr);
-  toBgra_ = sws_getCachedContext(toBgra_, width, height, AV_PIX_FMT_YUV420P, width, height, AV_PIX_FMT_BGRA, SWS_POINT,
-                                 nullptr, nullptr, nullptr);
-  if (!toI420_ || !toBgra_) return;
-  const AVRational rate = f.rate;
-  const LONGLONG duration = av_rescale(ticksPerSecond, rate.den, rate.num);
-  const LONGLONG time = pts != AV_NOPTS_VALUE
-                            ? av_rescale_q(pts, timeBase, AVRational{1, static_cast<int>(ticksPerSecond)})
-                            : (readAt * 10);
-
-  IMFMediaBuffer* i420Buffer = pooledBuffer(i420Pictures_, i420Length);
-  IMFMediaBuffer* bgraBuffer = pooledBuffer(pictures_, bgraLength);
-  if (!i420Buffer || !bgraBuffer) return;
-  const uint8_t* planes[3] = {};
-  const int strides[3] = {layout.lumaStride, layout.chromaStride, layout.chromaStride};
-  ComPtr<IMFSample> i420;
-  HRESULT hr = fillSample(
-      i420Buffer, i420Length, time, duration,
-      [&](BYTE* data) {
-        uint8_t* to[3] = {data, data + layout.lumaSize, data + layout.lumaSize + layout.chromaSize};
-        sws_scale(toI420_, frame->data, frame->linesize, 0, frame->height, to, strides);
-        std::copy(to, to + 3, planes);
-      },
-      i420.GetAddressOf());
-  if (FAILED(hr)) return;
-  // A memory buffer keeps its place while a sample holds it: the planes are still there after the unlock.
-  ComPtr<IMFSample> sample;
-  hr = fillSample(
-      bgraBuffer, bgraLength, time, duration,
-      [&](BYTE* data) {
-        uint8_t* to[1] = {data};
-        const int toStrides[1] = {width * 4};
-        sws_scale(toBgra_, planes, strides, 0, height, to, toStrides);
-      },
-      sample.GetAddressOf());
-  if (FAILED(hr)) return;
-  lastI420_ = i420;
-  lastPicture_ = sample;
-  lastPictureTime_ = time;
-  lastPictureReadAt_ = readAt;
-
-  std::vector<ComPtr<IMFCaptureEngineOnSampleCallback>> callbacks;
-  bool previewing;
-  {
-    std::lock_guard<std::mutex> lock(state_->mutex);
-    previewing = state_->previewing;
-    for (const SinkStream& stream : state_->previewStreams)
-      if (stream.video && stream.callback) callbacks.push_back(stream.callback);
-  }
-  if (previewing)
-    for (auto& callback : callbacks) callback->OnSample(sample.Get());
-  for (Recording* recording : recordings()) recordPicture(*recording, sample.Get(), i420.Get(), time, readAt);
-}
-
-// A picture read before the clip's start (it waited behind a command) replaces the opening one;
-// from then on each picture writes the one before it, now that its length is known.
-void EngineThread::recordPicture(Recording& recording, IMFSample* bgra, IMFSample* i420, LONGLONG deviceTime,
-                                 int64_t readAt) {
-  IMFSample* picture = recording.padded ? bgra : i420;
-  if (!recording.hasVideo || recording.videoPassthrough || recording.videoDone || FAILED(recording.failure)) return;
-  if (recording.stopAt && readAt >= recording.stopAt) {
-    // A clip stopped before the device's first picture came shows that picture all along.
-    if (!recording.held) recording.held = ComPtr<IMFSample>(picture);
-    recording.videoDone = true;
-    return;
-  }
-  if (!recording.held || readAt < recording.startAt) {
-    recording.held = ComPtr<IMFSample>(picture);
-    recording.heldTime = 0;
-    recording.slots.open(deviceTime, recording.sinceStart(readAt), recording.frameDuration);
-    return;
-  }
-  LONGLONG time = recording.slots.place(deviceTime, recording.sinceStart(readAt), recording.frameDuration);
-  if (time == recording.heldTime) {  // a later picture in the held one's slot takes its place
-    recording.held = ComPtr<IMFSample>(picture);
-    return;
-  }
-  if (time < recording.heldTime) time = recording.heldTime + recording.frameDuration;  // the device's clock jumped back
-  writeHeld(recording, time - recording.heldTime);
-  recording.held = ComPtr<IMFSample>(picture);
-  recording.heldTime = time;
-}
-
-void EngineThread::writeHeld(Recording& recording, LONGLONG duration) {
-  ComPtr<IMFSample> sample = recording.held;
-  recording.held = ComPtr<IMFSample>();
-  if (!sample || FAILED(recording.failure)) return;
-  if (recording.padded) {
-    // The encoder takes the even size: a copy with the last column and row repeated.
-    const int width = evenpicture::evenSize(recording.width);
-    const int height = evenpicture::evenSize(recording.height);
-    ComPtr<IMFMediaBuffer> source;
-    BYTE* data = nullptr;
-    if (FAILED(sample->GetBufferByIndex(0, source.GetAddressOf())) || FAILED(source->Lock(&data, nullptr, nullptr)))
-      return;
-    ComPtr<IMFSample> copy;
-    const HRESULT hr = makeSample(
-        static_cast<DWORD>(width * height * 4), 0, 0,
-        [&](BYTE* to) { evenpicture::pad(data, recording.width, recording.height, to); }, copy.GetAddressOf());
-    source->Unlock();
-    if (FAILED(hr)) return;
-    sample = copy;
-  }
-  sample->SetSampleTime(recording.heldTime);
-  sample->SetSampleDuration(duration);
-  write(recording, recording.videoStream, sample.Get());
-}
-
-void EngineThread::deliverAudio(AVFrame* frame, int64_t pts, AVRational timeBase, int64_t readAt) {
-  const DeviceFormat& f = state_->audio->current;
-  const int channels = frame->ch_layout.nb_channels;
-  const bool interleaved16 = frame->format == AV_SAMPLE_FMT_S16;
-  const DWORD length = static_cast<DWORD>(frame->nb_samples * channels * 2);
-  const LONGLONG duration = av_rescale(frame->nb_samples, ticksPerSecond, f.sampleRate);
-
-  // The pulse input stamps a packet with the system clock (µs) of its first sample, from the
-  // stream's latency. A new stream's first packet has come stamped as if captured from its arrival
-  // on (PulseAudio's sine source: a two-second lump ahead of the clock); sound cannot end after it
-  // was read.
-  const int64_t span = frame->sample_rate > 0 ? av_rescale(frame->nb_samples, 1000000, frame->sample_rate) : 0;
-  const int64_t wallOffset = av_gettime() - av_gettime_relative();
-  if (wallOffset_ && std::llabs(wallOffset - wallOffset_) > clockStep) stampsFrom_ = readAt + stampSettling;
-  wallOffset_ = wallOffset;
-  const int64_t stamped = pts == AV_NOPTS_VALUE || readAt < stampsFrom_
-                              ? INT64_MAX
-                              : av_rescale_q(pts, timeBase, AVRational{1, 1000000}) - wallOffset;
-  const int64_t capturedAt = std::min(stamped, readAt - span);
-  // Kept for a clip that starts while this buffer's sound is still current.
-  av_frame_unref(lastSound_);
-  av_frame_ref(lastSound_, frame);
-  lastSoundAt_ = capturedAt;
-  for (Recording* recording : recordings()) recordSound(*recording, frame, capturedAt);
-
-  if (interleaved16) {
-    std::vector<ComPtr<IMFCaptureEngineOnSampleCallback>> callbacks;
-    bool previewing;
-    {
-      std::lock_guard<std::mutex> lock(state_->mutex);
-      previewing = state_->previewing;
-      for (const SinkStream& stream : state_->previewStreams)
-        if (!stream.video && stream.callback) callbacks.push_back(stream.callback);
-    }
-    if (previewing && !callbacks.empty()) {
-      ComPtr<IMFSample> sample;
-      if (SUCCEEDED(makeSample(
-              length, capturedAt * 10, duration, [&](BYTE* data) { std::memcpy(data, frame->data[0], length); },
-              sample.GetAddressOf())))
-        for (auto& callback : callbacks) callback->OnSample(sample.Get());
-    }
-  }
-}
-
-// Only what was captured between the clip's start and stop goes in, cut inside the buffer, since a
-// source may deliver seconds in one; a clip whose first sound comes after its start begins with
-// silence up to it.
-void EngineThread::recordSound(Recording& recording, AVFrame* frame, int64_t capturedAt) {
-  if (!recording.hasAudio || FAILED(recording.failure)) return;
-  const int channels = frame->ch_layout.nb_channels;
-  const int rate = frame->sample_rate;
-  const int count = frame->nb_samples;
-  if (rate <= 0 || count <= 0) return;
-  const int64_t end = capturedAt + av_rescale(count, 1000000, rate);
-  const int64_t startAt = recording.startAt;
-  const int64_t stopAt = recording.stopAt;
-  int first = 0;
-  int last = count;
-  if (capturedAt < startAt)
-    first =
-        static_cast<int>(std::min<int64_t>(count, av_rescale_rnd(startAt - capturedAt, rate, 1000000, AV_ROUND_UP)));
-  if (stopAt) last = static_cast<int>(std::clamp<int64_t>(av_rescale(stopAt - capturedAt, rate, 1000000), 0, count));
-  if (stopAt && recording.audioReachedAt >= stopAt) return;  // the clip has all its sound
-  recording.audioReachedAt = std::max(recording.audioReachedAt, end);
-  if (recording.resampler && last > first) {
-    // A source that stamps lumps of sound as if just captured gives stamps that overlap what the
-    // clip already has: that sound is not written twice (a few ms of jitter are let be).
-    const int64_t position = av_rescale(capturedAt - startAt, rate, 1000000) + first;
-    const int64_t have = av_rescale(recording.audioSamples, rate, recording.audioRate);
-    if (have - position > rate / 200) first = static_cast<int>(std::min<int64_t>(last, first + (have - position)));
-  }
-  if (last <= first) return;
-  if (!recording.resampler) {
-    AVChannelLayout out;
-    av_channel_layout_default(&out, recording.audioChannels);
-    swr_alloc_set_opts2(&recording.resampler, &out, AV_SAMPLE_FMT_S16, recording.audioRate, &frame->ch_layout,
-                        static_cast<AVSampleFormat>(frame->format), frame->sample_rate, 0, nullptr);
-    av_channel_layout_uninit(&out);
-    if (!recording.resampler || swr_init(recording.resampler) < 0) {
-      recording.failure = MF_E_INVALIDMEDIATYPE;
-      return;
-    }
-    if (capturedAt > startAt) {
-      const int64_t gap = av_rescale(capturedAt - startAt, recording.audioRate, 1000000);
-      std::vector<uint8_t> silence(static_cast<size_t>(std::max<int64_t>(gap, 0)) * recording.audioChannels * 2, 0);
-      if (gap > 0) writeSound(recording, silence.data(), static_cast<int>(gap));
-    }
-  }
-  const AVSampleFormat format = static_cast<AVSampleFormat>(frame->format);
-  const bool planar = av_sample_fmt_is_planar(format);
-  const int skip = first * av_get_bytes_per_sample(format) * (planar ? 1 : channels);
-  std::vector<const uint8_t*> in(planar ? channels : 1);
-  for (size_t plane = 0; plane < in.size(); ++plane) in[plane] = frame->extended_data[plane] + skip;
-  const int room = swr_get_out_samples(recording.resampler, last - first);
-  std::vector<uint8_t> converted(static_cast<size_t>(room) * recording.audioChannels * 2);
-  uint8_t* out[1] = {converted.data()};
-  const int made = swr_convert(recording.resampler, out, room, in.data(), last - first);
-  if (made > 0) writeSound(recording, converted.data(), made);
-}
-
-// Interleaved 16-bit samples at the clip's rate, placed after the ones before.
-void EngineThread::writeSound(Recording& recording, const uint8_t* data, int samples) {
-  const DWORD bytes = static_cast<DWORD>(samples * recording.audioChannels * 2);
-  const LONGLONG time = av_rescale(recording.audioSamples, ticksPerSecond, recording.audioRate);
-  const LONGLONG span = av_rescale(samples, ticksPerSecond, recording.audioRate);
-  recording.audioSamples += samples;
-  ComPtr<IMFSample> sample;
-  if (SUCCEEDED(makeSample(
-          bytes, time, span, [&](BYTE* to) { std::memcpy(to, data, bytes); }, sample.GetAddressOf())))
-    write(recording, recording.audioStream, sample.Get());
-}
-
-// Writes a packet of an H.264 device into a passthrough clip as it came. The clip starts at 0
-// with the first key frame after it started: what comes before cannot be decoded without the
-// pictures it refers to.
-void EngineThread::passThrough(Recording& recording, const AVPacket* packet, AVRational timeBase, int64_t readAt) {
-  if (!recording.videoPassthrough || recording.videoDone || FAILED(recording.failure)) return;
-  const bool key = (packet->flags & AV_PKT_FLAG_KEY) != 0;
-  const bool started = recording.held || recording.heldTime > 0;
-  const bool late = recording.stopAt && readAt >= recording.stopAt;
-  if (late && started) {
-    recording.videoDone = true;
-    return;
-  }
-  if (!started && !key) return;
-  const AVRational ticks{1, static_cast<int>(ticksPerSecond)};
-  const LONGLONG duration =
-      packet->duration > 0 ? av_rescale_q(packet->duration, timeBase, ticks) : recording.frameDuration;
-  const int64_t pts = packet->pts != AV_NOPTS_VALUE ? packet->pts : packet->dts;
-  const LONGLONG deviceTime = pts != AV_NOPTS_VALUE ? av_rescale_q(pts, timeBase, ticks) : AV_NOPTS_VALUE;
-
-  const DWORD length = static_cast<DWORD>(packet->size);
-  ComPtr<IMFSample> sample;
-  HRESULT hr = makeSample(
-      length, 0, duration, [&](BYTE* data) { std::memcpy(data, packet->data, length); }, sample.GetAddressOf());
-  if (SUCCEEDED(hr) && key) hr = sample->SetUINT32(MFSampleExtension_CleanPoint, TRUE);
-  if (FAILED(hr)) return;
-  if (!started) {
-    // The first key frame opens the clip, even one that came after the stop.
-    recording.held = sample;
-    recording.heldTime = 0;
-    recording.frameDuration = duration;
-    if (deviceTime != AV_NOPTS_VALUE) recording.slots.open(deviceTime, recording.sinceStart(readAt), duration);
-    recording.videoDone = late;
-    return;
-  }
-  LONGLONG time = recording.heldTime + recording.frameDuration;  // no time of its own: the packets follow one another
-  if (deviceTime != AV_NOPTS_VALUE && recording.slots.opened())
-    time = std::max(time, recording.slots.place(deviceTime, recording.sinceStart(readAt), recording.frameDuration));
-  writeHeld(recording, time - recording.heldTime);
-  recording.held = sample;
-  recording.heldTime = time;
-  recording.frameDuration = duration;
 }
 
 // One packet as the device delivered it: into passthrough clips as it is, and decoded for the
@@ -974,8 +492,6 @@ void EngineThread::run() {
   av_frame_free(&frame_);
   av_frame_free(&lastSound_);
 }
-
-}  // namespace
 
 void runEngineThread(std::shared_ptr<EngineState> state) { EngineThread(std::move(state)).run(); }
 
