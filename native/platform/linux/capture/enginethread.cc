@@ -139,6 +139,87 @@ std::vector<Recording*> EngineThread::recordings() {
   return all;
 }
 
+// One of the record sink's streams in the clip's writer: the device's H.264 passed through, its
+// pictures encoded, or its sound.
+HRESULT EngineThread::addStream(Recording& recording, const SinkStream& stream) {
+  Device* device = stream.video ? state_->video.get() : state_->audio.get();
+  const DeviceFormat& f = device->current;
+  DWORD index = 0;
+  ComPtr<IMFMediaType> output(stream.type);
+  ComPtr<IMFMediaType> input;
+  HRESULT hr = MFCreateMediaType(input.GetAddressOf());
+  if (FAILED(hr)) return hr;
+  GUID wanted = GUID_NULL;
+  UINT32 bitRate = 0;
+  stream.type->GetGUID(MF_MT_SUBTYPE, &wanted);
+  if (stream.video && f.subtype == MFVideoFormat_H264 && wanted == MFVideoFormat_H264 &&
+      FAILED(stream.type->GetUINT32(MF_MT_AVG_BITRATE, &bitRate))) {
+    // H.264 asked for with no bit rate to encode at, from a device that sends H.264: its own
+    // packets are written, with its parameter sets when it has them apart from the packets.
+    hr = input->SetGUID(MF_MT_MAJOR_TYPE, MFMediaType_Video);
+    if (SUCCEEDED(hr)) hr = input->SetGUID(MF_MT_SUBTYPE, MFVideoFormat_H264);
+    if (SUCCEEDED(hr)) hr = MFSetAttributeSize(input.Get(), MF_MT_FRAME_SIZE, f.width, f.height);
+    if (SUCCEEDED(hr)) hr = MFSetAttributeRatio(input.Get(), MF_MT_FRAME_RATE, f.rate.num, f.rate.den);
+    if (SUCCEEDED(hr)) hr = input->SetUINT32(MF_MT_INTERLACE_MODE, MFVideoInterlace_Progressive);
+    const AVCodecParameters* delivered = device->input->delivered;
+    if (SUCCEEDED(hr) && delivered->extradata_size > 0)
+      hr = input->SetBlob(MF_MT_MPEG_SEQUENCE_HEADER, delivered->extradata,
+                          static_cast<UINT32>(delivered->extradata_size));
+    recording.videoPassthrough = true;
+  } else if (stream.video) {
+    // The encoder is given the engine's I420 pictures, or top-down BGRA rows made even (see
+    // evenpicture.h) for an odd-sized device.
+    const int width = evenpicture::evenSize(f.width);
+    const int height = evenpicture::evenSize(f.height);
+    recording.padded = width != f.width || height != f.height;
+    // libx264 counts its rate in whole kbit/s: a tiny picture's estimate would be none at all.
+    constexpr UINT32 lowestBitRate = 1000;
+    const bool slow = SUCCEEDED(stream.type->GetUINT32(MF_MT_AVG_BITRATE, &bitRate)) && bitRate < lowestBitRate;
+    if (recording.padded || slow) {
+      hr = MFCreateMediaType(output.ReleaseAndGetAddressOf());
+      if (SUCCEEDED(hr)) hr = stream.type->CopyAllItems(output.Get());
+      if (SUCCEEDED(hr)) hr = MFSetAttributeSize(output.Get(), MF_MT_FRAME_SIZE, width, height);
+      if (SUCCEEDED(hr) && slow) hr = output->SetUINT32(MF_MT_AVG_BITRATE, lowestBitRate);
+    }
+    if (SUCCEEDED(hr)) hr = input->SetGUID(MF_MT_MAJOR_TYPE, MFMediaType_Video);
+    if (SUCCEEDED(hr)) hr = input->SetGUID(MF_MT_SUBTYPE, recording.padded ? MFVideoFormat_RGB32 : MFVideoFormat_I420);
+    if (SUCCEEDED(hr)) hr = MFSetAttributeSize(input.Get(), MF_MT_FRAME_SIZE, width, height);
+    if (SUCCEEDED(hr)) hr = MFSetAttributeRatio(input.Get(), MF_MT_FRAME_RATE, f.rate.num, f.rate.den);
+    if (SUCCEEDED(hr))
+      hr = input->SetUINT32(MF_MT_DEFAULT_STRIDE, static_cast<UINT32>(recording.padded ? width * 4 : width));
+    if (SUCCEEDED(hr)) hr = input->SetUINT32(MF_MT_INTERLACE_MODE, MFVideoInterlace_Progressive);
+  } else {
+    UINT32 rate = 0, channels = 0;
+    stream.type->GetUINT32(MF_MT_AUDIO_SAMPLES_PER_SECOND, &rate);
+    stream.type->GetUINT32(MF_MT_AUDIO_NUM_CHANNELS, &channels);
+    if (!rate) rate = f.sampleRate;
+    if (!channels) channels = f.channels;
+    recording.audioRate = static_cast<int>(rate);
+    recording.audioChannels = static_cast<int>(channels);
+    hr = input->SetGUID(MF_MT_MAJOR_TYPE, MFMediaType_Audio);
+    if (SUCCEEDED(hr)) hr = input->SetGUID(MF_MT_SUBTYPE, MFAudioFormat_PCM);
+    if (SUCCEEDED(hr)) hr = input->SetUINT32(MF_MT_AUDIO_NUM_CHANNELS, channels);
+    if (SUCCEEDED(hr)) hr = input->SetUINT32(MF_MT_AUDIO_SAMPLES_PER_SECOND, rate);
+    if (SUCCEEDED(hr)) hr = input->SetUINT32(MF_MT_AUDIO_BITS_PER_SAMPLE, 16);
+    if (SUCCEEDED(hr)) hr = input->SetUINT32(MF_MT_AUDIO_BLOCK_ALIGNMENT, 2 * channels);
+    if (SUCCEEDED(hr)) hr = input->SetUINT32(MF_MT_AUDIO_AVG_BYTES_PER_SECOND, 2 * channels * rate);
+  }
+  if (SUCCEEDED(hr)) hr = recording.writer->AddStream(output.Get(), &index);
+  if (SUCCEEDED(hr)) hr = recording.writer->SetInputMediaType(index, input.Get(), nullptr);
+  if (FAILED(hr)) return hr;
+  if (stream.video) {
+    recording.videoStream = index;
+    recording.hasVideo = true;
+    recording.width = f.width;
+    recording.height = f.height;
+    recording.frameDuration = av_rescale(ticksPerSecond, f.rate.den, f.rate.num);
+  } else {
+    recording.audioStream = index;
+    recording.hasAudio = true;
+  }
+  return S_OK;
+}
+
 HRESULT EngineThread::startRecording(const Order& order) {
   if (order.path.empty() || order.streams.empty()) return MF_E_INVALIDREQUEST;
   auto recording = std::make_unique<Recording>();
@@ -150,85 +231,8 @@ HRESULT EngineThread::startRecording(const Order& order) {
   if (SUCCEEDED(hr)) hr = settings->SetGUID(MF_TRANSCODE_CONTAINERTYPE, MFTranscodeContainerType_FMPEG4);
   if (SUCCEEDED(hr))
     hr = MFCreateSinkWriterFromURL(url.c_str(), nullptr, settings.Get(), recording->writer.GetAddressOf());
-  for (const SinkStream& stream : order.streams) {
-    if (FAILED(hr)) break;
-    Device* device = stream.video ? state_->video.get() : state_->audio.get();
-    const DeviceFormat& f = device->current;
-    DWORD index = 0;
-    ComPtr<IMFMediaType> output(stream.type);
-    ComPtr<IMFMediaType> input;
-    hr = MFCreateMediaType(input.GetAddressOf());
-    if (FAILED(hr)) break;
-    GUID wanted = GUID_NULL;
-    UINT32 bitRate = 0;
-    stream.type->GetGUID(MF_MT_SUBTYPE, &wanted);
-    if (stream.video && f.subtype == MFVideoFormat_H264 && wanted == MFVideoFormat_H264 &&
-        FAILED(stream.type->GetUINT32(MF_MT_AVG_BITRATE, &bitRate))) {
-      // H.264 asked for with no bit rate to encode at, from a device that sends H.264: its own
-      // packets are written, with its parameter sets when it has them apart from the packets.
-      hr = input->SetGUID(MF_MT_MAJOR_TYPE, MFMediaType_Video);
-      if (SUCCEEDED(hr)) hr = input->SetGUID(MF_MT_SUBTYPE, MFVideoFormat_H264);
-      if (SUCCEEDED(hr)) hr = MFSetAttributeSize(input.Get(), MF_MT_FRAME_SIZE, f.width, f.height);
-      if (SUCCEEDED(hr)) hr = MFSetAttributeRatio(input.Get(), MF_MT_FRAME_RATE, f.rate.num, f.rate.den);
-      if (SUCCEEDED(hr)) hr = input->SetUINT32(MF_MT_INTERLACE_MODE, MFVideoInterlace_Progressive);
-      const AVCodecParameters* delivered = device->input->delivered;
-      if (SUCCEEDED(hr) && delivered->extradata_size > 0)
-        hr = input->SetBlob(MF_MT_MPEG_SEQUENCE_HEADER, delivered->extradata,
-                            static_cast<UINT32>(delivered->extradata_size));
-      recording->videoPassthrough = true;
-    } else if (stream.video) {
-      // The encoder is given the engine's I420 pictures, or top-down BGRA rows made even (see
-      // evenpicture.h) for an odd-sized device.
-      const int width = evenpicture::evenSize(f.width);
-      const int height = evenpicture::evenSize(f.height);
-      recording->padded = width != f.width || height != f.height;
-      // libx264 counts its rate in whole kbit/s: a tiny picture's estimate would be none at all.
-      constexpr UINT32 lowestBitRate = 1000;
-      const bool slow = SUCCEEDED(stream.type->GetUINT32(MF_MT_AVG_BITRATE, &bitRate)) && bitRate < lowestBitRate;
-      if (recording->padded || slow) {
-        hr = MFCreateMediaType(output.ReleaseAndGetAddressOf());
-        if (SUCCEEDED(hr)) hr = stream.type->CopyAllItems(output.Get());
-        if (SUCCEEDED(hr)) hr = MFSetAttributeSize(output.Get(), MF_MT_FRAME_SIZE, width, height);
-        if (SUCCEEDED(hr) && slow) hr = output->SetUINT32(MF_MT_AVG_BITRATE, lowestBitRate);
-      }
-      if (SUCCEEDED(hr)) hr = input->SetGUID(MF_MT_MAJOR_TYPE, MFMediaType_Video);
-      if (SUCCEEDED(hr))
-        hr = input->SetGUID(MF_MT_SUBTYPE, recording->padded ? MFVideoFormat_RGB32 : MFVideoFormat_I420);
-      if (SUCCEEDED(hr)) hr = MFSetAttributeSize(input.Get(), MF_MT_FRAME_SIZE, width, height);
-      if (SUCCEEDED(hr)) hr = MFSetAttributeRatio(input.Get(), MF_MT_FRAME_RATE, f.rate.num, f.rate.den);
-      if (SUCCEEDED(hr))
-        hr = input->SetUINT32(MF_MT_DEFAULT_STRIDE, static_cast<UINT32>(recording->padded ? width * 4 : width));
-      if (SUCCEEDED(hr)) hr = input->SetUINT32(MF_MT_INTERLACE_MODE, MFVideoInterlace_Progressive);
-    } else {
-      UINT32 rate = 0, channels = 0;
-      stream.type->GetUINT32(MF_MT_AUDIO_SAMPLES_PER_SECOND, &rate);
-      stream.type->GetUINT32(MF_MT_AUDIO_NUM_CHANNELS, &channels);
-      if (!rate) rate = f.sampleRate;
-      if (!channels) channels = f.channels;
-      recording->audioRate = static_cast<int>(rate);
-      recording->audioChannels = static_cast<int>(channels);
-      hr = input->SetGUID(MF_MT_MAJOR_TYPE, MFMediaType_Audio);
-      if (SUCCEEDED(hr)) hr = input->SetGUID(MF_MT_SUBTYPE, MFAudioFormat_PCM);
-      if (SUCCEEDED(hr)) hr = input->SetUINT32(MF_MT_AUDIO_NUM_CHANNELS, channels);
-      if (SUCCEEDED(hr)) hr = input->SetUINT32(MF_MT_AUDIO_SAMPLES_PER_SECOND, rate);
-      if (SUCCEEDED(hr)) hr = input->SetUINT32(MF_MT_AUDIO_BITS_PER_SAMPLE, 16);
-      if (SUCCEEDED(hr)) hr = input->SetUINT32(MF_MT_AUDIO_BLOCK_ALIGNMENT, 2 * channels);
-      if (SUCCEEDED(hr)) hr = input->SetUINT32(MF_MT_AUDIO_AVG_BYTES_PER_SECOND, 2 * channels * rate);
-    }
-    if (SUCCEEDED(hr)) hr = recording->writer->AddStream(output.Get(), &index);
-    if (SUCCEEDED(hr)) hr = recording->writer->SetInputMediaType(index, input.Get(), nullptr);
-    if (FAILED(hr)) break;
-    if (stream.video) {
-      recording->videoStream = index;
-      recording->hasVideo = true;
-      recording->width = f.width;
-      recording->height = f.height;
-      recording->frameDuration = av_rescale(ticksPerSecond, f.rate.den, f.rate.num);
-    } else {
-      recording->audioStream = index;
-      recording->hasAudio = true;
-    }
-  }
+  for (const SinkStream& stream : order.streams)
+    if (SUCCEEDED(hr)) hr = addStream(*recording, stream);
   if (SUCCEEDED(hr)) hr = recording->writer->BeginWriting();
   if (FAILED(hr)) return hr;
   if (recording->videoPassthrough) {

@@ -116,6 +116,7 @@ class EngineThread {
   void closeDevices();
   void execute(Order& order);
   HRESULT startRecording(const Order& order);
+  HRESULT addStream(Recording& recording, const SinkStream& stream);
   void stopRecording(int64_t at);
   void finishDue(bool all);
   HRESULT finish(Recording& recording);
