@@ -15,8 +15,6 @@ extern "C" {
 
 namespace platform::engine {
 
-using capturedevice::DeviceFormat;
-
 namespace {
 
 // The pulse input stamps sound by the system clock, smoothed over its recent buffers: after a step

@@ -27,7 +27,6 @@ namespace platform::engine {
 
 namespace {
 
-using capturedevice::DeviceFormat;
 using capturedevice::Input;
 using capturedevice::openInput;
 using capturedevice::requestKeyFrame;

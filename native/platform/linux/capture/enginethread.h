@@ -23,6 +23,8 @@ extern "C" {
 
 namespace platform::engine {
 
+using capturedevice::DeviceFormat;
+
 constexpr LONGLONG ticksPerSecond = 10000000;  // media times are in 100 ns units
 
 // A sample over buffer, whose first length bytes fill(data) writes.
@@ -111,6 +113,7 @@ class EngineThread {
   void run();
 
  private:
+  // Commands, devices, and each clip's start and end (enginethread.cc).
   void send(const GUID& type, HRESULT status);
   HRESULT openDevices();
   void closeDevices();
@@ -121,20 +124,22 @@ class EngineThread {
   void finishDue(bool all);
   HRESULT finish(Recording& recording);
   int64_t nextDeadline() const;
-  bool soundCanComeBy(int64_t due) const;
   void fail(HRESULT status);
   void arrive(Arrival& arrival);
   void receive(Device& device, AVPacket* packet, int64_t readAt);
-  void passThrough(Recording& recording, const AVPacket* packet, AVRational timeBase, int64_t readAt);
-  static IMFMediaBuffer* pooledBuffer(std::vector<ComPtr<IMFMediaBuffer>>& pool, DWORD length);
-  void deliverVideo(AVFrame* frame, int64_t pts, AVRational timeBase, int64_t readAt);
-  void deliverAudio(AVFrame* frame, int64_t pts, AVRational timeBase, int64_t readAt);
-  void recordPicture(Recording& recording, IMFSample* bgra, IMFSample* i420, LONGLONG deviceTime, int64_t readAt);
-  void writeHeld(Recording& recording, LONGLONG duration);
-  void recordSound(Recording& recording, AVFrame* frame, int64_t capturedAt);
-  void writeSound(Recording& recording, const uint8_t* data, int samples);
   void write(Recording& recording, DWORD stream, IMFSample* sample);
   std::vector<Recording*> recordings();
+  // Pictures (enginevideo.cc).
+  static IMFMediaBuffer* pooledBuffer(std::vector<ComPtr<IMFMediaBuffer>>& pool, DWORD length);
+  void deliverVideo(AVFrame* frame, int64_t pts, AVRational timeBase, int64_t readAt);
+  void recordPicture(Recording& recording, IMFSample* bgra, IMFSample* i420, LONGLONG deviceTime, int64_t readAt);
+  void writeHeld(Recording& recording, LONGLONG duration);
+  void passThrough(Recording& recording, const AVPacket* packet, AVRational timeBase, int64_t readAt);
+  // Sound (engineaudio.cc).
+  bool soundCanComeBy(int64_t due) const;
+  void deliverAudio(AVFrame* frame, int64_t pts, AVRational timeBase, int64_t readAt);
+  void recordSound(Recording& recording, AVFrame* frame, int64_t capturedAt);
+  void writeSound(Recording& recording, const uint8_t* data, int samples);
 
   std::shared_ptr<EngineState> state_;
   std::unique_ptr<Recording> current_;                       // the clip being recorded

@@ -14,8 +14,6 @@ extern "C" {
 
 namespace platform::engine {
 
-using capturedevice::DeviceFormat;
-
 ComPtr<IMFSample> blackPicture(const Recording& recording) {
   ComPtr<IMFSample> sample;
   if (recording.padded) {  // top-down BGRA of the device's size
