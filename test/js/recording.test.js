@@ -316,8 +316,8 @@ test('a host recording clip after clip keeps its memory, threads and open files'
     const [early, late] = reports[0];
     // A leak grows round by round; a slow host may still be ending the early rounds' encoders when
     // it counts them, so fewer at the end is no fault.
-    const grown = `${early.threads} threads and ${early.files} files after 5 rounds, ${late.threads} and ${late.files} after 40`;
-    assert.ok(late.threads <= early.threads && late.files <= early.files, grown);
+    const counts = `${early.threads} threads and ${early.files} files after 5 rounds, ${late.threads} and ${late.files} after 40`;
+    assert.ok(late.threads <= early.threads && late.files <= early.files, counts);
     assert.ok(late.rss - early.rss <= 100, `${early.rss.toFixed(0)} MB after 5 rounds of clips, ${late.rss.toFixed(0)} MB after 40`);
   });
 });
